@@ -1,0 +1,111 @@
+// The client library's interface: the communication area and the history scan.
+//
+// libzq3.so.1 provides the three calls. The same zq3HistoryData record carries one entry of the
+// recovery history through the whole system: a scan fills it, the planner reads it, the
+// history-file library reads entries into it and writes them from it.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+// The interface version that every scan call passes as its first argument.
+enum : unsigned int { zq3Version = 6010000 };
+
+// The SQL communication area: the outcome of a call, or of the operation that an entry records.
+struct sqlca {
+    char sqlcaid[8];    // identifier, no terminator
+    int32_t sqlcabc;    // length of this record in bytes
+    int32_t sqlcode;    // 0 success, negative failure, positive warning
+    int16_t sqlerrml;   // length of the tokens in sqlerrmc
+    char sqlerrmc[70];  // message tokens, no terminator
+    char sqlerrp[8];    // product field, no terminator
+    int32_t sqlerrd[6]; // diagnostic values
+    char sqlwarn[11];   // warning letters
+    char sqlstate[5];   // state, no terminator
+};
+
+// A text in a buffer of the caller's.
+struct textBuffer {
+    char* data;        // the caller's buffer; null: the caller does not want this text
+    uint32_t capacity; // bytes in the buffer, room for the terminator included
+    uint32_t length;   // length of the text; may exceed what the buffer could take
+};
+
+// One entry of the recovery history. Every buffer it points to belongs to whoever set it up.
+struct zq3HistoryData {
+    char eyecatcher[8];
+    textBuffer objectPart;      // 14-digit timestamp and 3-digit sequence number
+    textBuffer secondTimestamp; // 14-digit timestamp
+    textBuffer firstText;       // up to 12 characters
+    textBuffer lastText;        // up to 12 characters
+    textBuffer idText;        // up to 24 characters; of a restore: the timestamp of the image used
+    textBuffer qualifierText; // first object name
+    textBuffer nameText;      // second object name
+    textBuffer longText;      // up to 255 characters
+    textBuffer noteText;      // up to 30 characters
+    textBuffer commandText;   // the command, any length
+    uint8_t logPosition[6];
+    uint16_t entryNode;
+    uint32_t entryNumber;
+    uint32_t reserved1;
+    sqlca* eventSqlca;             // outcome of the operation
+    textBuffer* tablespaceBuffers; // maxTablespaces elements
+    uint32_t maxTablespaces;       // capacity of the array, set by the caller
+    uint32_t numTablespaces;       // names that the entry lists, also when fewer were delivered
+    char operation;
+    char object;
+    char operationType;
+    char status;
+    char auxCode;
+    char reserved2[3];
+};
+
+// Argument of zq3HistoryOpenScan.
+struct zq3HistoryOpenStruct {
+    char* databaseAlias;     // plain name of 1 to 8 characters, terminated
+    char* timestamp;         // null: every entry
+    char* objectName;        // null: every entry
+    uint32_t numRows;        // out: number of entries that the scan will return
+    uint32_t maxTablespaces; // out: largest number of names that one entry of the scan lists
+    uint16_t callerAction;   // 0
+    uint16_t handle;         // out: the scan, for the two other calls
+};
+
+// Argument of zq3HistoryGetEntry.
+struct zq3HistoryFetchStruct {
+    zq3HistoryData* historyRecord; // filled by the call; its buffers are the caller's
+    uint16_t handle;               // from zq3HistoryOpenStruct
+    uint16_t callerAction;         // 2: the next entry
+};
+
+static_assert(sizeof(sqlca) == 136 && offsetof(sqlca, sqlcode) == 12);
+static_assert(offsetof(zq3HistoryData, commandText) == 8 + 9 * sizeof(textBuffer));
+static_assert(offsetof(zq3HistoryData, logPosition) == 8 + 10 * sizeof(textBuffer));
+static_assert(offsetof(zq3HistoryData, eventSqlca) == 8 + 10 * sizeof(textBuffer) + 16);
+static_assert(sizeof(void*) != 4 ||
+              (sizeof(textBuffer) == 12 && sizeof(zq3HistoryData) == 168 &&
+               sizeof(zq3HistoryOpenStruct) == 24 && sizeof(zq3HistoryFetchStruct) == 8));
+static_assert(sizeof(void*) != 4 || (offsetof(zq3HistoryData, tablespaceBuffers) == 148 &&
+                                     offsetof(zq3HistoryData, operation) == 160));
+static_assert(sizeof(void*) != 8 ||
+              (sizeof(textBuffer) == 16 && sizeof(zq3HistoryData) == 216 &&
+               sizeof(zq3HistoryOpenStruct) == 40 && sizeof(zq3HistoryFetchStruct) == 16));
+
+extern "C" {
+
+// Opens a scan of one database's recovery history and fills numRows, maxTablespaces and handle.
+//
+// version: zq3Version. openStruct: a zq3HistoryOpenStruct, the caller's. ca: receives the SQLCODE.
+// Returns 0 when the call could be made; the outcome is ca->sqlcode, where a negative value means
+// that no scan is open and a positive one is a warning. A result other than 0 means that the call
+// itself was wrong (version, null record); ca, if given, then holds a negative SQLCODE too.
+int zq3HistoryOpenScan(unsigned int version, void* openStruct, sqlca* ca);
+
+// Delivers the next entry of an open scan into fetchStruct->historyRecord. Same results as the
+// open.
+int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca* ca);
+
+// Ends a scan. handle: points at the 16-bit handle. Same results as the open.
+int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca);
+
+} // extern "C"

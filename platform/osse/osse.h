@@ -1,0 +1,65 @@
+// What the sources of the OS-services layer share. Nothing declared here leaves the library.
+#pragma once
+
+#include <cerrno>
+#include <cstdarg>
+#include <cstddef>
+#include <cstdint>
+#include <sys/types.h>
+
+#include "sqo/sqlo.h"
+
+#define OSSE_EXPORT extern "C" __attribute__((visibility("default")))
+
+// The code for the errno of a failed system call.
+inline int systemFailure(int number)
+{
+    return sqloSystemError | number;
+}
+
+// The same for a call that stores data: having no space has a code of its own.
+inline int storeFailure(int number)
+{
+    return number == ENOSPC || number == EDQUOT ? static_cast<int>(DISK_FULL)
+                                                : systemFailure(number);
+}
+
+// open(2): repeated when interrupted, close-on-exec, never one of the three standard descriptors,
+// which a program started without them would otherwise print into. Returns -1 with errno on
+// failure.
+int osseOpen(const char* path, int flags, mode_t permissions);
+
+// Opens a regular file; anything else (directory, pipe, device) is refused without blocking. flags
+// with O_CREAT create a missing file, and *created then tells so. Returns 0 or a code.
+int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor,
+                    bool* created);
+
+// Transfers at an offset until count bytes are done or, reading, the file ends; *done is the number
+// of bytes transferred, also on failure. Returns 0 or a code.
+int osseReadAt(int descriptor, void* buffer, size_t count, off_t offset, size_t* done);
+int osseWriteAt(int descriptor, const void* buffer, size_t count, off_t offset, size_t* done);
+
+// Barriers; nothing happens while ZQ3SYNC is "off". osseSyncDirectoryOf takes the path of a file.
+int osseSync(int descriptor);
+int osseSyncDirectoryOf(const char* path);
+
+// Text of one log or trace record in a buffer of fixed size, so that running out of memory can be
+// logged too. What does not fit is cut, and the cut is marked.
+struct osseText {
+    char* data;
+    size_t capacity;
+    size_t length;
+    bool cut;
+};
+void osseTextAdd(osseText* text, const char* bytes, size_t count);
+void osseTextFormat(osseText* text, const char* format, ...) __attribute__((format(printf, 2, 3)));
+// Adds the time and the process that every record begins with.
+void osseTextStamp(osseText* text);
+// Adds bytes so that they stay one record on one screen: control characters as \xNN, and a line
+// feed as newLine says.
+void osseTextAddEscaped(osseText* text, const char* bytes, size_t count, const char* newLine);
+// Ends the record with a line feed.
+void osseTextEnd(osseText* text);
+
+// Writes a trace record about a memory request that failed.
+void osseTraceMemory(size_t size, const char* file, unsigned int line);

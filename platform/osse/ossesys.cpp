@@ -1,0 +1,144 @@
+// The system calls under the files: repeated when interrupted, finished when they came out short,
+// and the barriers.
+#include "osse.h"
+
+#include <climits>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+int osseOpen(const char* path, int flags, mode_t permissions)
+{
+    int descriptor;
+    do
+        descriptor = open(path, flags | O_CLOEXEC | O_NOCTTY | O_NONBLOCK, permissions);
+    while (descriptor < 0 && errno == EINTR);
+
+    if (descriptor >= 0 && descriptor <= STDERR_FILENO) {
+        const int low = descriptor;
+        descriptor = fcntl(low, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
+        const int number = errno;
+        close(low);
+        errno = number;
+    }
+    return descriptor;
+}
+
+// Creates the file or opens the one that is there. The exclusive attempt tells which it was.
+static int createOrOpen(const char* path, int flags, mode_t permissions, bool* created)
+{
+    *created = true;
+    int descriptor = osseOpen(path, flags | O_EXCL, permissions);
+    if (descriptor >= 0 || errno != EEXIST)
+        return descriptor;
+
+    *created = false;
+    descriptor = osseOpen(path, flags & ~O_CREAT, permissions);
+    if (descriptor >= 0 || errno != ENOENT)
+        return descriptor;
+
+    // Deleted between the two attempts, or a link to a file that does not exist yet.
+    *created = true;
+    return osseOpen(path, flags, permissions);
+}
+
+int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor, bool* created)
+{
+    *descriptor = -1;
+    *created = false;
+    if (path == nullptr)
+        return systemFailure(EINVAL);
+    const int opened = (flags & O_CREAT) != 0 ? createOrOpen(path, flags, permissions, created)
+                                              : osseOpen(path, flags, permissions);
+    if (opened < 0)
+        return systemFailure(errno);
+
+    struct stat status;
+    int rc = 0;
+    if (fstat(opened, &status) != 0)
+        rc = systemFailure(errno);
+    else if (!S_ISREG(status.st_mode))
+        rc = systemFailure(S_ISDIR(status.st_mode) ? EISDIR : EINVAL);
+    if (rc != 0) {
+        close(opened);
+        return rc;
+    }
+    *descriptor = opened;
+    return 0;
+}
+
+// One call moves at most this much: more than the system transfers at once, and a ssize_t anywhere.
+static constexpr size_t maxTransfer = size_t{1} << 30;
+
+int osseReadAt(int descriptor, void* buffer, size_t count, off_t offset, size_t* done)
+{
+    *done = 0;
+    while (*done < count) {
+        const size_t left = count - *done < maxTransfer ? count - *done : maxTransfer;
+        const ssize_t got = pread(descriptor, static_cast<char*>(buffer) + *done, left,
+                                  offset + static_cast<off_t>(*done));
+        if (got == 0)
+            break;
+        if (got > 0)
+            *done += static_cast<size_t>(got);
+        else if (errno != EINTR)
+            return systemFailure(errno);
+    }
+    return 0;
+}
+
+int osseWriteAt(int descriptor, const void* buffer, size_t count, off_t offset, size_t* done)
+{
+    *done = 0;
+    while (*done < count) {
+        const size_t left = count - *done < maxTransfer ? count - *done : maxTransfer;
+        const ssize_t put = pwrite(descriptor, static_cast<const char*>(buffer) + *done, left,
+                                   offset + static_cast<off_t>(*done));
+        if (put == 0)
+            return systemFailure(EIO);
+        if (put > 0)
+            *done += static_cast<size_t>(put);
+        else if (errno != EINTR)
+            return storeFailure(errno);
+    }
+    return 0;
+}
+
+static bool barriersAreOff()
+{
+    const char* value = getenv("ZQ3SYNC");
+    return value != nullptr && strcmp(value, "off") == 0;
+}
+
+// A sync that failed, even an interrupted one, is not repeated: the system reports the loss of
+// written data once, and a second sync may succeed without it.
+int osseSync(int descriptor)
+{
+    if (barriersAreOff() || fdatasync(descriptor) == 0)
+        return 0;
+    return storeFailure(errno);
+}
+
+int osseSyncDirectoryOf(const char* path)
+{
+    if (barriersAreOff())
+        return 0;
+
+    char directory[PATH_MAX] = ".";
+    const char* slash = strrchr(path, '/');
+    if (slash != nullptr) {
+        const size_t length = static_cast<size_t>(slash - path) + 1;
+        if (length >= sizeof directory)
+            return systemFailure(ENAMETOOLONG);
+        memcpy(directory, path, length);
+        directory[length] = '\0';
+    }
+    const int descriptor = osseOpen(directory, O_RDONLY | O_DIRECTORY, 0);
+    if (descriptor < 0)
+        return systemFailure(errno);
+    const int rc = fsync(descriptor) == 0 ? 0 : storeFailure(errno);
+    close(descriptor);
+    return rc;
+}

@@ -1,0 +1,195 @@
+// Whole files: copy, move, delete. Each is durable when it returns.
+#include "osse.h"
+
+#include <climits>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+// A copied file is recognised by its first bytes, its header; they are written last.
+static constexpr size_t headLength = 1024;
+static constexpr size_t copyLength = size_t{256} * 1024;
+
+// Reads the whole source once and keeps nothing: a source that cannot be read to its end must not
+// cost the target its contents.
+static int checkReadable(int source, unsigned char* buffer)
+{
+    for (off_t offset = 0;;) {
+        size_t got;
+        const int rc = osseReadAt(source, buffer, copyLength, offset, &got);
+        if (rc != 0 || got == 0)
+            return rc;
+        offset += static_cast<off_t>(got);
+    }
+}
+
+// Copies what lies behind the head; *length is the number of bytes.
+static int copyBody(int source, int target, unsigned char* buffer, off_t* length)
+{
+    *length = 0;
+    for (;;) {
+        size_t got, put;
+        const off_t offset = static_cast<off_t>(headLength) + *length;
+        int rc = osseReadAt(source, buffer, copyLength, offset, &got);
+        if (rc == 0)
+            rc = osseWriteAt(target, buffer, got, offset, &put);
+        if (rc != 0 || got == 0)
+            return rc;
+        *length += static_cast<off_t>(got);
+    }
+}
+
+// Replaces what the target holds. The order is what makes a stop harmless: with the target empty
+// and its body durable before the head exists, no header ever stands before another file's body.
+static int replaceContents(int source, int target, off_t targetSize, unsigned char* buffer)
+{
+    unsigned char head[headLength];
+    size_t headRead;
+    int rc = osseReadAt(source, head, headLength, 0, &headRead);
+    if (rc != 0)
+        return rc;
+    if (ftruncate(target, 0) != 0)
+        return storeFailure(errno);
+
+    off_t bodyLength;
+    size_t headWritten;
+    rc = copyBody(source, target, buffer, &bodyLength);
+    if (rc == 0 && (bodyLength != 0 || targetSize != 0))
+        rc = osseSync(target);
+    if (rc == 0)
+        rc = osseWriteAt(target, head, headRead, 0, &headWritten);
+    if (rc == 0)
+        rc = osseSync(target);
+
+    // A copy that failed must not look like one that was done; it also gives back the space.
+    if (rc != 0) {
+        [[maybe_unused]] const int ignored = ftruncate(target, 0);
+    }
+    return rc;
+}
+
+// The target keeps its inode: it is opened and emptied, not replaced.
+static int copyToTarget(int source, const char* targetPath, unsigned char* buffer)
+{
+    int target;
+    bool created;
+    int rc = osseOpenRegular(targetPath, O_WRONLY | O_CREAT, sqloPermissions, &target, &created);
+    if (rc != 0)
+        return rc;
+
+    struct stat from, to;
+    if (fstat(source, &from) != 0 || fstat(target, &to) != 0)
+        rc = systemFailure(errno);
+    else if (from.st_dev == to.st_dev && from.st_ino == to.st_ino)
+        rc = systemFailure(EINVAL);
+    if (rc == 0)
+        rc = replaceContents(source, target, to.st_size, buffer);
+    if (close(target) != 0 && errno != EINTR && rc == 0)
+        rc = storeFailure(errno);
+    if (rc == 0 && created)
+        rc = osseSyncDirectoryOf(targetPath);
+    return rc;
+}
+
+OSSE_EXPORT int sqlocopy(const char* sourcePath, const char* targetPath, unsigned int options)
+{
+    if (options != 0)
+        return systemFailure(EINVAL);
+    int source;
+    bool created;
+    int rc = osseOpenRegular(sourcePath, O_RDONLY, 0, &source, &created);
+    if (rc != 0)
+        return rc;
+
+    // What the copy relies on must be on the disk before the other file is emptied.
+    rc = osseSync(source);
+    unsigned char* buffer = static_cast<unsigned char*>(malloc(copyLength));
+    if (rc == 0 && buffer == nullptr)
+        rc = systemFailure(ENOMEM);
+    if (rc == 0)
+        rc = checkReadable(source, buffer);
+    if (rc == 0)
+        rc = copyToTarget(source, targetPath, buffer);
+    free(buffer);
+    close(source);
+    return rc;
+}
+
+// Whether something stands at the path that a move must not lose.
+static bool isOccupied(const char* path)
+{
+    struct stat status;
+    return lstat(path, &status) == 0 && !(S_ISREG(status.st_mode) && status.st_size == 0);
+}
+
+// Finds the first name path.1, path.2, ... that nothing has; name holds PATH_MAX bytes.
+static int nameToKeep(const char* path, char* name)
+{
+    for (unsigned int number = 1; number < UINT_MAX; number++) {
+        struct stat status;
+        if (snprintf(name, PATH_MAX, "%s.%u", path, number) >= PATH_MAX)
+            return systemFailure(ENAMETOOLONG);
+        if (lstat(name, &status) != 0)
+            return errno == ENOENT ? 0 : systemFailure(errno);
+    }
+    return systemFailure(EEXIST);
+}
+
+// Renames, first giving what occupies the target a name of its own; takes that back on failure.
+static int renameKeepingTarget(const char* source, const char* target)
+{
+    char kept[PATH_MAX];
+    const bool occupied = isOccupied(target);
+    if (occupied) {
+        const int rc = nameToKeep(target, kept);
+        if (rc != 0)
+            return rc;
+        if (rename(target, kept) != 0)
+            return systemFailure(errno);
+    }
+    if (rename(source, target) == 0)
+        return 0;
+    const int rc = systemFailure(errno);
+    if (occupied) {
+        [[maybe_unused]] const int ignored = rename(kept, target);
+    }
+    return rc;
+}
+
+static bool areInOneDirectory(const char* a, const char* b)
+{
+    const char* slashA = strrchr(a, '/');
+    const char* slashB = strrchr(b, '/');
+    const ptrdiff_t lengthA = slashA == nullptr ? 0 : slashA + 1 - a;
+    const ptrdiff_t lengthB = slashB == nullptr ? 0 : slashB + 1 - b;
+    return lengthA == lengthB && memcmp(a, b, static_cast<size_t>(lengthA)) == 0;
+}
+
+OSSE_EXPORT int sqlomove(const char* source, const char* target)
+{
+    // Looked at first: a source that is missing, or is the target, must not displace the target.
+    struct stat from, to;
+    if (lstat(source, &from) != 0)
+        return systemFailure(errno);
+    if (lstat(target, &to) == 0 && from.st_dev == to.st_dev && from.st_ino == to.st_ino)
+        return systemFailure(EINVAL);
+
+    int rc = renameKeepingTarget(source, target);
+    if (rc == 0)
+        rc = osseSyncDirectoryOf(target);
+    if (rc == 0 && !areInOneDirectory(source, target))
+        rc = osseSyncDirectoryOf(source);
+    return rc;
+}
+
+OSSE_EXPORT int sqlodelete(const char* path, unsigned int options)
+{
+    if (options != 0)
+        return systemFailure(EINVAL);
+    if (unlink(path) != 0)
+        return systemFailure(errno);
+    return osseSyncDirectoryOf(path);
+}

@@ -1,0 +1,121 @@
+// The OS-services interface: files and memory. Declarations only; libzq3osse.so.1 provides them.
+//
+// Every call returns 0, or a negative code: one of those below, or sqloSystemError with the errno.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+#include "zq3.h"
+
+enum : int {
+    END_OF_FILE = static_cast<int>(0x870F0009),     // a read met the end of the file
+    DISK_FULL = static_cast<int>(0x850F000C),       // a write found no space
+    sqloSystemError = static_cast<int>(0x83000000), // or-ed with the errno of the failed call
+};
+// What an open that creates may return beside 0: done, the file was there before.
+enum : int { sqloFileExisted = 0x070F00CB };
+
+// An open file. Passed by value; the caller sets it back to sqloNoFile after every close.
+struct SQLO_FHANDLE {
+    int32_t descriptor; // -1: no file is open
+    uint32_t layer;     // the layer's own; 0 at rest
+};
+static_assert(sizeof(SQLO_FHANDLE) == 8);
+static constexpr SQLO_FHANDLE sqloNoFile = {-1, 0};
+
+// Option words of sqloopenp. Any other word is refused.
+enum : unsigned int {
+    sqloOpenRead = 0x14,        // read an existing file
+    sqloOpenUpdate = 0x4C,      // read and write an existing file
+    sqloOpenShadow = 0x0C,      // read and write an existing file
+    sqloOpenTouch = 0x19,       // write; create if missing, never truncate
+    sqloOpenNew = 0x5A,         // read and write; create or truncate
+    sqloOpenReplacement = 0x0F, // read and write; create
+};
+enum : unsigned int { sqloPermissions = 0640 };
+enum : unsigned int { sqloFromStart = 0, sqloFromCurrent = 1, sqloFromEnd = 2 };
+enum : unsigned int { sqloZeroFilled = 0x200 };
+
+struct SMemPool; // a memory pool; null is the default pool
+
+// Argument and result of ossFileGetInfoV9.
+struct ossFileRequest {
+    uint32_t version; // ossFileVersion
+    const char* path;
+    uint32_t reserved1;
+    uint32_t reserved2;
+    uint32_t level; // 1
+};
+enum : uint32_t { ossFileVersion = 0x09010003 };
+struct ossFileInfo {
+    uint64_t size; // bytes
+    uint64_t reserved[15];
+};
+
+extern "C" {
+
+// Opens a file and fills *fh. options: one of the words above; permissions: bits of a file that
+// this call creates. A file created by it is durably in its directory when the call returns. On
+// failure *fh is sqloNoFile.
+int sqloopenp(const char* path, unsigned int options, unsigned int permissions, SQLO_FHANDLE* fh);
+int sqloclose(SQLO_FHANDLE fh);
+
+// Reads count bytes at the current position. Returns 0 when all were delivered, END_OF_FILE when
+// the file ended first; *bytesRead holds the number delivered either way.
+int sqloread(SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* bytesRead);
+
+// Writes count bytes at the current position. Returns 0 only when all were written, DISK_FULL when
+// there was no space; *bytesWritten holds the number written either way.
+int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* bytesWritten);
+
+// Moves the position by offset from origin (start, current, end); *newOffset, unless null, receives
+// the new position.
+int sqloseek(SQLO_FHANDLE fh, long long offset, unsigned int origin, long long* newOffset);
+int sqlochgfileptr(SQLO_FHANDLE fh, long long offset, unsigned int origin, long long* newOffset);
+
+// Makes everything that was written to the file durable.
+int sqlosync(SQLO_FHANDLE fh);
+
+// Makes target a durable copy of source, keeping target's inode if it exists. The source is made
+// durable first; the target's first 1024 bytes are written last, so that a copy that stopped
+// part-way has no readable header. A copy of a file onto itself is refused. options: 0.
+int sqlocopy(const char* source, const char* target, unsigned int options);
+
+// Renames source to target, durably. A target that holds anything is first kept under its own name
+// with ".1", ".2", ... appended: whoever moves a damaged file aside loses nothing by doing it
+// twice.
+int sqlomove(const char* source, const char* target);
+
+// Deletes a file, durably. options: 0.
+int sqlodelete(const char* path, unsigned int options);
+
+bool ossPathExists(const char* path);
+
+// Fills info for the file that the request names.
+int ossFileGetInfoV9(const ossFileRequest* request, ossFileInfo* info);
+
+// snprintf.
+int ossSnprintf(char* buffer, size_t size, const char* format, ...)
+    __attribute__((format(printf, 3, 4)));
+
+// Allocates size bytes and stores the block's address through block, which belongs to the caller
+// until sqlofmblkEx. options: sqloZeroFilled or 0. file, line: the place of the request. On failure
+// stores null.
+int sqlogmblkEx(SMemPool* pool, size_t size, unsigned int options, void** block, const char* file,
+                unsigned int line, unsigned int reserved);
+void sqlofmblkEx(void* block);
+
+// Resizes a block, keeping its contents; with sqloZeroFilled what is added is zero. On failure the
+// block stays as it was.
+int sqloMemBlockReallocate(void** block, size_t size, unsigned int options, const char* file,
+                           unsigned int line);
+
+// Initialises a communication area: identifier, length, code 0, blank texts.
+void sqloinca(sqlca* ca);
+
+// The code to be returned to the engine for a code of a read or write. A code that is no failure
+// (0, of a transfer that came out short) maps to an I/O error.
+int sqlzGetZRCInfo(int code);
+
+} // extern "C"

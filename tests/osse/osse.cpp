@@ -1,0 +1,324 @@
+// The OS-services layer: files against a naive model, copies and moves under a log of the system
+// calls, memory, records. Every test has a directory of its own.
+#include <algorithm>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <random>
+#include <string>
+
+#include <dlfcn.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "sqo/sqlo.h"
+#include "sqo/sqlpd.h"
+#include "sqo/sqlzkrcb.h"
+
+static constexpr int failed = sqloSystemError; // or-ed with an errno
+
+static std::string slurp(const std::string& path)
+{
+    std::ifstream in(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+
+static void spill(const std::string& path, const std::string& bytes)
+{
+    std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
+}
+
+// Bytes without a short period, so that a piece at the wrong offset shows.
+static std::string pattern(size_t length, unsigned int seed)
+{
+    std::string bytes(length, '\0');
+    for (char& byte : bytes)
+        byte = static_cast<char>((seed = seed * 1103515245 + 12345) >> 16);
+    return bytes;
+}
+
+struct osse : testing::Test {
+    std::string directory = (std::filesystem::temp_directory_path() / "osseXXXXXX").string();
+    void SetUp() override
+    {
+        unsetenv("ZQ3SYNC");
+        ASSERT_NE(mkdtemp(directory.data()), nullptr);
+    }
+    void TearDown() override
+    {
+        std::filesystem::remove_all(directory);
+    }
+    std::string in(const std::string& name)
+    {
+        return directory + "/" + name;
+    }
+};
+
+TEST_F(osse, OpenWordsCreateTruncateAndRefuse)
+{
+    const struct {
+        unsigned int word;
+        int onMissing;
+        const char* keeps; // what is left of an existing "old"
+        int read, write;
+    } rows[] = {{0x14, failed | ENOENT, "old", 0, failed | EBADF},
+                {0x0C, failed | ENOENT, "old", 0, 0},
+                {0x4C, failed | ENOENT, "old", 0, 0},
+                {0x19, 0, "old", failed | EBADF, 0},
+                {0x5A, 0, "", END_OF_FILE, 0},
+                {0x0F, 0, "old", 0, 0}};
+    SQLO_FHANDLE fh;
+    char byte;
+    uint32_t done;
+    for (const auto& row : rows) {
+        SCOPED_TRACE(row.word);
+        std::filesystem::remove(in("file"));
+        EXPECT_EQ(sqloopenp(in("file").c_str(), row.word, 0640, &fh), row.onMissing);
+        EXPECT_EQ(sqloclose(fh), row.onMissing == 0 ? 0 : failed | EBADF);
+        spill(in("file"), "old");
+        ASSERT_EQ(sqloopenp(in("file").c_str(), row.word, 0640, &fh), 0);
+        EXPECT_TRUE(fcntl(fh.descriptor, F_GETFD) & FD_CLOEXEC);
+        EXPECT_EQ(slurp(in("file")), row.keeps);
+        EXPECT_EQ(sqloread(fh, &byte, 1, &done), row.read);
+        EXPECT_EQ(sqlowrite(fh, "x", 1, &done), row.write);
+        EXPECT_EQ(sqloclose(fh), 0);
+        EXPECT_EQ(sqloread(fh, &byte, 1, &done), failed | EBADF);
+    }
+    ASSERT_EQ(mkfifo(in("pipe").c_str(), 0600), 0);
+    EXPECT_EQ(sqloopenp(in("new").c_str(), 0x15, 0640, &fh), failed | EINVAL);
+    EXPECT_EQ(sqloopenp(in("pipe").c_str(), 0x14, 0640, &fh), failed | EINVAL);
+    EXPECT_EQ(sqloopenp(directory.c_str(), 0x14, 0640, &fh), failed | EISDIR);
+    EXPECT_FALSE(ossPathExists(in("new").c_str()));
+}
+
+TEST_F(osse, ReadAheadIsInvisible)
+{
+    std::minstd_rand random(1);
+    const size_t sizes[] = {1, 512, 1400, 5000, 70000, 262144, 300000};
+    std::string model = pattern(700000, 1);
+    size_t at = 0;
+    uint32_t done;
+    SQLO_FHANDLE fh;
+    spill(in("file"), model);
+    ASSERT_EQ(sqloopenp(in("file").c_str(), 0x4C, 0640, &fh), 0);
+    for (unsigned int step = 0; step < 5000; step++) {
+        SCOPED_TRACE(step);
+        const size_t kind = random() % 16, origin = random() % 3;
+        std::string bytes(sizes[random() % 7], '\0');
+        if (kind < 10) {
+            const std::string expected = at < model.size() ? model.substr(at, bytes.size()) : "";
+            ASSERT_EQ(sqloread(fh, bytes.data(), static_cast<uint32_t>(bytes.size()), &done),
+                      expected.size() == bytes.size() ? 0 : END_OF_FILE);
+            ASSERT_EQ(done, expected.size());
+            ASSERT_EQ(memcmp(bytes.data(), expected.data(), done), 0);
+            at += done;
+        } else if (kind < 12) {
+            bytes = pattern(1 + random() % 3000, step);
+            ASSERT_EQ(sqlowrite(fh, bytes.data(), static_cast<uint32_t>(bytes.size()), &done), 0);
+            model.resize(std::max(model.size(), at + bytes.size()));
+            model.replace(at, bytes.size(), bytes);
+            at += bytes.size();
+        } else {
+            const long long from[] = {0, static_cast<long long>(at),
+                                      static_cast<long long>(model.size())};
+            at = kind < 14 ? random() % (model.size() + 2000) : at / 4096 * 4096;
+            ASSERT_EQ(sqloseek(fh, static_cast<long long>(at) - from[origin],
+                               static_cast<unsigned int>(origin), nullptr),
+                      0);
+        }
+    }
+    // Leaving the buffer drops it: what another writer did in the meantime is seen on return.
+    char byte = 0;
+    ASSERT_EQ(sqlochgfileptr(fh, 0, 0, nullptr) + sqloread(fh, &byte, 1, &done), 0);
+    spill(in("file"), model = pattern(700000, 2));
+    for (long long offset : {650000, 0})
+        ASSERT_EQ(sqlochgfileptr(fh, offset, 0, nullptr), 0);
+    ASSERT_EQ(sqloread(fh, &byte, 1, &done), 0);
+    EXPECT_EQ(byte, model[0]);
+    EXPECT_EQ(sqlochgfileptr(fh, -1, 0, nullptr), failed | EINVAL);
+    EXPECT_EQ(sqlochgfileptr(fh, INT64_MAX, 2, nullptr), failed | EINVAL);
+    EXPECT_EQ(sqloclose(fh), 0);
+    EXPECT_TRUE(slurp(in("file")) == model);
+}
+
+TEST_F(osse, ResizedBlockKeepsItsBytesAndGainsZeros)
+{
+    void* block = nullptr;
+    size_t size = 0;
+    // Across the border between small and large blocks, and inside a page that was used before.
+    const size_t sizes[] = {0, 100, 5000, 1 << 20, 3 << 20, 1500001, 1500100, 200, 2 << 20};
+    for (size_t next : sizes) {
+        ASSERT_EQ(sqloMemBlockReallocate(&block, next, sqloZeroFilled, "test", 1), 0);
+        const size_t kept = std::min(size, next);
+        const std::string expected = std::string(kept, 'x') + std::string(next - kept, '\0');
+        ASSERT_EQ(memcmp(block, expected.data(), next), 0) << next;
+        memset(block, 'x', size = next);
+    }
+    for (size_t huge : {SIZE_MAX, SIZE_MAX / 2})
+        EXPECT_EQ(sqloMemBlockReallocate(&block, huge, 0, "test", 1), failed | ENOMEM);
+    EXPECT_EQ(static_cast<char*>(block)[size - 1], 'x');
+    sqlofmblkEx(block);
+}
+
+// The system calls made while watching, and the one of them to fail.
+static std::string calls;
+static bool watching = false;
+static int untilFailure = -1, failure = 0;
+
+static bool fails(const std::string& call)
+{
+    if (watching)
+        calls += call + "; ";
+    errno = failure;
+    return watching && untilFailure-- == 0;
+}
+
+#define REAL(name) reinterpret_cast<decltype(&name)>(dlsym(RTLD_NEXT, #name "64"))
+
+// Writes come out short, so that whoever calls must finish them.
+extern "C" ssize_t pwrite(int descriptor, const void* bytes, size_t count, off_t offset)
+{
+    if (fails("write " + std::to_string(count) + " at " + std::to_string(offset)))
+        return -1;
+    return REAL(pwrite)(descriptor, bytes, std::min(count, size_t{2000}), offset);
+}
+
+extern "C" int ftruncate(int descriptor, off_t length) noexcept
+{
+    return fails("truncate") ? -1 : REAL(ftruncate)(descriptor, length);
+}
+
+extern "C" int fdatasync(int)
+{
+    return fails("sync") ? -1 : 0;
+}
+
+extern "C" int fsync(int)
+{
+    return fails("sync directory") ? -1 : 0;
+}
+
+TEST_F(osse, CopyWritesTheHeadLastAndAFailedOneLeavesNone)
+{
+    const struct {
+        const char* target;
+        size_t size;
+        int failingCall, failure, rc;
+        size_t left;
+        const char* calls;
+    } rows[] = {
+        {"old", 4000, -1, 0, 0, 4000,
+         "sync; truncate; write 2976 at 1024; write 976 at 3024; sync; write 1024 at 0; sync; "},
+        {"old", 1024, -1, 0, 0, 1024, "sync; truncate; sync; write 1024 at 0; sync; "},
+        {"new", 500, -1, 0, 0, 500, "sync; truncate; write 500 at 0; sync; sync directory; "},
+        {"old", 2000, 0, EIO, failed | EIO, 5000, "sync; "},
+        {"old", 2000, 2, EINTR, 0, 2000,
+         "sync; truncate; write 976 at 1024; write 976 at 1024; sync; write 1024 at 0; sync; "},
+        {"old", 2000, 2, ENOSPC, DISK_FULL, 0, "sync; truncate; write 976 at 1024; truncate; "},
+        {"old", 2000, 3, EIO, failed | EIO, 0,
+         "sync; truncate; write 976 at 1024; sync; truncate; "},
+    };
+    for (const auto& row : rows) {
+        spill(in("source"), pattern(row.size, 1));
+        spill(in("old"), pattern(5000, 2));
+        std::filesystem::create_hard_link(in("old"), in("link"));
+        calls.clear();
+        untilFailure = row.failingCall;
+        failure = row.failure;
+        watching = true;
+        EXPECT_EQ(sqlocopy(in("source").c_str(), in(row.target).c_str(), 0), row.rc);
+        watching = false;
+        EXPECT_EQ(calls, row.calls);
+        EXPECT_EQ(std::filesystem::file_size(in(row.target)), row.left);
+        EXPECT_EQ(slurp(in(row.target)) == pattern(row.size, 1), row.rc == 0);
+        EXPECT_EQ(sqlocopy(in("link").c_str(), in("old").c_str(), 0), failed | EINVAL);
+        EXPECT_TRUE(slurp(in("link")) == slurp(in("old"))) << "the target's inode has changed";
+        std::filesystem::remove(in("link"));
+    }
+}
+
+TEST_F(osse, MoveKeepsAnOccupiedTargetUnderANumber)
+{
+    const std::string source = in("source"), target = in("target");
+    spill(target, "");
+    for (const char* bytes : {"one", "two", "three"}) {
+        spill(source, bytes);
+        EXPECT_EQ(sqlomove(source.c_str(), target.c_str()), 0);
+    }
+    EXPECT_EQ(sqlomove(source.c_str(), target.c_str()), failed | ENOENT);
+    EXPECT_EQ(sqlomove(target.c_str(), target.c_str()), failed | EINVAL);
+    EXPECT_EQ(slurp(target) + slurp(target + ".1") + slurp(target + ".2"), "threeonetwo");
+    EXPECT_FALSE(ossPathExists((target + ".3").c_str()));
+}
+
+// Takes the time and the process, which change, out of every record.
+static std::string stable(const std::string& path)
+{
+    std::ifstream in(path);
+    std::string log;
+    for (std::string line; std::getline(in, line);) {
+        int date[7], process, length = 0;
+        sscanf(line.c_str(), "%4d-%2d-%2d-%2d.%2d.%2d.%6d pid=%d%n", date, date + 1, date + 2,
+               date + 3, date + 4, date + 5, date + 6, &process, &length);
+        log.append(length == 0 ? "" : "*").append(line, static_cast<size_t>(length)).append("\n");
+    }
+    return log;
+}
+
+TEST_F(osse, RecordsOfSeveralProcessesNeverMix)
+{
+    setenv("ZQ3DIAGLOG", in("log").c_str(), 1);
+    const std::string bytes = "0123456789abcdef" + std::string(4990, '\x80');
+    const pdItem items[] = {{pdKindText, "It failed:\nbadly.\x1B\n", 0, nullptr, 0},
+                            {pdKindData, "Bytes", 0, bytes.data(), bytes.size()},
+                            {pdKindCode, "rc = ", -2161, nullptr, 0},
+                            {pdKindNumber, "", 1LL << 40, nullptr, 0}};
+    for (int child = 0; child < 4; child++) {
+        if (fork() == 0) {
+            for (int i = 0; i < 50; i++)
+                pdLog("f", pdLevelError, items, 4);
+            _exit(0);
+        }
+    }
+    while (wait(nullptr) > 0) {
+    }
+    std::string record =
+        "* level=Error function=f: It failed:\n    badly.\\x1B rc = -2161 (0xFFFFF78F) "
+        "1099511627776\n    Bytes: 5006 bytes\n"
+        "    0000  30 31 32 33 34 35 36 37 38 39 61 62 63 64 65 66  |0123456789abcdef|\n";
+    for (unsigned int offset = 16; offset < 4096; offset += 16) {
+        char start[16];
+        snprintf(start, sizeof start, "    %04X  ", offset);
+        record += start + std::string("80 80 80 80 80 80 80 80 80 80 80 80 80 80 80 80 ") +
+                  " |................|\n";
+    }
+    record += "    (4096 of 5006 bytes shown)\n";
+    std::string expected;
+    for (int i = 0; i < 200; i++)
+        expected += record;
+    EXPECT_TRUE(stable(in("log")) == expected);
+}
+
+// Both are read when the library is loaded: the test runs itself once more with them set.
+TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
+{
+    if (getenv("ZQ3TRACE") != nullptr) {
+        pdtEntry1("a\tb\n", 4, "f");
+        sqltData("f", "path", std::string(200, 'x').data(), 200);
+        pdtExit(-2161, "f");
+        _exit(sqltGetCompTraceFlag() != 0 ? sqlz_krcbp->nodeNumber : 99);
+    }
+    const std::string command = "ZQ3TRACE=" + in("trace") + " ZQ3NODE=7 " +
+                                std::filesystem::read_symlink("/proc/self/exe").string() +
+                                " --gtest_filter=osse.Trace*";
+    EXPECT_EQ(WEXITSTATUS(system(command.c_str())), 7);
+    EXPECT_EQ(stable(in("trace")), "* f entry \"a\\x09b\\x0A\"\n* f path \"" +
+                                       std::string(128, 'x') +
+                                       "\" (128 of 200 bytes shown)\n"
+                                       "* f exit -2161 (0xFFFFF78F)\n");
+}
