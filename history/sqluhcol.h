@@ -1,0 +1,102 @@
+// Taking canonical text apart by column: eight characters at a time, as one 64-bit word.
+//
+// These decide only whether a text stands exactly as the writer writes it and what it then says.
+// What they refuse goes through the scanning formats, which accept more.
+#pragma once
+
+#include <bit>
+#include <cstdint>
+#include <cstring>
+
+// The eight characters at text, the first in the lowest byte.
+static inline uint64_t columnsAt(const char* text)
+{
+    uint64_t word;
+    memcpy(&word, text, sizeof word);
+    if constexpr (std::endian::native == std::endian::big)
+        word = __builtin_bswap64(word);
+    return word;
+}
+
+static constexpr uint64_t everyByte(uint64_t value)
+{
+    return value * 0x0101010101010101;
+}
+
+// Reads eight hexadecimal digits of either case; false when another character stands among them.
+static inline bool hexColumns(const char* text, uint32_t* value)
+{
+    uint64_t word = columnsAt(text);
+    uint64_t letter = word >> 6 & everyByte(0x01); // 1 where the character is no decimal digit
+    uint64_t nibble = word & everyByte(0x0F);
+    uint64_t digit = nibble + letter * 9;
+    // 0x3n, or for a letter 0x4n or 0x6n; digits 0 to 9, letters 1 to 6.
+    uint64_t zone = word & (everyByte(0xF0) ^ letter << 5);
+    uint64_t wrong = zone ^ (everyByte(0x30) ^ letter * 0x70);
+    wrong |= (nibble + everyByte(0x06) + letter * 3) & everyByte(0x10);
+    wrong |= ~(nibble + everyByte(0x0F)) >> 4 & letter;
+    if (wrong != 0)
+        return false;
+    digit = (digit << 4 | digit >> 8) & 0x00FF00FF00FF00FF;
+    digit = (digit << 8 | digit >> 16) & 0x0000FFFF0000FFFF;
+    *value = static_cast<uint32_t>(digit << 16 | digit >> 32);
+    return true;
+}
+
+// Reads eight decimal digits; false when another character stands among them.
+static inline bool decimalColumns(const char* text, uint32_t* value)
+{
+    uint64_t digits = columnsAt(text) ^ everyByte('0');
+    if (((digits + everyByte(0x76)) | digits) & everyByte(0x80))
+        return false;
+    digits = digits * 10 + (digits >> 8); // every second byte now holds a pair, 0 to 99
+    uint64_t high = (digits & 0x000000FF000000FF) * 0x000F424000000064;       // 10^6 and 10^2
+    uint64_t low = (digits >> 16 & 0x000000FF000000FF) * 0x0000271000000001; // 10^4 and 1
+    *value = static_cast<uint32_t>((high + low) >> 32);
+    return true;
+}
+
+// A bit for each of the first count (1 to 8) characters: set where it is printable and no blank.
+// *strange becomes nonzero where one is neither printable ASCII nor a blank.
+static inline uint32_t wordColumns(const char* text, uint32_t count, uint64_t* strange)
+{
+    uint64_t used = count == 8 ? ~uint64_t{0} : (uint64_t{1} << 8 * count) - 1;
+    uint64_t word = columnsAt(text);
+    uint64_t notBlank = (word ^ everyByte(' ')) + everyByte(0x7F);
+    // Below 0x20, 0x7F and above 0x7F.
+    *strange |=
+        (~(word + everyByte(0x60)) | (word + everyByte(0x01)) | word) & used & everyByte(0x80);
+    uint64_t flags = (notBlank & used & everyByte(0x80)) >> 7;
+    return static_cast<uint32_t>(flags * 0x0102040810204080 >> 56); // flag i moves to bit i
+}
+
+// The length of a field's text when it is one word of printable ASCII with blanks behind it up to
+// width (at most 24) and 7 more readable characters behind them; 0 when it is anything else.
+// Whatever a locale calls white space, the scanning format takes such a field the same way.
+template <uint32_t width> static inline uint32_t wordLength(const char* text)
+{
+    static_assert(width <= 24);
+    uint64_t strange = 0;
+    uint32_t used = wordColumns(text, width < 8 ? width : 8, &strange);
+    if constexpr (width > 8)
+        used |= wordColumns(text + 8, width < 16 ? width - 8 : 8, &strange) << 8;
+    if constexpr (width > 16)
+        used |= wordColumns(text + 16, width - 16, &strange) << 16;
+    bool oneWord = (used & (used + 1)) == 0;
+    return strange == 0 && oneWord ? static_cast<uint32_t>(std::countr_one(used)) : 0;
+}
+
+// memcpy for the short texts that entries are full of: two overlapping moves instead of a call.
+static inline void copyShort(char* target, const char* from, size_t length)
+{
+    if (length >= 8 && length <= 16) {
+        uint64_t head;
+        uint64_t tail;
+        memcpy(&head, from, sizeof head);
+        memcpy(&tail, from + length - sizeof tail, sizeof tail);
+        memcpy(target, &head, sizeof head);
+        memcpy(target + length - sizeof tail, &tail, sizeof tail);
+    } else {
+        memcpy(target, from, length);
+    }
+}

@@ -1,0 +1,50 @@
+// Creation of a new, empty pair of files.
+
+#include <cstring>
+
+#include "history/sqluhist.h"
+#include "history/sqluhlog.h"
+#include "sqo/sqlzkrcb.h"
+
+static void initialHeader(SQLUH_HEADER* header)
+{
+    memset(header, 0, sizeof *header);
+    header->nodeNumber = static_cast<uint16_t>(sqlz_krcbp->nodeNumber);
+    header->status = statusConsistent;
+    header->number15 = 1;
+    memcpy(header->timestamp, SQLUH_EMPTY_TIMESTAMP, timestampWidth);
+}
+
+int sqluhCreate(char* directory)
+{
+    pdtEntry1(directory, strlen(directory));
+
+    char historyPath[createPathCapacity] = {};
+    char shadowPath[createPathCapacity] = {};
+    SQLO_FHANDLE fh = sqloNoFile;
+    SQLUH_HEADER header;
+    int rc = 0;
+
+    if (strlen(directory) > maxCreateDirectoryLength) {
+        rc = logged(sqluhPathTooLong);
+    } else {
+        ossSnprintf(historyPath, sizeof historyPath, "%s" SQLUH_HISTORY_NAME, directory);
+        ossSnprintf(shadowPath, sizeof shadowPath, "%s" SQLUH_SHADOW_NAME, directory);
+        rc = sqloopenp(historyPath, sqloOpenNew, sqloPermissions, &fh);
+        if (rc == sqloFileExisted)
+            rc = 0;
+        logged(rc);
+    }
+    if (rc == 0) {
+        initialHeader(&header);
+        rc = logged(sqluhWriteHeader(fh, &header));
+        bool written = rc == 0;
+        rc = firstOf(rc, logged(sqloclose(fh)));
+        // The shadow comes into being as the copy of a complete history file, never before it.
+        if (written)
+            rc = firstOf(rc, logged(sqlocopy(historyPath, shadowPath, 0)));
+    }
+
+    pdtExit(rc);
+    return rc;
+}

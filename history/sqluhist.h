@@ -1,0 +1,446 @@
+// The recovery-history library: file format, records, codes and entry points.
+//
+// A history directory holds the history file and its shadow, two files of one format: a header of
+// 1024 bytes, then entry records back to back to the end of the file. Directories are given as
+// strings that end with the path separator.
+//
+// Every function returns 0, a negative failure or a positive warning that still delivers. Beside
+// the codes listed at a function, every call that touches a file, memory or the lock may return the
+// code of the OS-services call that failed.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+#include "sqo/sqlo.h"
+#include "sqo/sqlonlck.h"
+#include "zq3.h"
+
+enum : int {
+    HISTORY_FILE_DAMAGED = -2161,     // a record is damaged, incomplete or cannot be formatted
+    HISTORY_FILE_MISSING = -2036,     // the directory holds no history file
+    HISTORY_FILE_RECREATED = 2160,    // both files were unusable: moved aside, an empty pair made
+    TABLESPACE_LIST_TRUNCATED = 2165, // more tablespaces than the caller's buffers hold
+    HISTORY_WARNING = 2172,           // an error turned into a warning by sqluh_build_warning
+};
+
+// What a path that does not fit the fixed path buffers is refused with.
+enum : int { sqluhPathTooLong = sqloSystemError | 36 }; // ENAMETOOLONG
+
+// --- The files -----------------------------------------------------------------------------------
+
+#define SQLUH_HISTORY_NAME "zq3rhist.asc"
+#define SQLUH_SHADOW_NAME "zq3rhist.bak"
+#define SQLUH_SAVED_HISTORY_NAME "zq3rhist.a" // a damaged history file, moved aside
+#define SQLUH_SAVED_SHADOW_NAME "zq3rhist.b"  // a damaged shadow, moved aside
+
+enum : unsigned int {
+    pathCapacity = 1024,
+    maxDirectoryLength = pathCapacity - sizeof SQLUH_HISTORY_NAME, // 1011
+    createPathCapacity = 256,
+    maxCreateDirectoryLength = createPathCapacity - sizeof SQLUH_HISTORY_NAME, // 243
+};
+
+enum : uint32_t { currentVersion = 9010300 };
+
+// Header status letters. A file is usable when its header reads and its status is blank or 'C'.
+enum : char {
+    statusConsistent = ' ', // nothing is unfinished
+    statusPending = 'P', // history: a batch is in progress; shadow: the history is rebuilt from it
+    statusCommitted = 'C', // the history file holds a complete batch that the shadow may lack
+};
+
+#define SQLUH_EMPTY_TIMESTAMP "00000101000000"
+#define SQLUH_EMPTY_WORD "-"
+
+// --- The header record ---------------------------------------------------------------------------
+
+enum : uint32_t { headerLength = 1024 };
+
+// Offsets in the header's text of the fields that are read by position.
+enum : uint32_t {
+    headerVersionAt = 134,
+    headerNumber15At = 143,
+    headerTimestampAt = 152,
+    headerMaxCommandAt = 167,
+    headerMaxCommandAtNoTimestamp = 153, // field 16 shrank to "-"
+    headerMaxCommandAt7020200 = 152,     // versions below 7020200 have no field 16
+    headerMaxCommandAt6010000 = 143,     // versions below 6010000 have no field 15 either
+    headerNumberWidth = 8,
+    timestampWidth = 14,
+};
+
+static constexpr char headerFormat[] =
+    "%8.8X:%16.16llX:%16.16llX:%16.16llX:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8hX:%c:"
+    "%8.8u:%8.8X:%-14.14s:%8.8X:%79.79s\n%255.255s\n%255.255s\n%255.255s\n";
+static constexpr char headerScanFormat[] =
+    "%8x:%16llx :%16llx :%16llx :%8x:%8x:%8x:%8x:%8x:%8x:%8x:%8hx:%c:";
+
+// The header in memory. Its 92 bytes, integers little-endian, are what the header's checksum is
+// taken over, so the layout is part of the file format; packing keeps the size at 92 where 64-bit
+// integers are aligned to 8 bytes.
+#pragma pack(push, 4)
+struct SQLUH_HEADER {
+    uint32_t checksum;
+    uint32_t reserved1;
+    uint64_t offset1;
+    uint64_t offset2;
+    uint64_t offset3; // of an entry record; 0: none
+    uint32_t version;
+    uint32_t entryCount;
+    uint32_t number6;
+    uint32_t number7;
+    uint32_t number15;
+    uint32_t number8; // bounds the tablespaces of an entry
+    uint32_t number9;
+    uint32_t number10;
+    uint32_t number11;
+    uint16_t nodeNumber;
+    char status;
+    char reserved2;
+    char timestamp[14]; // no terminator
+    char reserved3[2];
+    uint32_t maxCommandLength; // of any entry, in characters
+};
+#pragma pack(pop)
+enum : uint32_t {
+    headerImageLength = 92,
+    headerImageLength7020200 = 72, // checksum coverage of versions 7020200 to below 8010000
+    headerImageLengthShort = 88,   // second chance for every version
+};
+static_assert(sizeof(SQLUH_HEADER) == headerImageLength);
+static_assert(offsetof(SQLUH_HEADER, offset1) == 8 && offsetof(SQLUH_HEADER, version) == 32);
+static_assert(offsetof(SQLUH_HEADER, entryCount) == 36 && offsetof(SQLUH_HEADER, number15) == 48);
+static_assert(offsetof(SQLUH_HEADER, nodeNumber) == 68 && offsetof(SQLUH_HEADER, status) == 70);
+static_assert(offsetof(SQLUH_HEADER, timestamp) == 72);
+static_assert(offsetof(SQLUH_HEADER, maxCommandLength) == 88);
+
+// --- The entry record ----------------------------------------------------------------------------
+
+enum : uint32_t {
+    lineLength = 256,
+    lineTextLength = 255, // characters of a line before its line feed
+    entryFixedLength = 512,
+    entryMinLength = 768, // the fixed part and the note line
+    entryNoteAt = 512,
+    entryLongTextAt = 768,
+    tablespaceNameAt = 9,     // the name's place in its line, behind eight digits and a colon
+    tablespaceLineExtra = 10, // what a line is longer than its name
+    sqlcaLineLength = 194,
+    commandPieceLength = 255,
+    maxNoteLength = 30, // what a reader keeps
+    maxLongTextLength = 255,
+    defaultWorkAreaSize = 2107648,
+    workAreaPerTablespace = 28, // line length of a tablespace with an 18-character name
+};
+
+// A field of the entry's fixed part: where it stands, how wide it is.
+struct sqluhField {
+    uint16_t at;
+    uint16_t width;
+};
+// Fields 1 to 23 in order; a colon stands behind each.
+enum : unsigned int {
+    fieldChecksum,
+    fieldNode,
+    fieldNumber,
+    fieldSize,
+    fieldVersion,
+    fieldStatus,
+    fieldNoteLength,
+    fieldLongTextLength,
+    fieldQualifierLength,
+    fieldNameLength,
+    fieldNumTablespaces,
+    fieldSqlcaLength,
+    fieldCommandLength,
+    fieldOperation,
+    fieldObject,
+    fieldOperationType,
+    fieldObjectPart,
+    fieldSecondTimestamp,
+    fieldFirstText,
+    fieldLastText,
+    fieldLogPosition,
+    fieldIdText,
+    fieldAuxCode,
+    entryFieldCount
+};
+static constexpr sqluhField entryFields[entryFieldCount] = {
+    {0, 8},    {9, 4},    {14, 8},   {23, 8},   {32, 8},   {41, 1},   {43, 8},  {52, 8},
+    {61, 8},   {70, 8},   {79, 8},   {88, 8},   {97, 8},   {256, 1},  {258, 1}, {260, 1},
+    {262, 17}, {280, 14}, {295, 12}, {308, 12}, {321, 12}, {334, 24}, {359, 1},
+};
+enum : uint32_t { entryReserved1At = 106, entryReserved1Length = 149 };
+
+static constexpr char entryFormat[] =
+    "%8.8X:%4.4hX:%8.8X:%8.8X:%8.8u:%c:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%149.149s\n"
+    "%c:%c:%c:%-17.17s:%-14.14s:%-12.12s:%-12.12s:%-12.12s:%-24.24s:%c:%150.150s\n";
+static constexpr char entryScanFormat[] = "%8x:%4hx:%8x:%8x:%8u:%c:%8x:%8x:%8x:%8x:%8x:%8x:%8x:\n"
+                                          "%c:%c:%c:%17s :%14s :%12s :%12s :%12s :%24s :%c:\n";
+static constexpr char logPositionFormat[] = "%2.2X%2.2X%2.2X%2.2X%2.2X%2.2X";
+static constexpr char lineFormat[] = "%-255.255s\n";
+static constexpr char objectNamesFormat[] = "%-*.*s\n%-*.*s\n";
+static constexpr char tablespaceFormat[] = "%8.8X:%-*.*s\n";
+static constexpr char commandPieceFormat[] = "%-*.*s\n";
+static constexpr char sqlcaFormat[] = "%-8.8s%10.10i%+10.10i%4.4hX%-70.70s%-8.8s"
+                                      "%+10.10i%+10.10i%+10.10i%+10.10i%+10.10i%+10.10i"
+                                      "%c%c%c%c%c%c%c%c%c%c%c%-5.5s\n";
+static constexpr char checksumFormat[] = "%8.8X";
+
+// Members of the sqlca line: where each stands, how wide it is.
+static constexpr sqluhField sqlcaIdField = {0, 8}, sqlcaBcField = {8, 10},
+                            sqlcaCodeField = {18, 11}, sqlcaErrmlField = {29, 4},
+                            sqlcaErrmcField = {33, 70}, sqlcaErrpField = {103, 8},
+                            sqlcaErrdField = {111, 11}, // six of them
+    sqlcaWarnField = {177, 11}, sqlcaStateField = {188, 5};
+
+// One entry: the numbers of its fixed part, and its contents.
+struct SQLUH_ENTRY {
+    uint32_t checksum;
+    uint32_t size; // of the whole record in bytes
+    uint32_t version;
+    uint32_t noteLength;
+    uint32_t longTextLength;
+    uint32_t qualifierLength;
+    uint32_t nameLength;
+    uint32_t sqlcaLength;   // 0 or 194
+    uint32_t commandLength; // in characters
+    zq3HistoryData* data;   // the caller's
+};
+
+// The buffer that entry records are read into. size is always the capacity of buffer.
+struct SQLUH_WORKAREA {
+    char* buffer; // from sqlogmblkEx; the owner releases it with sqlofmblkEx
+    uint32_t size;
+};
+
+// Bits of the reader's match flags.
+enum : unsigned int {
+    matchQualifier = 0x01,
+    matchName = 0x02,
+    matchTablespace = 0x04,
+    matchFilterLater = 0x08, // the timestamp filter is greater than the entry's timestamp
+    matchFilterEqual = 0x10,
+    matchFilterEarlier = 0x20,
+    matchSqlcodeSet = 0x40, // the entry's sqlca line holds an sqlcode that is not 0
+};
+
+// The checksum of both record kinds: the exclusive-or of the buffer's 32-bit little-endian words,
+// the last partial word padded with zeros. The buffer need not be aligned.
+uint32_t sqluhChecksum(void* buffer, unsigned int length);
+
+// sprintf under the "C" locale: returns the number of characters formatted, the terminator not
+// counted. Switches LC_CTYPE of the whole process for the duration of the call, unless it is "C".
+int sqluhSprintf(char* buffer, const char* format, ...) __attribute__((format(printf, 2, 3)));
+
+// --- Reading and writing records -----------------------------------------------------------------
+// fh is an open history file; these functions neither open nor close it.
+
+// Writes the header at offset 0 and leaves the file at 1024. Sets the record's version to the
+// current one and its checksum. Returns 0; HISTORY_FILE_DAMAGED when it could not be formed or
+// fewer bytes were written; a failed write's code as sqlzGetZRCInfo maps it.
+int sqluhWriteHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header);
+
+// Reads the header into *header, converting those of older versions, and leaves the file at 1024.
+// The record's checksum is 0 afterwards. Returns 0; END_OF_FILE for a file of 0 bytes;
+// HISTORY_FILE_DAMAGED; a failed read's code as sqlzGetZRCInfo maps it. After a failure *header may
+// hold part of a header and must not be used.
+int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header);
+
+// Tells whether the record's checksum matches; leaves the member 0.
+bool sqluhCheckHeaderChecksum(SQLUH_HEADER* header);
+
+// Stores the length in characters of the longest command text of all entries (on failure: of those
+// read so far) and leaves the file at 1024. Returns 0 or the reader's code.
+int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength);
+
+// Positions the file at its first entry; stores the new offset.
+int sqluhRewind(SQLO_FHANDLE fh, long long* newOffset);
+
+// Allocates a work area of size bytes, zero-filled. On failure the record stays as it was.
+int sqluhInitWorkArea(SQLUH_WORKAREA* workArea, uint32_t size);
+
+// Reads the entry at the file's position and leaves the file behind it.
+//
+// entry: its data member points to the record to fill, whose buffers are the caller's. workArea: at
+// least 512 bytes; grown, and kept so, when an entry is larger. The filters may be null; matchFlags
+// receives the bits above. A text is cut to its buffer and terminated; its length member tells the
+// length in the file.
+// Returns 0; TABLESPACE_LIST_TRUNCATED, as 0 but names beyond maxTablespaces were not stored;
+// END_OF_FILE when no entry is left; HISTORY_FILE_DAMAGED; a failed read's code as sqlzGetZRCInfo
+// maps it.
+int sqluhReadEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
+                   const char* timestampFilter, const char* qualifierFilter, const char* nameFilter,
+                   const char* tablespaceFilter, unsigned int* matchFlags);
+
+// --- The handle ----------------------------------------------------------------------------------
+
+// One write of a batch, to be repeated in the shadow.
+struct SQLUH_REPLAYENTRY {
+    long long offset; // in the file
+    uint32_t length;  // bytes
+    char* copy;       // the bytes; kept for the first element only
+};
+
+struct SQLUH_REPLAYAREA {
+    SQLUH_REPLAYENTRY* replayEntries; // in the order they were written
+    uint32_t numReplayEntries;
+    uint32_t maxReplayEntries; // elements allocated
+    uint32_t maxReplayLength;  // largest length recorded
+    uint8_t replayDisabled;    // recording stopped: the shadow needs a whole-file copy
+};
+enum : uint32_t { replayGrowth = 10 }; // elements that the array grows by
+
+// One open use of a history directory. Owns its work area's buffer, the replay array and the first
+// element's copy.
+struct SQLUH_HANDLE {
+    SQLO_FHANDLE fileHandle; // the history file; descriptor -1 exactly when none is open
+    SQLUH_HEADER header;     // as read at open; the caller of a batch keeps its counts
+    SQLUH_WORKAREA workArea;
+    SQLO_NLCK namedLock;
+    bool isLocked;
+    char directory[pathCapacity];
+    char historyPath[pathCapacity];
+    char shadowPath[pathCapacity];
+    SQLUH_REPLAYAREA replayArea;
+    bool restoredFromImage; // rewritten from a backup image; the close copies it over the shadow
+};
+
+// Allocates and initialises a handle; opens and locks nothing. directory: at most 1011 bytes.
+// Returns 0 or the allocation's code or sqluhPathTooLong, with null stored.
+int sqluhHandleAllocAndInit(char* directory, SQLUH_HANDLE** handleOut);
+
+// Releases the handle and what it owns and sets the caller's pointer to null. Neither closes the
+// file nor releases the lock.
+void sqluhHandleFree(SQLUH_HANDLE** handle);
+
+// Access modes of sqluhOpen; every value but 4 opens for reading and writing.
+enum : unsigned int { SQLUH_OPEN_READ = 4, SQLUH_OPEN_UPDATE = 12 };
+
+// Takes the directory's lock, checks and repairs the two files, opens the history file and reads
+// its header. Waits without limit for the lock; whoever holds a handle on the directory must not
+// open it again. Returns 0 or HISTORY_FILE_RECREATED with an open handle, to be released by
+// sqluhClose; or with null stored HISTORY_FILE_DAMAGED, a code of sqloNLCKInit or sqloNLCKLock, or
+// sqluhPathTooLong.
+int sqluhOpen(SQLUH_HANDLE** handleOut, char* directory, unsigned int accessMode);
+
+// Closes the file, copies a restored history over the shadow, releases the lock and frees the
+// handle, whatever fails on the way; the caller's pointer is null afterwards. Returns the first
+// failure.
+int sqluhClose(SQLUH_HANDLE** handle);
+
+// Takes and releases the directory's lock through the handle. An unlock without a lock returns 0.
+int sqluhLock(SQLUH_HANDLE* handle);
+int sqluhUnlock(SQLUH_HANDLE* handle);
+
+// --- Creation, recovery, verification ------------------------------------------------------------
+
+// Makes a new, empty pair of files. directory: at most 243 bytes, or sqluhPathTooLong.
+int sqluhCreate(char* directory);
+
+// Allocates a handle, takes the lock, examines both files and, if optToRecover, repairs them. The
+// handle, if stored, is the caller's to unlock and free; no file is open through it. Returns 0,
+// HISTORY_FILE_RECREATED or HISTORY_FILE_DAMAGED.
+int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOut, char* directory,
+                                                         bool optToRecover);
+
+// Tells whether the directory's history can be used; repairs nothing, but takes the lock, for which
+// it creates an empty history file where there is none.
+bool sqluhCheckIfHistoryFilesAreUseable(char* directory);
+
+// Tells whether the two files have one size and readable headers. Contents are not compared.
+bool sqluhVerifyHistFilesAreIndentical(SQLUH_HANDLE* handle);
+
+// The repairs. The lock is held and no file is open through the handle.
+int sqluhRecoverHistoryFromShadow(SQLUH_HANDLE* handle);
+int sqluhRecoverShadowFromHistory(SQLUH_HANDLE* handle);
+int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle);
+
+// Rewrites the status letter in the header of the file at path.
+int sqluhUpdateHeaderStatus(char* path, char status);
+
+// Stores the size in bytes of directory + fileName; on failure *size stays as it was.
+int sqluh_history_file_get_size(char* directory, char* fileName, unsigned long long* size);
+
+// Verification reads entries and repairs nothing. Each returns 0 or the first code met that is
+// neither 0 nor TABLESPACE_LIST_TRUNCATED; END_OF_FILE ends the entries and is a result only of
+// sqluhVerifyOneEntry, sqluhVerifyCurrentEntry and of an empty file.
+int sqluhVerifyOneEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
+int sqluhVerifyHistoryEntries(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
+int sqluhVerifyUnopenedHistoryFile(char* path, SQLUH_WORKAREA* workArea);
+int sqluh_verify_history_files(SQLUH_HANDLE* handle);
+int sqluhVerifyCurrentEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
+
+// Checks that offset is not behind the end of the file and leaves the position as it was. Returns
+// 0; END_OF_FILE when it is.
+int sqluhVerifySeekOffsetNotPastEOF(SQLO_FHANDLE fileHandle, long long offset);
+
+// --- Writing and batches -------------------------------------------------------------------------
+
+// Writes entry at the history file's position and records the write for replay. The caller holds
+// the handle of a batch, positions the file and keeps the header's counts. Sets the entry's size,
+// version and checksum, and the length of tablespace names given with 0. Returns 0;
+// HISTORY_FILE_DAMAGED when the lengths do not agree with the contents, and nothing was written; a
+// failed write's code as sqlzGetZRCInfo maps it, after which part of the record may be in the file.
+int sqluhWriteEntry(SQLUH_HANDLE* handle, SQLUH_ENTRY* entry);
+
+// Records a write for replay. entryCount: the header's at the time of the write. Returns 0 when it
+// was recorded or recording stopped; an allocation's code when that failed (replayDisabled is then
+// set).
+int sqluhAddReplayEntry(SQLUH_REPLAYAREA* area, long long offset, unsigned int length,
+                        const char* bytes, unsigned int entryCount);
+
+// Brings the shadow up to date with a batch that is complete in the history file.
+int sqluhReplayWorkInShadow(SQLUH_HANDLE* handle);
+
+enum : unsigned int { sqluhAbandon = 0, sqluhCommit = 1 }; // flags of sqluhEndBatch
+
+extern "C" {
+
+// Opens the directory for a batch: on success the handle is open and locked and the history file
+// says 'P'. Returns 0 (also on files that the open had to make anew) or a code of sqluhOpen or
+// sqluhWriteHeader with no handle left.
+int sqluhBeginBatch(SQLUH_HANDLE** handle, char* directory);
+
+// Commits (bit 0 of flags set) or abandons the batch, and closes the handle in every case. Returns
+// the first failure. After a failed commit the next open settles whether the batch survived.
+int sqluhEndBatch(SQLUH_HANDLE** handle, unsigned int flags);
+
+// Copies the history file of one directory over that of another, whose lock is not taken. Returns
+// 0; HISTORY_FILE_RECREATED, and nothing copied, when the source was unusable; a code of the open,
+// the copy or the close.
+int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory);
+
+} // extern "C"
+
+// --- Utilities -----------------------------------------------------------------------------------
+
+// Allocates one block with a scan record, its sqlca, numTablespaces name buffers of 19 bytes and
+// its text buffers; the command text's holds commandTextLength characters and exists only when
+// asked for. The block is the caller's until sqluhFreeHistoryData, which accepts null.
+int sqluhAllocateHistoryData(zq3HistoryData** dataOut, SMemPool* pool, unsigned int numTablespaces,
+                             bool withCommandText, unsigned int commandTextLength);
+void sqluhFreeHistoryData(zq3HistoryData** data);
+
+// Reads a piece of the history file for a backup image: up to bufferSize bytes from offset. Fewer
+// bytes than asked for mean the end of the file.
+int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned int bufferSize,
+                             unsigned char* buffer, unsigned int* bytesRead);
+
+// Writes a piece of a backup image over the history file; the piece at offset 0 comes first and
+// replaces the file.
+int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned char* buffer,
+                               unsigned int length);
+
+// Tells whether the directory's history holds no entry. Returns 0, HISTORY_FILE_MISSING, or a code
+// of the open or the close; *isEmpty is false unless 0 comes back.
+int sqluhIsHistoryFileEmpty(char* directory, bool* isEmpty);
+
+// Turns the error in *ca into the warning HISTORY_WARNING with the old code as its token.
+void sqluh_build_warning(sqlca* ca);
+
+// Tests of a backup's operation-type letter; a letter of neither kind is a full image.
+bool sqluhIsHistEntryIncr(char operationType);
+bool sqluhIsHistEntryDelta(char operationType);
+bool sqluhIsHistEntryIncrOrDelta(char operationType);

@@ -1,0 +1,908 @@
+// Reading: the header, with the conversion of older versions, and the entries.
+
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "history/sqluhcol.h"
+#include "history/sqluhist.h"
+#include "history/sqluhlog.h"
+
+// --- Numbers in text -----------------------------------------------------------------------------
+
+static uint32_t numberAt(const char* text, uint32_t width, int base)
+{
+    char digits[32];
+    memcpy(digits, text, width);
+    digits[width] = '\0';
+    return static_cast<uint32_t>(strtoul(digits, nullptr, base));
+}
+
+// width: 10 or 11. Straight digits behind an optional sign are what the writer writes.
+static int32_t signedNumberAt(const char* text, uint32_t width)
+{
+    const char* last8 = text + width - 8;
+    bool sign = text[0] == '+' || text[0] == '-';
+    uint32_t low = 0;
+    uint32_t high = 0;
+    bool canonical = decimalColumns(last8, &low);
+    for (const char* at = text + sign; at < last8; at++) {
+        uint32_t digit = static_cast<uint32_t>(static_cast<unsigned char>(*at)) - '0';
+        canonical &= digit <= 9;
+        high = high * 10 + digit;
+    }
+    if (canonical) {
+        uint64_t value = uint64_t{high} * 100000000 + low;
+        return static_cast<int32_t>(text[0] == '-' ? 0 - value : value);
+    }
+    char digits[32];
+    memcpy(digits, text, width);
+    digits[width] = '\0';
+    return static_cast<int32_t>(strtoll(digits, nullptr, 10));
+}
+
+// Value of each character as a hexadecimal digit, or 0xFF.
+struct digitTable {
+    uint8_t value[256];
+};
+
+static constexpr digitTable makeDigitTable(void)
+{
+    digitTable table = {};
+    for (unsigned int c = 0; c < 256; c++)
+        table.value[c] = static_cast<uint8_t>(c >= '0' && c <= '9'   ? c - '0'
+                                              : c >= 'A' && c <= 'F' ? c - 'A' + 10
+                                              : c >= 'a' && c <= 'f' ? c - 'a' + 10
+                                                                     : 0xFF);
+    return table;
+}
+static constexpr digitTable hexDigits = makeDigitTable();
+
+// Reads width hexadecimal digits; false when another character stands among them.
+static bool hexDigitsAt(const char* text, uint32_t width, uint32_t* value)
+{
+    uint32_t result = 0;
+    uint32_t seen = 0;
+    for (uint32_t i = 0; i < width; i++) {
+        uint32_t digit = hexDigits.value[static_cast<unsigned char>(text[i])];
+        seen |= digit;
+        result = result << 4 | (digit & 0x0F);
+    }
+    *value = result;
+    return seen <= 0x0F;
+}
+
+// --- The header ----------------------------------------------------------------------------------
+
+bool sqluhCheckHeaderChecksum(SQLUH_HEADER* header)
+{
+    pdtEntry();
+
+    uint32_t stored = header->checksum;
+    header->checksum = 0;
+    bool shortImage = header->version >= 7020200 && header->version < 8010000;
+    uint32_t computed =
+        sqluhChecksum(header, shortImage ? headerImageLength7020200 : headerImageLength);
+    bool matches = computed == stored || sqluhChecksum(header, headerImageLengthShort) == stored;
+    if (!matches && sqltGetCompTraceFlag()) {
+        sqltData(__func__, "stored checksum", &stored, sizeof stored);
+        sqltData(__func__, "computed checksum", &computed, sizeof computed);
+    }
+
+    pdtExit(matches);
+    return matches;
+}
+
+int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength)
+{
+    pdtEntry();
+
+    zq3HistoryData data = {};
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    SQLUH_WORKAREA workArea = {};
+    unsigned int flags = 0;
+    long long offset = 0;
+    uint32_t longest = 0;
+
+    int rc = logged(sqluhRewind(fh, &offset));
+    if (rc == 0)
+        rc = logged(sqluhInitWorkArea(&workArea, defaultWorkAreaSize));
+    if (rc == 0) {
+        do {
+            rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
+            if ((rc == 0 || rc == TABLESPACE_LIST_TRUNCATED) && entry.commandLength > longest)
+                longest = entry.commandLength;
+        } while (rc == 0 || rc == TABLESPACE_LIST_TRUNCATED);
+        if (rc == END_OF_FILE)
+            rc = 0;
+        rc = firstOf(rc, logged(sqluhRewind(fh, &offset)));
+        sqlofmblkEx(workArea.buffer);
+    }
+    *maxLength = longest;
+
+    pdtExit(rc);
+    return rc;
+}
+
+// Reads the header's text into buffer, which holds one byte more for the terminator.
+static int readHeaderText(SQLO_FHANDLE fh, char* buffer)
+{
+    uint32_t bytesRead = 0;
+    int rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr));
+    if (rc != 0)
+        return rc;
+
+    rc = sqloread(fh, buffer, headerLength, &bytesRead);
+    if (rc == 0 && bytesRead == headerLength)
+        return 0;
+    if (rc == END_OF_FILE && (bytesRead == 0 || bytesRead == headerLength))
+        return rc;
+    bool partial = rc == END_OF_FILE || rc == 0;
+    logRecord({textItem(partial ? TEXT_HEADER_PARTIAL : TEXT_HEADER_READ), codeItem("rc = ", rc),
+               numberItem("Bytes read: ", bytesRead), dataItem("", buffer, headerLength)});
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
+}
+
+// Fields 1 to 13. What a damaged text leaves out stays zero: the checksum tells.
+static void scanHeaderFields(const char* text, SQLUH_HEADER* header)
+{
+    unsigned long long offsets[3] = {};
+    unsigned int checksum = 0;
+    unsigned int numbers[7] = {};
+    unsigned short node = 0;
+    char status = '\0';
+
+    sscanf(text, headerScanFormat, &checksum, &offsets[0], &offsets[1], &offsets[2], &numbers[0],
+           &numbers[1], &numbers[2], &numbers[3], &numbers[4], &numbers[5], &numbers[6], &node,
+           &status);
+    header->checksum = checksum;
+    header->offset1 = offsets[0];
+    header->offset2 = offsets[1];
+    header->offset3 = offsets[2];
+    header->entryCount = numbers[0];
+    header->number6 = numbers[1];
+    header->number7 = numbers[2];
+    header->number8 = numbers[3];
+    header->number9 = numbers[4];
+    header->number10 = numbers[5];
+    header->number11 = numbers[6];
+    header->nodeNumber = node;
+    header->status = status;
+}
+
+// The fields behind the status letter, which stand at places that depend on the version. Returns
+// the place of field 17.
+static uint32_t takeVersionedFields(const char* text, SQLUH_HEADER* header)
+{
+    header->version = numberAt(text + headerVersionAt, headerNumberWidth, 10);
+    if (header->version < 6010000)
+        return headerMaxCommandAt6010000;
+    header->number15 = numberAt(text + headerNumber15At, headerNumberWidth, 16);
+    if (header->version < 7020200)
+        return headerMaxCommandAt7020200;
+    if (text[headerTimestampAt] == SQLUH_EMPTY_WORD[0]) {
+        memset(header->timestamp, ' ', timestampWidth);
+        return headerMaxCommandAtNoTimestamp;
+    }
+    memcpy(header->timestamp, text + headerTimestampAt, timestampWidth);
+    return headerMaxCommandAt;
+}
+
+// Parses the header's text. Returns 0, or HISTORY_FILE_DAMAGED when the entries had to be scanned
+// for field 17 and could not be.
+static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header)
+{
+    memset(header, 0, sizeof *header);
+    scanHeaderFields(text, header);
+    uint32_t maxCommandAt = takeVersionedFields(text, header);
+    if (text[maxCommandAt] != ' ') {
+        header->maxCommandLength = numberAt(text + maxCommandAt, headerNumberWidth, 16);
+        return 0;
+    }
+    uint32_t longest = 0;
+    int rc = sqluhFindMaxCommandLen(fh, &longest);
+    header->maxCommandLength = longest;
+    return rc == 0 ? 0 : loggedPlain(HISTORY_FILE_DAMAGED);
+}
+
+// The work area for the entry that an old header names. Its tablespace count is believed only as
+// far as the file is long: a damaged count must not ask for memory that no entry can need.
+static uint32_t oldEntryAreaSize(SQLO_FHANDLE fh, const SQLUH_HEADER* header)
+{
+    uint64_t extra = uint64_t{workAreaPerTablespace} * header->number8;
+    long long here = 0;
+    long long end = 0;
+    if (sqloseek(fh, 0, sqloFromCurrent, &here) != 0 || sqloseek(fh, 0, sqloFromEnd, &end) != 0 ||
+        sqloseek(fh, here, sqloFromStart, nullptr) != 0)
+        return defaultWorkAreaSize;
+    if (extra > static_cast<uint64_t>(end))
+        extra = static_cast<uint64_t>(end);
+    if (extra > UINT32_MAX - defaultWorkAreaSize)
+        extra = UINT32_MAX - defaultWorkAreaSize;
+    return defaultWorkAreaSize + static_cast<uint32_t>(extra);
+}
+
+// Takes the header's timestamp from the entry at offset3.
+static int takeTimestampFromEntry(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    char objectPart[18] = {};
+    zq3HistoryData data = {};
+    data.objectPart.data = objectPart;
+    data.objectPart.capacity = sizeof objectPart;
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    SQLUH_WORKAREA workArea = {};
+    unsigned int flags = 0;
+    long long offset = 0;
+
+    int rc = logged(sqloseek(fh, static_cast<long long>(header->offset3), sqloFromStart, nullptr));
+    if (rc == 0)
+        rc = logged(sqluhInitWorkArea(&workArea, oldEntryAreaSize(fh, header)));
+    if (rc == 0) {
+        rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
+        if (rc == TABLESPACE_LIST_TRUNCATED)
+            rc = 0;
+        sqlofmblkEx(workArea.buffer);
+        logged(rc);
+    }
+    if (rc != 0)
+        return rc;
+
+    // The header's text can carry neither a zero byte nor a leading "-" here; blanks, which also
+    // stand for an empty timestamp, keep the next header that is written readable.
+    for (uint32_t i = 0; i < timestampWidth; i++)
+        header->timestamp[i] = objectPart[i] != '\0' ? objectPart[i] : ' ';
+    if (objectPart[0] == SQLUH_EMPTY_WORD[0])
+        memset(header->timestamp, ' ', timestampWidth);
+    return logged(sqluhRewind(fh, &offset));
+}
+
+// Brings a header of a version below 7020200 into the current form, in memory.
+static int convertOldHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    if (header->offset3 != 0) {
+        int rc = takeTimestampFromEntry(fh, header);
+        if (rc != 0)
+            return rc;
+    } else {
+        memcpy(header->timestamp, SQLUH_EMPTY_TIMESTAMP, timestampWidth);
+    }
+    if (header->version < 6010000)
+        header->number15 = header->number7;
+    header->version = currentVersion;
+    return 0;
+}
+
+int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    pdtEntry();
+
+    void* block = nullptr;
+    int rc = logged(allocateZeroed(headerLength + 1, &block));
+    if (rc == 0) {
+        char* text = static_cast<char*>(block);
+        rc = readHeaderText(fh, text);
+        if (rc == 0) {
+            int scanned = parseHeader(fh, text, header);
+            rc = sqluhCheckHeaderChecksum(header) ? 0 : logged(HISTORY_FILE_DAMAGED);
+            if (rc == 0 && header->version < 7020200)
+                rc = convertOldHeader(fh, header);
+            rc = firstOf(rc, scanned);
+        }
+        sqlofmblkEx(block);
+    }
+    if (rc < 0 && rc != END_OF_FILE) {
+        sqlt_logadmin(__func__, pdAdminReadFailed);
+        logRecord({textItem(TEXT_HEADER_FAILED)});
+    }
+
+    pdtExit(rc);
+    return rc;
+}
+
+// --- The fixed part of an entry ------------------------------------------------------------------
+
+// What the fixed part holds, as the scanning format gives it.
+struct fixedPart {
+    uint32_t checksum, entryNumber, size, version, noteLength, longTextLength, qualifierLength,
+        nameLength, numTablespaces, sqlcaLength, commandLength;
+    uint16_t entryNode;
+    char status, operation, object, operationType, auxCode;
+    char objectPart[18], secondTimestamp[15], firstText[13], lastText[13], logPosition[13],
+        idText[25];
+};
+
+static bool canonicalNumber(const char* text, unsigned int field, uint32_t* value)
+{
+    return hexColumns(text + entryFields[field].at, value);
+}
+
+template <uint32_t size>
+static bool canonicalWord(const char* text, unsigned int field, char (&word)[size])
+{
+    const char* from = text + entryFields[field].at;
+    uint32_t length = wordLength<size - 1>(from);
+    memcpy(word, from, size - 1);
+    word[length] = '\0';
+    return length != 0;
+}
+
+// What stands between the fields of a canonical fixed part: colons, the blanks that end line 1, its
+// line feed. What is behind field 23 is not looked at, here or by the scanning format.
+struct entryFrame {
+    char mask[entryFixedLength]; // 0xFF where text counts
+    char text[entryFixedLength];
+};
+
+static constexpr entryFrame makeEntryFrame(void)
+{
+    entryFrame frame = {};
+    for (const sqluhField& field : entryFields)
+        frame.text[field.at + field.width] = ':';
+    for (uint32_t i = 0; i < entryReserved1Length; i++)
+        frame.text[entryReserved1At + i] = ' ';
+    frame.text[lineLength - 1] = '\n';
+    for (uint32_t i = 0; i < entryFixedLength; i++)
+        frame.mask[i] = frame.text[i] != '\0' ? '\xFF' : '\0';
+    return frame;
+}
+static constexpr entryFrame canonicalFrame = makeEntryFrame();
+
+static bool hasCanonicalFrame(const char* text)
+{
+    unsigned char different = 0;
+    for (uint32_t i = 0; i < entryFixedLength; i++)
+        different |=
+            static_cast<unsigned char>((text[i] ^ canonicalFrame.text[i]) & canonicalFrame.mask[i]);
+    char operation = text[entryFields[fieldOperation].at];
+    return different == 0 && operation > 0x20 && operation < 0x7F;
+}
+
+// Takes a fixed part apart by column when it stands exactly as the writer writes it. Returns false,
+// and leaves *fixed in part, when it does not: the scanning format then decides.
+static bool takeCanonicalFixedPart(const char* text, fixedPart* fixed)
+{
+    if (!hasCanonicalFrame(text))
+        return false;
+    uint32_t node = 0;
+    bool canonical = canonicalNumber(text, fieldChecksum, &fixed->checksum) &&
+                     hexDigitsAt(text + entryFields[fieldNode].at, 4, &node) &&
+                     canonicalNumber(text, fieldNumber, &fixed->entryNumber) &&
+                     canonicalNumber(text, fieldSize, &fixed->size) &&
+                     decimalColumns(text + entryFields[fieldVersion].at, &fixed->version) &&
+                     canonicalNumber(text, fieldNoteLength, &fixed->noteLength) &&
+                     canonicalNumber(text, fieldLongTextLength, &fixed->longTextLength) &&
+                     canonicalNumber(text, fieldQualifierLength, &fixed->qualifierLength) &&
+                     canonicalNumber(text, fieldNameLength, &fixed->nameLength) &&
+                     canonicalNumber(text, fieldNumTablespaces, &fixed->numTablespaces) &&
+                     canonicalNumber(text, fieldSqlcaLength, &fixed->sqlcaLength) &&
+                     canonicalNumber(text, fieldCommandLength, &fixed->commandLength) &&
+                     canonicalWord(text, fieldObjectPart, fixed->objectPart) &&
+                     canonicalWord(text, fieldSecondTimestamp, fixed->secondTimestamp) &&
+                     canonicalWord(text, fieldFirstText, fixed->firstText) &&
+                     canonicalWord(text, fieldLastText, fixed->lastText) &&
+                     canonicalWord(text, fieldLogPosition, fixed->logPosition) &&
+                     canonicalWord(text, fieldIdText, fixed->idText);
+    fixed->entryNode = static_cast<uint16_t>(node);
+    fixed->status = text[entryFields[fieldStatus].at];
+    fixed->operation = text[entryFields[fieldOperation].at];
+    fixed->object = text[entryFields[fieldObject].at];
+    fixed->operationType = text[entryFields[fieldOperationType].at];
+    fixed->auxCode = text[entryFields[fieldAuxCode].at];
+    // A zero byte ends the text for the scanning format.
+    return canonical && fixed->status != '\0' && fixed->object != '\0' &&
+           fixed->operationType != '\0' && fixed->auxCode != '\0';
+}
+
+// Takes a fixed part apart with the scanning format. Returns the number of fields found; those not
+// found are left as they were, the words empty.
+static int scanFixedPart(const char* text, fixedPart* fixed)
+{
+    char line[entryFixedLength + 1];
+    memcpy(line, text, entryFixedLength);
+    line[entryFixedLength] = '\0';
+    memset(fixed->objectPart, 0, sizeof fixed->objectPart);
+    memset(fixed->secondTimestamp, 0, sizeof fixed->secondTimestamp);
+    memset(fixed->firstText, 0, sizeof fixed->firstText);
+    memset(fixed->lastText, 0, sizeof fixed->lastText);
+    memset(fixed->logPosition, 0, sizeof fixed->logPosition);
+    memset(fixed->idText, 0, sizeof fixed->idText);
+    int found = sscanf(
+        line, entryScanFormat, &fixed->checksum, &fixed->entryNode, &fixed->entryNumber,
+        &fixed->size, &fixed->version, &fixed->status, &fixed->noteLength, &fixed->longTextLength,
+        &fixed->qualifierLength, &fixed->nameLength, &fixed->numTablespaces, &fixed->sqlcaLength,
+        &fixed->commandLength, &fixed->operation, &fixed->object, &fixed->operationType,
+        fixed->objectPart, fixed->secondTimestamp, fixed->firstText, fixed->lastText,
+        fixed->logPosition, fixed->idText, &fixed->auxCode);
+    return found < 0 ? 0 : found;
+}
+
+// The caller's numbers and letters, which a scan that stops early leaves as they were.
+static void fixedFromEntry(fixedPart* fixed, const SQLUH_ENTRY* entry)
+{
+    const zq3HistoryData* data = entry->data;
+    fixed->checksum = entry->checksum;
+    fixed->size = entry->size;
+    fixed->version = entry->version;
+    fixed->noteLength = entry->noteLength;
+    fixed->longTextLength = entry->longTextLength;
+    fixed->qualifierLength = entry->qualifierLength;
+    fixed->nameLength = entry->nameLength;
+    fixed->sqlcaLength = entry->sqlcaLength;
+    fixed->commandLength = entry->commandLength;
+    fixed->entryNode = data->entryNode;
+    fixed->entryNumber = data->entryNumber;
+    fixed->numTablespaces = data->numTablespaces;
+    fixed->status = data->status;
+    fixed->operation = data->operation;
+    fixed->object = data->object;
+    fixed->operationType = data->operationType;
+    fixed->auxCode = data->auxCode;
+}
+
+static void entryFromFixed(SQLUH_ENTRY* entry, const fixedPart* fixed)
+{
+    zq3HistoryData* data = entry->data;
+    entry->checksum = fixed->checksum;
+    entry->size = fixed->size;
+    entry->version = fixed->version;
+    entry->noteLength = fixed->noteLength;
+    entry->longTextLength = fixed->longTextLength;
+    entry->qualifierLength = fixed->qualifierLength;
+    entry->nameLength = fixed->nameLength;
+    entry->sqlcaLength = fixed->sqlcaLength;
+    entry->commandLength = fixed->commandLength;
+    data->entryNode = fixed->entryNode;
+    data->entryNumber = fixed->entryNumber;
+    data->numTablespaces = fixed->numTablespaces;
+    data->status = fixed->status;
+    data->operation = fixed->operation;
+    data->object = fixed->object;
+    data->operationType = fixed->operationType;
+    data->auxCode = fixed->auxCode;
+}
+
+static char blankForEmpty(char letter)
+{
+    return letter == SQLUH_EMPTY_WORD[0] ? ' ' : letter;
+}
+
+static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, fixedPart* fixed)
+{
+    int found = entryFieldCount;
+    if (!takeCanonicalFixedPart(text, fixed)) {
+        fixedFromEntry(fixed, entry);
+        found = scanFixedPart(text, fixed);
+    }
+    entryFromFixed(entry, fixed);
+    if (found < static_cast<int>(entryFieldCount)) {
+        logRecord({textItem(TEXT_ENTRY_FIELDS), numberItem(TEXT_ENTRY_FIELDS_READ, found),
+                   dataItem("", text, entryFixedLength)});
+        return HISTORY_FILE_DAMAGED;
+    }
+    zq3HistoryData* data = entry->data;
+    data->object = blankForEmpty(data->object);
+    data->operationType = blankForEmpty(data->operationType);
+    data->auxCode = blankForEmpty(data->auxCode);
+    if (entry->size < entryMinLength) {
+        logRecord({textItem(TEXT_ENTRY_LENGTHS), numberItem("Size field: ", entry->size),
+                   dataItem("", text, entryFixedLength)});
+        return HISTORY_FILE_DAMAGED;
+    }
+    return 0;
+}
+
+// --- The bytes of an entry -----------------------------------------------------------------------
+
+int sqluhInitWorkArea(SQLUH_WORKAREA* workArea, uint32_t size)
+{
+    pdtEntry();
+
+    void* block = nullptr;
+    int rc = allocateZeroed(size, &block);
+    if (rc == 0) {
+        workArea->buffer = static_cast<char*>(block);
+        workArea->size = size;
+    }
+
+    pdtExit(rc);
+    return rc;
+}
+
+static int readFixedPart(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea)
+{
+    uint32_t bytesRead = 0;
+    int rc = sqloread(fh, workArea->buffer, entryFixedLength, &bytesRead);
+    if (rc == 0 && bytesRead == entryFixedLength)
+        return 0;
+    if (rc == END_OF_FILE && (bytesRead == 0 || bytesRead == entryFixedLength))
+        return rc;
+    bool partial = rc == END_OF_FILE || rc == 0;
+    logRecord({textItem(partial ? TEXT_ENTRY_PARTIAL : TEXT_ENTRY_READ), codeItem("rc = ", rc),
+               numberItem("Bytes read: ", bytesRead),
+               dataItem("", workArea->buffer, entryFixedLength)});
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
+}
+
+// Grows the work area for an entry of size bytes, but to no more than the file still holds: a
+// damaged size must not ask for memory. *readable receives how much of the body can be asked for.
+static int growWorkArea(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size,
+                        uint32_t* readable)
+{
+    long long here = 0;
+    long long end = 0;
+    int rc = sqloseek(fh, 0, sqloFromCurrent, &here);
+    if (rc == 0)
+        rc = sqloseek(fh, 0, sqloFromEnd, &end);
+    if (rc == 0)
+        rc = sqloseek(fh, here, sqloFromStart, nullptr);
+    if (rc != 0)
+        return logged(rc);
+
+    uint64_t left = end > here ? static_cast<uint64_t>(end - here) : 0;
+    if (left < size - entryFixedLength)
+        *readable = static_cast<uint32_t>(left);
+    uint32_t needed = entryFixedLength + *readable;
+    if (needed <= workArea->size)
+        return 0;
+    void* block = workArea->buffer;
+    rc = logged(sqloMemBlockReallocate(&block, needed, sqloZeroFilled, __FILE__, __LINE__));
+    if (rc == 0) {
+        workArea->buffer = static_cast<char*>(block);
+        workArea->size = needed;
+    }
+    return rc;
+}
+
+static int readBody(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size)
+{
+    uint32_t wanted = size - entryFixedLength;
+    uint32_t readable = wanted;
+    if (size > workArea->size) {
+        int rc = growWorkArea(fh, workArea, size, &readable);
+        if (rc != 0)
+            return rc;
+    }
+
+    char* body = workArea->buffer + entryFixedLength;
+    uint32_t bytesRead = 0;
+    int rc = sqloread(fh, body, readable, &bytesRead);
+    if (rc == 0 && bytesRead == wanted)
+        return 0;
+    bool partial = rc == END_OF_FILE || rc == 0;
+    if (partial && (bytesRead == 0 || (rc != 0 && bytesRead == wanted)))
+        return END_OF_FILE;
+    logRecord({textItem(partial ? TEXT_BODY_PARTIAL : TEXT_BODY_READ), codeItem("rc = ", rc),
+               numberItem("Bytes read: ", bytesRead), dataItem("", body, bytesRead)});
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
+}
+
+static int checkEntryChecksum(SQLUH_WORKAREA* workArea, const SQLUH_ENTRY* entry)
+{
+    memset(workArea->buffer, 0, entryFields[fieldChecksum].width);
+    uint32_t computed = sqluhChecksum(workArea->buffer, entry->size);
+    if (computed == entry->checksum)
+        return 0;
+    logRecord({codeItem(TEXT_ENTRY_CHECKSUM, static_cast<int>(entry->checksum)),
+               codeItem(TEXT_ENTRY_OBSERVED, static_cast<int>(computed))});
+    return HISTORY_FILE_DAMAGED;
+}
+
+// --- The sections of an entry --------------------------------------------------------------------
+
+// Where the sections behind the long text begin and what they take. A matching checksum does not
+// make the lengths true: they are held against size here, in 64 bits, before anything is read by
+// them.
+struct sectionPlan {
+    uint32_t objectNamesAt;
+    uint32_t tablespacesAt;
+    uint32_t tablespacesEnd; // at most: the sqlca line and the command lines still fit behind it
+};
+
+static bool planSections(const SQLUH_ENTRY* entry, sectionPlan* plan)
+{
+    uint64_t at = entry->longTextLength != 0 ? entryLongTextAt + lineLength : entryLongTextAt;
+    uint64_t objectNames = 0;
+    if (entry->qualifierLength != 0 || entry->nameLength != 0)
+        objectNames = uint64_t{entry->qualifierLength} + entry->nameLength + 2;
+    uint64_t tail = 0;
+    if (entry->sqlcaLength != 0)
+        tail += sqlcaLineLength;
+    if (entry->commandLength != 0)
+        tail +=
+            uint64_t{entry->commandLength} + (entry->commandLength - 1) / commandPieceLength + 1;
+    uint64_t least = uint64_t{entry->data->numTablespaces} * tablespaceLineExtra;
+    if (at + objectNames + least + tail > entry->size)
+        return false;
+    plan->objectNamesAt = static_cast<uint32_t>(at);
+    plan->tablespacesAt = static_cast<uint32_t>(at + objectNames);
+    plan->tablespacesEnd = static_cast<uint32_t>(entry->size - tail);
+    return true;
+}
+
+static void copyText(textBuffer* target, const char* text, size_t length)
+{
+    target->length = static_cast<uint32_t>(length);
+    if (target->data == nullptr || target->capacity == 0)
+        return;
+    size_t copied = length < target->capacity ? length : target->capacity - 1;
+    copyShort(target->data, text, copied);
+    target->data[copied] = '\0';
+}
+
+static void copyWord(textBuffer* target, const char* word, const char* empty)
+{
+    copyText(target, word, strcmp(word, empty) == 0 ? 0 : strlen(word));
+}
+
+// Ends the text of at most length characters at text and copies it.
+static void takeText(textBuffer* target, char* text, uint32_t length)
+{
+    text[length] = '\0';
+    copyText(target, text, strlen(text));
+}
+
+static unsigned int compareTimestamp(const char* filter, const char* timestamp)
+{
+    int order = strncmp(filter, timestamp, timestampWidth);
+    return order < 0 ? matchFilterEarlier : order > 0 ? matchFilterLater : matchFilterEqual;
+}
+
+static void takeLogPosition(const char* text, uint8_t* position)
+{
+    memset(position, 0, sizeof zq3HistoryData::logPosition);
+    for (uint32_t group = 0; group < 3; group++) {
+        uint32_t value = 0;
+        if (!hexDigitsAt(text + 4 * group, 4, &value))
+            return;
+        position[2 * group] = static_cast<uint8_t>(value >> 8);
+        position[2 * group + 1] = static_cast<uint8_t>(value);
+    }
+}
+
+static void takeLine2(zq3HistoryData* data, const fixedPart* fixed)
+{
+    copyWord(&data->objectPart, fixed->objectPart, SQLUH_EMPTY_TIMESTAMP);
+    copyWord(&data->secondTimestamp, fixed->secondTimestamp, SQLUH_EMPTY_TIMESTAMP);
+    copyWord(&data->firstText, fixed->firstText, SQLUH_EMPTY_WORD);
+    copyWord(&data->lastText, fixed->lastText, SQLUH_EMPTY_WORD);
+    takeLogPosition(fixed->logPosition, data->logPosition);
+    copyWord(&data->idText, fixed->idText, SQLUH_EMPTY_WORD);
+}
+
+static void takeNoteAndLongText(SQLUH_ENTRY* entry, char* record)
+{
+    if (entry->noteLength > maxNoteLength)
+        entry->noteLength = maxNoteLength;
+    takeText(&entry->data->noteText, record + entryNoteAt, entry->noteLength);
+    if (entry->longTextLength == 0) {
+        copyText(&entry->data->longText, "", 0);
+        return;
+    }
+    if (entry->longTextLength > maxLongTextLength)
+        entry->longTextLength = maxLongTextLength;
+    takeText(&entry->data->longText, record + entryLongTextAt, entry->longTextLength);
+}
+
+static unsigned int takeObjectNames(SQLUH_ENTRY* entry, char* at, const char* qualifierFilter,
+                                    const char* nameFilter)
+{
+    zq3HistoryData* data = entry->data;
+    if (entry->qualifierLength == 0 && entry->nameLength == 0) {
+        copyText(&data->qualifierText, "", 0);
+        copyText(&data->nameText, "", 0);
+        return 0;
+    }
+    char* name = at + entry->qualifierLength + 1;
+    takeText(&data->qualifierText, at, entry->qualifierLength);
+    takeText(&data->nameText, name, entry->nameLength);
+    unsigned int flags = 0;
+    if (qualifierFilter != nullptr && strcmp(at, qualifierFilter) == 0)
+        flags |= matchQualifier;
+    if (nameFilter != nullptr && strcmp(name, nameFilter) == 0)
+        flags |= matchName;
+    return flags;
+}
+
+// The length at the head of a tablespace line: what scanning a hexadecimal number of eight
+// characters gives; above every 32-bit number when there is none.
+static uint64_t tablespaceLength(const char* line)
+{
+    // The next line's place waits for this number, so the usual one, of two digits, takes the
+    // shortest way to it.
+    uint32_t high = hexDigits.value[static_cast<unsigned char>(line[6])];
+    uint32_t low = hexDigits.value[static_cast<unsigned char>(line[7])];
+    if (memcmp(line, "000000", 6) == 0 && (high | low) <= 0x0F)
+        return high << 4 | low;
+    uint32_t length = 0;
+    if (hexColumns(line, &length))
+        return length;
+    char digits[headerNumberWidth + 1];
+    memcpy(digits, line, headerNumberWidth);
+    digits[headerNumberWidth] = '\0';
+    return sscanf(digits, "%8x", &length) == 1 ? length : UINT64_MAX - tablespaceLineExtra;
+}
+
+// The name of the tablespace line at at, ended where its line feed stood, and its length; null when
+// the line does not fit before end or has no length. Starts with *head 0.
+//
+// Neighbouring names often have one length. Comparing the head with the last one lets the processor
+// go on with the next line before this one's number is known.
+static inline char* nextTablespace(char* at, const char* end, uint64_t* head, uint64_t* length)
+{
+    if (end - at < static_cast<ptrdiff_t>(tablespaceLineExtra))
+        return nullptr;
+    uint64_t digits = columnsAt(at);
+    if (digits != *head)
+        *length = tablespaceLength(at);
+    *head = digits;
+    if (static_cast<uint64_t>(end - at) < *length + tablespaceLineExtra)
+        return nullptr;
+    char* name = at + tablespaceNameAt;
+    name[*length] = '\0';
+    return name;
+}
+
+// Takes count tablespace lines from at to at most end, storing the first of them in buffers.
+// Returns the place behind them, or null when a line is damaged.
+static char* takeTablespaces(char* at, const char* end, uint32_t count, textBuffer* buffers,
+                             uint32_t stored, const char* filter, unsigned int* flags)
+{
+    // One look for zero bytes, which end a name early, spares one for each name.
+    bool zeroFree = stored != 0 && memchr(at, '\0', static_cast<size_t>(end - at)) == nullptr;
+    uint64_t head = 0;
+    uint64_t length = 0;
+    for (uint32_t i = 0; i < count; i++) {
+        char* name = nextTablespace(at, end, &head, &length);
+        if (name == nullptr)
+            return nullptr;
+        if (i < stored)
+            copyText(&buffers[i], name, zeroFree ? static_cast<size_t>(length) : strlen(name));
+        if (filter != nullptr && strcmp(name, filter) == 0)
+            *flags |= matchTablespace;
+        at = name + length + 1;
+    }
+    return at;
+}
+
+// The same when nobody wants a name: the lines still have to be sound.
+static char* passTablespaces(char* at, const char* end, uint32_t count)
+{
+    uint64_t head = 0;
+    uint64_t length = 0;
+    for (uint32_t i = 0; i < count && at != nullptr; i++) {
+        char* name = nextTablespace(at, end, &head, &length);
+        at = name != nullptr ? name + length + 1 : nullptr;
+    }
+    return at;
+}
+
+static void fillSqlca(sqlca* ca, const char* line)
+{
+    *ca = {};
+    memcpy(ca->sqlcaid, line + sqlcaIdField.at, sqlcaIdField.width);
+    ca->sqlcabc = signedNumberAt(line + sqlcaBcField.at, sqlcaBcField.width);
+    ca->sqlcode = signedNumberAt(line + sqlcaCodeField.at, sqlcaCodeField.width);
+    ca->sqlerrml =
+        static_cast<int16_t>(numberAt(line + sqlcaErrmlField.at, sqlcaErrmlField.width, 16));
+    memcpy(ca->sqlerrmc, line + sqlcaErrmcField.at, sqlcaErrmcField.width);
+    memcpy(ca->sqlerrp, line + sqlcaErrpField.at, sqlcaErrpField.width);
+    for (uint32_t i = 0; i < 6; i++)
+        ca->sqlerrd[i] = signedNumberAt(line + sqlcaErrdField.at + i * sqlcaErrdField.width,
+                                        sqlcaErrdField.width);
+    memcpy(ca->sqlwarn, line + sqlcaWarnField.at, sqlcaWarnField.width);
+    memcpy(ca->sqlstate, line + sqlcaStateField.at, sqlcaStateField.width);
+    if (ca->sqlstate[0] == SQLUH_EMPTY_WORD[0])
+        memset(ca->sqlstate, ' ', sizeof ca->sqlstate);
+}
+
+static unsigned int takeSqlca(sqlca* target, const char* line)
+{
+    if (target != nullptr)
+        fillSqlca(target, line);
+    int32_t code = signedNumberAt(line + sqlcaCodeField.at, sqlcaCodeField.width);
+    return code != 0 ? unsigned{matchSqlcodeSet} : 0;
+}
+
+static void takeCommand(textBuffer* target, const char* lines, uint32_t length)
+{
+    target->length = length;
+    if (target->data == nullptr || target->capacity == 0)
+        return;
+    uint32_t wanted = length < target->capacity ? length : target->capacity - 1;
+    for (uint32_t done = 0; done < wanted; done += commandPieceLength) {
+        uint32_t piece = wanted - done < commandPieceLength ? wanted - done : commandPieceLength;
+        memcpy(target->data + done, lines, piece);
+        lines += commandPieceLength + 1;
+    }
+    target->data[wanted] = '\0';
+}
+
+struct entryFilters {
+    const char* timestamp;
+    const char* qualifier;
+    const char* name;
+    const char* tablespace;
+};
+
+// Takes everything behind the fixed part, in the record's order.
+static int takeSections(SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea, const fixedPart* fixed,
+                        const entryFilters* filters, uint32_t maxTablespaces, unsigned int* flags)
+{
+    zq3HistoryData* data = entry->data;
+    char* record = workArea->buffer;
+    sectionPlan plan = {};
+    char* at = nullptr;
+    if (planSections(entry, &plan)) {
+        if (filters->timestamp != nullptr)
+            *flags |= compareTimestamp(filters->timestamp, fixed->objectPart);
+        takeNoteAndLongText(entry, record);
+        takeLine2(data, fixed);
+        *flags |=
+            takeObjectNames(entry, record + plan.objectNamesAt, filters->qualifier, filters->name);
+        uint32_t stored = data->tablespaceBuffers != nullptr ? maxTablespaces : 0;
+        at = record + plan.tablespacesAt;
+        const char* end = record + plan.tablespacesEnd;
+        if (stored == 0 && filters->tablespace == nullptr)
+            at = passTablespaces(at, end, data->numTablespaces);
+        else
+            at = takeTablespaces(at, end, data->numTablespaces, data->tablespaceBuffers, stored,
+                                 filters->tablespace, flags);
+    }
+    if (at == nullptr) {
+        logRecord({textItem(TEXT_ENTRY_LENGTHS), numberItem("Size field: ", entry->size)});
+        return HISTORY_FILE_DAMAGED;
+    }
+    if (entry->sqlcaLength != 0) {
+        *flags |= takeSqlca(data->eventSqlca, at);
+        at += sqlcaLineLength;
+    } else if (data->eventSqlca != nullptr) {
+        sqloinca(data->eventSqlca);
+    }
+    takeCommand(&data->commandText, at, entry->commandLength);
+    memcpy(data->eyecatcher, "SQLUHINF", sizeof data->eyecatcher);
+    return 0;
+}
+
+// What is said about every entry that could not be read, whatever was found wrong with it.
+static void logUnreadableEntry(long long offset, const SQLUH_WORKAREA* workArea)
+{
+    pdLogPrintf("sqluhReadEntry", pdLevelError, TEXT_ENTRY_OFFSET, offset);
+    sqlt_logadmin("sqluhReadEntry", pdAdminReadFailed);
+    if (workArea->buffer != nullptr)
+        sqlt_logerr_data("sqluhReadEntry", TEXT_ENTRY_DUMP, workArea->buffer, workArea->size);
+}
+
+int sqluhReadEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
+                   const char* timestampFilter, const char* qualifierFilter, const char* nameFilter,
+                   const char* tablespaceFilter, unsigned int* matchFlags)
+{
+    pdtEntry();
+
+    const entryFilters filters = {timestampFilter, qualifierFilter, nameFilter, tablespaceFilter};
+    uint32_t maxTablespaces = entry->data->maxTablespaces;
+    fixedPart fixed;
+    long long offset = 0;
+    *matchFlags = 0;
+    // For the message only: a file that cannot tell its position fails the read that follows.
+    sqloseek(fh, 0, sqloFromCurrent, &offset);
+
+    int rc = readFixedPart(fh, workArea);
+    if (rc == 0)
+        rc = parseFixedPart(workArea->buffer, entry, &fixed);
+    if (rc == 0)
+        rc = readBody(fh, workArea, entry->size);
+    if (rc == 0)
+        rc = checkEntryChecksum(workArea, entry);
+    if (rc == 0)
+        rc = takeSections(entry, workArea, &fixed, &filters, maxTablespaces, matchFlags);
+    if (rc == 0 && entry->data->numTablespaces > maxTablespaces)
+        rc = TABLESPACE_LIST_TRUNCATED;
+    if (rc < 0 && rc != END_OF_FILE)
+        logUnreadableEntry(offset, workArea);
+
+    pdtExit(rc);
+    return rc;
+}

@@ -1,0 +1,71 @@
+// Verification: reads entries and repairs nothing.
+
+#include "history/sqluhist.h"
+#include "history/sqluhlog.h"
+
+int sqluhVerifyOneEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea)
+{
+    pdtEntry();
+
+    // No buffers and no room for names: the entry is checked, nothing of it is stored.
+    zq3HistoryData data = {};
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    unsigned int flags = 0;
+    int rc =
+        sqluhReadEntry(fileHandle, &entry, workArea, nullptr, nullptr, nullptr, nullptr, &flags);
+    if (rc == TABLESPACE_LIST_TRUNCATED)
+        rc = 0;
+    if (rc != END_OF_FILE)
+        loggedPlain(rc);
+
+    pdtExit(rc);
+    return rc;
+}
+
+int sqluhVerifyHistoryEntries(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea)
+{
+    pdtEntry();
+
+    int rc = 0;
+    while (rc == 0)
+        rc = sqluhVerifyOneEntry(fileHandle, workArea);
+    if (rc == END_OF_FILE)
+        rc = 0;
+
+    pdtExit(rc);
+    return rc;
+}
+
+int sqluhVerifyUnopenedHistoryFile(char* path, SQLUH_WORKAREA* workArea)
+{
+    pdtEntry();
+
+    SQLO_FHANDLE fh = sqloNoFile;
+    SQLUH_HEADER header;
+    int rc = logged(sqloopenp(path, sqloOpenRead, sqloPermissions, &fh));
+    if (rc == 0) {
+        rc = logged(sqluhReadHeader(fh, &header));
+        if (rc == 0) {
+            rc = sqluhVerifyHistoryEntries(fh, workArea);
+            if (rc != 0)
+                logRecord({textItem(TEXT_VERIFY_FILE), textItem(path), codeItem("", rc)});
+        }
+        rc = firstOf(rc, sqloclose(fh));
+    }
+
+    pdtExit(rc);
+    return rc;
+}
+
+int sqluh_verify_history_files(SQLUH_HANDLE* handle)
+{
+    pdtEntry();
+
+    int rc = sqluhVerifyHistoryEntries(handle->fileHandle, &handle->workArea);
+    if (rc != 0)
+        logRecord({textItem(TEXT_VERIFY_HANDLE), codeItem("", rc)});
+
+    pdtExit(rc);
+    return rc;
+}
