@@ -50,7 +50,7 @@ static inline bool decimalColumns(const char* text, uint32_t* value)
     if (((digits + everyByte(0x76)) | digits) & everyByte(0x80))
         return false;
     digits = digits * 10 + (digits >> 8); // every second byte now holds a pair, 0 to 99
-    uint64_t high = (digits & 0x000000FF000000FF) * 0x000F424000000064;       // 10^6 and 10^2
+    uint64_t high = (digits & 0x000000FF000000FF) * 0x000F424000000064;      // 10^6 and 10^2
     uint64_t low = (digits >> 16 & 0x000000FF000000FF) * 0x0000271000000001; // 10^4 and 1
     *value = static_cast<uint32_t>((high + low) >> 32);
     return true;

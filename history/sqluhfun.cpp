@@ -192,10 +192,8 @@ void sqluhHandleFree(SQLUH_HANDLE** handle)
 
 // --- The lock of a directory ---------------------------------------------------------------------
 
-int sqluhLock(SQLUH_HANDLE* handle)
+static int makeLockKey(SQLUH_HANDLE* handle)
 {
-    pdtEntry();
-
     int rc = sqloNLCKInit(handle->historyPath, &handle->namedLock, sqloNLCKUseNodeNumber);
     if (rc != 0) {
         // No history file yet: the key is made from it, so an empty one is put there. Where that
@@ -206,12 +204,52 @@ int sqluhLock(SQLUH_HANDLE* handle)
         handle->fileHandle = sqloNoFile;
         rc = sqloNLCKInit(handle->historyPath, &handle->namedLock, sqloNLCKUseNodeNumber);
     }
+    return rc;
+}
+
+// Whether the path's file is no longer the one that the key was made from.
+static bool keyHasChanged(const SQLUH_HANDLE* handle, SQLO_NLCK* now)
+{
+    return sqloNLCKInit(handle->historyPath, now, sqloNLCKUseNodeNumber) == 0 &&
+           now->key != handle->namedLock.key;
+}
+
+int sqluhLock(SQLUH_HANDLE* handle)
+{
+    pdtEntry();
+
+    SQLO_NLCK now;
+    int rc = makeLockKey(handle);
     if (rc == 0) {
         rc = sqloNLCKLock(&handle->namedLock, 0, -1);
         handle->isLocked = rc == 0;
     }
+    // Whoever held the lock may have put a new file there: then this is the lock of a file that is
+    // gone, and others already use the new one's.
+    while (rc == 0 && keyHasChanged(handle, &now)) {
+        rc = sqluhUnlock(handle);
+        handle->namedLock = now;
+        if (rc == 0)
+            rc = sqloNLCKLock(&handle->namedLock, 0, -1);
+        handle->isLocked = rc == 0;
+    }
 
     pdtExit(rc);
+    return rc;
+}
+
+// A new history file has a key of its own, which others use from now on. Its lock is taken while
+// the old file's is still held, so that nobody who was waiting sees a moment without a lock.
+static int lockNewHistoryFile(SQLUH_HANDLE* handle)
+{
+    SQLO_NLCK now;
+    if (!handle->isLocked || !keyHasChanged(handle, &now))
+        return 0;
+    int rc = sqloNLCKLock(&now, 0, -1);
+    if (rc == 0) {
+        logged(sqloNLCKUnlock(&handle->namedLock));
+        handle->namedLock = now;
+    }
     return rc;
 }
 
@@ -442,6 +480,8 @@ static int examineAndRepair(SQLUH_HANDLE* handle, bool optToRecover)
         if (!optToRecover)
             return HISTORY_FILE_DAMAGED;
         int rc = sqluhRecoverFromFatalError(handle);
+        if (rc == 0)
+            rc = lockNewHistoryFile(handle);
         return rc == 0 ? HISTORY_FILE_RECREATED : rc;
     }
     return optToRecover ? repair(handle, history, shadow) : 0;
@@ -729,6 +769,8 @@ static int replaceHistoryFile(SQLUH_HANDLE* handle)
                        &handle->fileHandle);
         if (rc != 0)
             handle->fileHandle = sqloNoFile;
+        else
+            rc = lockNewHistoryFile(handle);
     }
     return rc;
 }

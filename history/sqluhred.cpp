@@ -571,6 +571,9 @@ static int readBody(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size)
     int rc = sqloread(fh, body, readable, &bytesRead);
     if (rc == 0 && bytesRead == wanted)
         return 0;
+    // No more was asked for than the file was known to hold: it ends before the body does.
+    if (rc == 0 && readable < wanted)
+        rc = END_OF_FILE;
     bool partial = rc == END_OF_FILE || rc == 0;
     if (partial && (bytesRead == 0 || (rc != 0 && bytesRead == wanted)))
         return END_OF_FILE;
