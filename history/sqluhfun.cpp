@@ -192,64 +192,52 @@ void sqluhHandleFree(SQLUH_HANDLE** handle)
 
 // --- The lock of a directory ---------------------------------------------------------------------
 
-static int makeLockKey(SQLUH_HANDLE* handle)
+// Makes the key of the history file that stands at the handle's path.
+static int makeLockKey(SQLUH_HANDLE* handle, SQLO_NLCK* lock)
 {
-    int rc = sqloNLCKInit(handle->historyPath, &handle->namedLock, sqloNLCKUseNodeNumber);
+    int rc = sqloNLCKInit(handle->historyPath, lock, sqloNLCKUseNodeNumber);
     if (rc != 0) {
         // No history file yet: the key is made from it, so an empty one is put there. Where that
         // fails, the key tells.
-        if (sqloopenp(handle->historyPath, sqloOpenTouch, sqloPermissions, &handle->fileHandle) ==
-            0)
-            sqloclose(handle->fileHandle);
-        handle->fileHandle = sqloNoFile;
-        rc = sqloNLCKInit(handle->historyPath, &handle->namedLock, sqloNLCKUseNodeNumber);
+        SQLO_FHANDLE fh = sqloNoFile;
+        if (sqloopenp(handle->historyPath, sqloOpenTouch, sqloPermissions, &fh) == 0)
+            sqloclose(fh);
+        rc = sqloNLCKInit(handle->historyPath, lock, sqloNLCKUseNodeNumber);
     }
     return rc;
 }
 
-// Whether the path's file is no longer the one that the key was made from.
-static bool keyHasChanged(const SQLUH_HANDLE* handle, SQLO_NLCK* now)
+// Takes the lock of the history file that stands at the path. Without a lock at first, or with that
+// of a file that stood there before, which is released only when the new one is held.
+//
+// The key is the file's, so whoever puts a new file there (fatal recovery, the first piece of a
+// restore) changes it: others use the new key from then on, and those who waited for the old one
+// wake up with the lock of a file that is gone. Hence the key is looked at again behind every lock.
+static int lockFileAtPath(SQLUH_HANDLE* handle)
 {
-    return sqloNLCKInit(handle->historyPath, now, sqloNLCKUseNodeNumber) == 0 &&
-           now->key != handle->namedLock.key;
+    SQLO_NLCK lock;
+    int rc = makeLockKey(handle, &lock);
+    while (rc == 0 && (!handle->isLocked || lock.key != handle->namedLock.key)) {
+        rc = sqloNLCKLock(&lock, 0, -1);
+        if (rc == 0) {
+            logged(sqluhUnlock(handle));
+            handle->namedLock = lock;
+            handle->isLocked = true;
+            rc = makeLockKey(handle, &lock);
+        }
+    }
+    return rc;
 }
 
 int sqluhLock(SQLUH_HANDLE* handle)
 {
     pdtEntry();
 
-    SQLO_NLCK now;
-    int rc = makeLockKey(handle);
-    if (rc == 0) {
-        rc = sqloNLCKLock(&handle->namedLock, 0, -1);
-        handle->isLocked = rc == 0;
-    }
-    // Whoever held the lock may have put a new file there: then this is the lock of a file that is
-    // gone, and others already use the new one's.
-    while (rc == 0 && keyHasChanged(handle, &now)) {
-        rc = sqluhUnlock(handle);
-        handle->namedLock = now;
-        if (rc == 0)
-            rc = sqloNLCKLock(&handle->namedLock, 0, -1);
-        handle->isLocked = rc == 0;
-    }
+    int rc = lockFileAtPath(handle);
+    if (rc != 0)
+        logged(sqluhUnlock(handle));
 
     pdtExit(rc);
-    return rc;
-}
-
-// A new history file has a key of its own, which others use from now on. Its lock is taken while
-// the old file's is still held, so that nobody who was waiting sees a moment without a lock.
-static int lockNewHistoryFile(SQLUH_HANDLE* handle)
-{
-    SQLO_NLCK now;
-    if (!handle->isLocked || !keyHasChanged(handle, &now))
-        return 0;
-    int rc = sqloNLCKLock(&now, 0, -1);
-    if (rc == 0) {
-        logged(sqloNLCKUnlock(&handle->namedLock));
-        handle->namedLock = now;
-    }
     return rc;
 }
 
@@ -348,32 +336,6 @@ int sqluhRecoverShadowFromHistory(SQLUH_HANDLE* handle)
     return rc;
 }
 
-static void traceFailure(int rc)
-{
-    if (rc != 0)
-        sqltError("sqluhRecoverFromFatalError", rc);
-}
-
-int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
-{
-    pdtEntry();
-
-    char savedHistory[pathCapacity];
-    char savedShadow[pathCapacity];
-    // Refused before anything is moved: without a new pair, moving the damaged one helps nobody.
-    int rc = strlen(handle->directory) <= maxCreateDirectoryLength ? 0 : logged(sqluhPathTooLong);
-    if (rc == 0) {
-        joinPath(savedHistory, sizeof savedHistory, handle->directory, SQLUH_SAVED_HISTORY_NAME);
-        joinPath(savedShadow, sizeof savedShadow, handle->directory, SQLUH_SAVED_SHADOW_NAME);
-        traceFailure(sqlomove(handle->historyPath, savedHistory));
-        traceFailure(sqlomove(handle->shadowPath, savedShadow));
-        rc = sqluhCreate(handle->directory);
-    }
-
-    pdtExit(rc);
-    return rc;
-}
-
 int sqluh_history_file_get_size(char* directory, char* fileName, unsigned long long* size)
 {
     pdtEntry();
@@ -455,6 +417,37 @@ static fileState examineFile(SQLUH_HANDLE* handle, const char* path)
     return state;
 }
 
+static void traceFailure(int rc)
+{
+    if (rc != 0)
+        sqltError("sqluhRecoverFromFatalError", rc);
+}
+
+int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
+{
+    pdtEntry();
+
+    char savedHistory[pathCapacity];
+    char savedShadow[pathCapacity];
+    // Refused before anything is moved: without a new pair, moving the damaged one helps nobody.
+    int rc = strlen(handle->directory) <= maxCreateDirectoryLength ? 0 : logged(sqluhPathTooLong);
+    if (rc == 0) {
+        joinPath(savedHistory, sizeof savedHistory, handle->directory, SQLUH_SAVED_HISTORY_NAME);
+        joinPath(savedShadow, sizeof savedShadow, handle->directory, SQLUH_SAVED_SHADOW_NAME);
+        traceFailure(sqlomove(handle->historyPath, savedHistory));
+        traceFailure(sqlomove(handle->shadowPath, savedShadow));
+        // Locked before there is anything in it. Someone else may have been first, and then has
+        // made the pair.
+        if (handle->isLocked)
+            rc = logged(lockFileAtPath(handle));
+        if (rc == 0 && !(handle->isLocked && examineFile(handle, handle->historyPath).usable))
+            rc = sqluhCreate(handle->directory);
+    }
+
+    pdtExit(rc);
+    return rc;
+}
+
 static int repair(SQLUH_HANDLE* handle, fileState history, fileState shadow)
 {
     int rc = 0;
@@ -480,8 +473,6 @@ static int examineAndRepair(SQLUH_HANDLE* handle, bool optToRecover)
         if (!optToRecover)
             return HISTORY_FILE_DAMAGED;
         int rc = sqluhRecoverFromFatalError(handle);
-        if (rc == 0)
-            rc = lockNewHistoryFile(handle);
         return rc == 0 ? HISTORY_FILE_RECREATED : rc;
     }
     return optToRecover ? repair(handle, history, shadow) : 0;
@@ -757,6 +748,20 @@ int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned
     return rc;
 }
 
+// What someone who came between the creation of the new file and its lock has put into it goes.
+static int emptyFile(SQLUH_HANDLE* handle)
+{
+    long long size = 0;
+    int rc = sqloseek(handle->fileHandle, 0, sqloFromEnd, &size);
+    if (rc != 0 || size == 0)
+        return rc;
+    rc = sqloclose(handle->fileHandle);
+    handle->fileHandle = sqloNoFile;
+    if (rc == 0)
+        rc = sqloopenp(handle->historyPath, sqloOpenNew, sqloPermissions, &handle->fileHandle);
+    return rc == sqloFileExisted ? 0 : rc;
+}
+
 // Puts an empty file in the place of the history file.
 static int replaceHistoryFile(SQLUH_HANDLE* handle)
 {
@@ -764,14 +769,13 @@ static int replaceHistoryFile(SQLUH_HANDLE* handle)
     handle->fileHandle = sqloNoFile;
     if (rc == 0)
         rc = sqlodelete(handle->historyPath, 0);
-    if (rc == 0) {
+    if (rc == 0)
         rc = sqloopenp(handle->historyPath, sqloOpenReplacement, sqloPermissions,
                        &handle->fileHandle);
-        if (rc != 0)
-            handle->fileHandle = sqloNoFile;
-        else
-            rc = lockNewHistoryFile(handle);
-    }
+    if (rc == 0 && handle->isLocked)
+        rc = lockFileAtPath(handle);
+    if (rc == 0)
+        rc = emptyFile(handle);
     return rc;
 }
 
