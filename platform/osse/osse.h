@@ -30,9 +30,8 @@ inline int storeFailure(int number)
 int osseOpen(const char* path, int flags, mode_t permissions);
 
 // Opens a regular file; anything else (directory, pipe, device) is refused without blocking. flags
-// with O_CREAT create a missing file, and *created then tells so. Returns 0 or a code.
-int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor,
-                    bool* created);
+// with O_CREAT create a missing file. Returns 0 or a code.
+int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor);
 
 // Transfers at an offset until count bytes are done or, reading, the file ends; *done is the number
 // of bytes transferred, also on failure. Returns 0 or a code.

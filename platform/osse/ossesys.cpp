@@ -26,32 +26,12 @@ int osseOpen(const char* path, int flags, mode_t permissions)
     return descriptor;
 }
 
-// Creates the file or opens the one that is there. The exclusive attempt tells which it was.
-static int createOrOpen(const char* path, int flags, mode_t permissions, bool* created)
-{
-    *created = true;
-    int descriptor = osseOpen(path, flags | O_EXCL, permissions);
-    if (descriptor >= 0 || errno != EEXIST)
-        return descriptor;
-
-    *created = false;
-    descriptor = osseOpen(path, flags & ~O_CREAT, permissions);
-    if (descriptor >= 0 || errno != ENOENT)
-        return descriptor;
-
-    // Deleted between the two attempts, or a link to a file that does not exist yet.
-    *created = true;
-    return osseOpen(path, flags, permissions);
-}
-
-int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor, bool* created)
+int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor)
 {
     *descriptor = -1;
-    *created = false;
     if (path == nullptr)
         return systemFailure(EINVAL);
-    const int opened = (flags & O_CREAT) != 0 ? createOrOpen(path, flags, permissions, created)
-                                              : osseOpen(path, flags, permissions);
+    const int opened = osseOpen(path, flags, permissions);
     if (opened < 0)
         return systemFailure(errno);
 

@@ -75,8 +75,7 @@ static int replaceContents(int source, int target, off_t targetSize, unsigned ch
 static int copyToTarget(int source, const char* targetPath, unsigned char* buffer)
 {
     int target;
-    bool created;
-    int rc = osseOpenRegular(targetPath, O_WRONLY | O_CREAT, sqloPermissions, &target, &created);
+    int rc = osseOpenRegular(targetPath, O_WRONLY | O_CREAT, sqloPermissions, &target);
     if (rc != 0)
         return rc;
 
@@ -85,12 +84,14 @@ static int copyToTarget(int source, const char* targetPath, unsigned char* buffe
         rc = systemFailure(errno);
     else if (from.st_dev == to.st_dev && from.st_ino == to.st_ino)
         rc = systemFailure(EINVAL);
+    // Its name is durable before it holds anything, also when it was there: whoever made it may
+    // have stopped before this. A target with a header then never loses its name.
+    if (rc == 0)
+        rc = osseSyncDirectoryOf(targetPath);
     if (rc == 0)
         rc = replaceContents(source, target, to.st_size, buffer);
     if (close(target) != 0 && errno != EINTR && rc == 0)
         rc = storeFailure(errno);
-    if (rc == 0 && created)
-        rc = osseSyncDirectoryOf(targetPath);
     return rc;
 }
 
@@ -99,8 +100,7 @@ OSSE_EXPORT int sqlocopy(const char* sourcePath, const char* targetPath, unsigne
     if (options != 0)
         return systemFailure(EINVAL);
     int source;
-    bool created;
-    int rc = osseOpenRegular(sourcePath, O_RDONLY, 0, &source, &created);
+    int rc = osseOpenRegular(sourcePath, O_RDONLY, 0, &source);
     if (rc != 0)
         return rc;
 

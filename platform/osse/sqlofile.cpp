@@ -100,9 +100,9 @@ OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int p
         return systemFailure(EINVAL);
 
     int descriptor;
-    bool created;
-    int rc = osseOpenRegular(path, flags, permissions, &descriptor, &created);
-    if (rc == 0 && created)
+    int rc = osseOpenRegular(path, flags, permissions, &descriptor);
+    // Also for a file that was there: whoever made it may have stopped before this.
+    if (rc == 0 && (flags & O_CREAT) != 0)
         rc = osseSyncDirectoryOf(path);
     if (rc == 0)
         rc = enterFile(descriptor, fh);
