@@ -1,0 +1,178 @@
+// The calls that the tests stand in front of. Each goes on to the real one unless a test says no.
+#include "directory/fixture.h"
+
+#include <cerrno>
+#include <cstdarg>
+#include <dlfcn.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+std::function<int(const std::string&, int)> onCall;
+diskControl disk;
+
+// The OS-services call that is under way, and how often it has synced a file.
+static std::string service;
+static int syncsOfService;
+
+template <typename function> static function next(function, const char* name)
+{
+    return reinterpret_cast<function>(dlsym(RTLD_NEXT, name));
+}
+
+static int enter(const char* name, int command)
+{
+    service = name;
+    syncsOfService = 0;
+    return onCall ? onCall(name, command) : 0;
+}
+
+#define HOOK(name, parameters, arguments, command, failed)                                         \
+    extern "C" int name parameters                                                                 \
+    {                                                                                              \
+        static const auto real = next(&name, #name);                                               \
+        const int code = enter(#name, command);                                                    \
+        return code == 0 ? real arguments : failed;                                                \
+    }
+HOOK(sqloopenp, (const char* path, unsigned word, unsigned bits, SQLO_FHANDLE* fh),
+     (path, word, bits, fh), 0, (*fh = sqloNoFile, code))
+HOOK(sqloclose, (SQLO_FHANDLE fh), (fh), 0, (real(fh), code))
+HOOK(sqloread, (SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* done),
+     (fh, buffer, count, done), 0, (*done = 0, code))
+HOOK(sqlowrite, (SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* done),
+     (fh, buffer, count, done), 0, (real(fh, buffer, count / 2, done), code))
+HOOK(sqloseek, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* at),
+     (fh, offset, origin, at), 0, code)
+HOOK(sqlochgfileptr, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* at),
+     (fh, offset, origin, at), 0, code)
+HOOK(sqlosync, (SQLO_FHANDLE fh), (fh), 0, code)
+HOOK(sqlocopy, (const char* from, const char* to, unsigned word), (from, to, word), 0, code)
+HOOK(sqlomove, (const char* from, const char* to), (from, to), 0, code)
+HOOK(sqlodelete, (const char* path, unsigned word), (path, word), 0, code)
+HOOK(ossFileGetInfoV9, (const ossFileRequest* request, ossFileInfo* info), (request, info), 0, code)
+HOOK(sqlogmblkEx,
+     (SMemPool * pool, size_t size, unsigned word, void** block, const char* file, unsigned line,
+      unsigned zero),
+     (pool, size, word, block, file, line, zero), 0, (*block = nullptr, code))
+HOOK(sqloMemBlockReallocate, (void** block, size_t n, unsigned word, const char* s, unsigned line),
+     (block, n, word, s, line), 0, code)
+
+HOOK(semget, (key_t key, int count, int flags) noexcept, (key, count, flags), flags,
+     (errno = code, -1))
+HOOK(semop, (int id, sembuf* steps, size_t count) noexcept, (id, steps, count), steps->sem_op,
+     (errno = code, -1))
+extern "C" int semctl(int id, int number, int command, ...) noexcept
+{
+    static const auto real = next(&semctl, "semctl");
+    va_list rest;
+    va_start(rest, command);
+    void* argument = va_arg(rest, void*);
+    va_end(rest);
+    const int code = enter("semctl", command);
+    return code == 0 ? real(id, number, command, argument) : (errno = code, -1);
+}
+
+// --- System calls under the files ----------------------------------------------------------------
+
+static ino_t inodeOf(int fd)
+{
+    struct stat status;
+    return fstat(fd, &status) == 0 ? status.st_ino : 0;
+}
+
+// Lets a call happen as far as it may, logs it, and stops behind it where it shall.
+template <typename call> static auto perform(diskOp op, call happen) -> decltype(happen(0))
+{
+    const size_t size = op.kind == diskWrite ? op.bytes.size() : 1;
+    if (!disk.watching)
+        return happen(size);
+    size_t part = disk.stopped ? 0 : size;
+    if (!disk.stopped && static_cast<int>(disk.log.size()) == disk.stop.call) {
+        disk.stopped = true;
+        part = std::min(size, disk.stop.cut);
+    }
+    const auto result = part == 0 ? -1 : happen(part);
+    op.bytes = op.bytes.substr(0, part);
+    op.name = std::filesystem::path(op.name).filename();
+    op.newName = std::filesystem::path(op.newName).filename();
+    if (result >= 0)
+        disk.log.push_back(op);
+    if (!disk.stopped)
+        return result;
+    if (disk.exits)
+        _exit(stoppedStatus);
+    errno = EIO;
+    return -1;
+}
+
+extern "C" ssize_t pwrite(int fd, const void* buffer, size_t count, off_t offset)
+{
+    static const auto real = next(&pwrite, "pwrite64");
+    const std::string bytes(static_cast<const char*>(buffer), count);
+    return perform({diskWrite, inodeOf(fd), static_cast<size_t>(offset), bytes},
+                   [&](size_t part) { return real(fd, buffer, part, offset); });
+}
+
+extern "C" int ftruncate(int fd, off_t length) noexcept
+{
+    static const auto real = next(&ftruncate, "ftruncate64");
+    return perform({diskTruncate, inodeOf(fd), static_cast<size_t>(length)},
+                   [&](size_t) { return real(fd, length); });
+}
+
+// Of all opens only one that creates or empties a file changes anything.
+extern "C" int open(const char* path, int flags, ...)
+{
+    static const auto real = next(&open, "open64");
+    va_list rest;
+    va_start(rest, flags);
+    const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
+    va_end(rest);
+    const bool exists = access(path, F_OK) == 0;
+    const bool changes = exists ? (flags & (O_TRUNC | O_EXCL)) == O_TRUNC : (flags & O_CREAT) != 0;
+    if (!disk.watching || !changes)
+        return real(path, flags, mode);
+    int fd = -1;
+    const int result = perform({exists ? diskTruncate : diskCreate, 0, 0, "", path},
+                               [&](size_t) { return fd = real(path, flags, mode); });
+    if (fd >= 0)
+        disk.log.back().inode = inodeOf(fd);
+    if (fd >= 0 && result < 0)
+        close(fd);
+    return result;
+}
+
+extern "C" int unlink(const char* path) noexcept
+{
+    static const auto real = next(&unlink, "unlink");
+    return perform({diskUnlink, 0, 0, "", path}, [&](size_t) { return real(path); });
+}
+
+extern "C" int rename(const char* path, const char* newPath) noexcept
+{
+    static const auto real = next(&rename, "rename");
+    return perform({diskRename, 0, 0, "", path, newPath},
+                   [&](size_t) { return real(path, newPath); });
+}
+
+static std::string barrierName()
+{
+    if (service == "sqlosync")
+        return std::string("B").append(std::to_string(++disk.batchSyncs));
+    if (syncsOfService++ == 0 || disk.log.empty())
+        return "R0";
+    return disk.log.back().kind == diskWrite && disk.log.back().at == 0 ? "R4" : "CH";
+}
+
+// Nothing waits for a real disk here: what a sync does is in the log.
+extern "C" int fdatasync(int fd)
+{
+    return disk.watching
+               ? perform({diskSync, inodeOf(fd), 0, "", barrierName()}, [](size_t) { return 0; })
+               : 0;
+}
+
+extern "C" int fsync(int)
+{
+    return perform({diskNames, 0, 0, "", "D"}, [](size_t) { return 0; });
+}

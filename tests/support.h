@@ -1,0 +1,238 @@
+// What the tests of the history library share: scratch directories, the diagnostic log as text, and
+// entries that are quick to build and to read.
+#pragma once
+
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <string>
+#include <vector>
+
+#include <sys/ipc.h>
+#include <sys/sem.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "history/sqluhist.h"
+
+inline std::string slurp(const std::string& path)
+{
+    std::ifstream in(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+
+inline void spill(const std::string& path, const std::string& bytes)
+{
+    std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
+}
+
+// The semaphore set of an existing file's key; -1 when there is none, -2 when there is no key.
+inline int lockSetOf(const std::string& historyPath)
+{
+    SQLO_NLCK lock = {};
+    int rc = sqloNLCKInit(historyPath.c_str(), &lock, sqloNLCKUseNodeNumber);
+    return rc == 0 ? semget(lock.key, 0, 0) : -2;
+}
+
+inline bool lockKeyIsFree(const std::string& historyPath)
+{
+    return lockSetOf(historyPath) == -1;
+}
+
+inline void removeLockSet(const std::string& historyPath)
+{
+    semctl(lockSetOf(historyPath), 0, IPC_RMID);
+}
+
+// The records of a diagnostic log without time, process and function: the text, then " [LABEL: N
+// bytes]" for each dump. Levels other than Error stand in front; of an administration message only
+// its number is kept.
+inline std::vector<std::string> logRecords(const std::string& path)
+{
+    static const std::string admin = "Administration message ";
+    std::vector<std::string> records;
+    std::ifstream in(path);
+    for (std::string line; std::getline(in, line);) {
+        size_t level = line.find(" level="), function = line.find(" function=");
+        if (line[0] != ' ' && function != std::string::npos) {
+            std::string name = line.substr(level + 7, function - level - 7);
+            std::string text = line.substr(line.find(':', function) + 1).erase(0, 1);
+            if (text.starts_with(admin))
+                text.erase(admin.size() + 4);
+            records.push_back((name == "Error" ? "" : name + " ") + text);
+        } else if (records.empty() || line.ends_with("|") || line.ends_with("bytes shown)")) {
+            continue;
+        } else if (line.ends_with(" bytes")) {
+            records.back() += " [" + line.substr(4) + "]";
+        } else if (!records.back().starts_with(admin)) {
+            records.back() += " / " + line.substr(4);
+        }
+    }
+    return records;
+}
+
+// A scratch directory in memory with a history directory in it whose lock key nobody uses, and a
+// diagnostic log of its own. Everything is removed at the end.
+class HistoryTest : public testing::Test
+{
+  protected:
+    std::string root, directory, historyPath, shadowPath, logPath;
+
+    HistoryTest()
+    {
+        setenv("ZQ3SYNC", "off", 1);
+        // A key has 16 bits of the inode number. The memory file system numbers inodes one after
+        // the other, so the files that the test makes have keys near that of a file made here.
+        for (bool isFree = false; !isFree;) {
+            std::filesystem::remove_all(root);
+            char name[32];
+            strcpy(name, access("/dev/shm", W_OK) == 0 ? "/dev/shm/zq3XXXXXX" : "/tmp/zq3XXXXXX");
+            root = std::string(mkdtemp(name)) + "/";
+            directory = root + "h/";
+            std::filesystem::create_directory(directory);
+            historyPath = directory + SQLUH_HISTORY_NAME;
+            shadowPath = directory + SQLUH_SHADOW_NAME;
+            spill(historyPath, "");
+            isFree = lockKeyIsFree(historyPath);
+            unlink(historyPath.c_str());
+        }
+        logPath = root + "diag.log";
+        setenv("ZQ3DIAGLOG", logPath.c_str(), 1);
+    }
+
+    ~HistoryTest() override
+    {
+        removeLockSet(historyPath);
+        std::filesystem::remove_all(root);
+    }
+
+    // What was logged since the last call.
+    std::vector<std::string> takeLog()
+    {
+        std::vector<std::string> records = logRecords(logPath);
+        unlink(logPath.c_str());
+        return records;
+    }
+
+    SQLO_FHANDLE open(unsigned int word = sqloOpenUpdate)
+    {
+        SQLO_FHANDLE fh = sqloNoFile;
+        EXPECT_EQ(0, sqloopenp(historyPath.c_str(), word, sqloPermissions, &fh));
+        return fh;
+    }
+
+    static long long positionOf(SQLO_FHANDLE fh)
+    {
+        long long position = -1;
+        EXPECT_EQ(0, sqloseek(fh, 0, sqloFromCurrent, &position));
+        return position;
+    }
+};
+
+// An entry to be written: set the members, then take build().
+struct entryBuilder {
+    std::string objectPart, secondTimestamp, firstText, lastText, idText, qualifier, name, longText,
+        note, command;
+    std::vector<std::string> tablespaces;
+    sqlca ca = {};
+    bool withSqlca = false;
+    zq3HistoryData data = {};
+    SQLUH_ENTRY entry = {};
+    std::vector<textBuffer> tablespaceBuffers;
+
+    entryBuilder()
+    {
+        data.operation = 'B';
+        data.object = 'D';
+        data.operationType = 'F';
+        data.status = 'A';
+        data.auxCode = 'x';
+        sqloinca(&ca);
+    }
+
+    // In the order of the record's buffers.
+    std::vector<std::string*> texts()
+    {
+        return {&objectPart, &secondTimestamp, &firstText, &lastText, &idText, &qualifier,
+                &name,       &longText,        &note,      &command};
+    }
+
+    // Points the records at the texts and sets the lengths that follow from them.
+    SQLUH_ENTRY* build()
+    {
+        const auto point = [](std::string& text) {
+            uint32_t length = static_cast<uint32_t>(text.size());
+            return textBuffer{text.data(), length + 1, length};
+        };
+        textBuffer* buffer = &data.objectPart;
+        for (std::string* text : texts())
+            *buffer++ = point(*text);
+        tablespaceBuffers.clear();
+        for (std::string& tablespace : tablespaces)
+            tablespaceBuffers.push_back(point(tablespace));
+        entry.qualifierLength = data.qualifierText.length;
+        entry.nameLength = data.nameText.length;
+        entry.longTextLength = data.longText.length;
+        entry.noteLength = data.noteText.length;
+        entry.commandLength = data.commandText.length;
+        entry.sqlcaLength = withSqlca ? 194 : 0;
+        data.numTablespaces = static_cast<uint32_t>(tablespaces.size());
+        data.tablespaceBuffers = tablespaceBuffers.data();
+        data.eventSqlca = &ca;
+        entry.data = &data;
+        return &entry;
+    }
+};
+
+// A place for an entry to be read into, every text with a buffer of the given capacity.
+struct entryReader {
+    std::vector<std::vector<char>> storage;
+    std::vector<textBuffer> tablespaceBuffers;
+    sqlca ca = {};
+    zq3HistoryData data = {};
+    SQLUH_ENTRY entry = {};
+    SQLUH_WORKAREA workArea = {};
+    unsigned int flags = 0;
+
+    explicit entryReader(uint32_t capacity = 4096, uint32_t maxTablespaces = 64,
+                         uint32_t workAreaSize = defaultWorkAreaSize)
+        : tablespaceBuffers(maxTablespaces)
+    {
+        const auto give = [&](textBuffer* text) {
+            storage.emplace_back(capacity, '~');
+            *text = {capacity == 0 ? nullptr : storage.back().data(), capacity, 0};
+        };
+        for (textBuffer* text : texts())
+            give(text);
+        for (textBuffer& name : tablespaceBuffers)
+            give(&name);
+        data.tablespaceBuffers = tablespaceBuffers.data();
+        data.maxTablespaces = maxTablespaces;
+        data.eventSqlca = &ca;
+        entry.data = &data;
+        EXPECT_EQ(0, sqluhInitWorkArea(&workArea, workAreaSize));
+    }
+    entryReader(const entryReader&) = delete;
+    ~entryReader()
+    {
+        sqlofmblkEx(workArea.buffer);
+    }
+
+    std::vector<textBuffer*> texts()
+    {
+        std::vector<textBuffer*> all;
+        for (textBuffer* text = &data.objectPart; text <= &data.commandText; text++)
+            all.push_back(text);
+        return all;
+    }
+
+    int read(SQLO_FHANDLE fh, const char* timestamp = nullptr, const char* qualifier = nullptr,
+             const char* name = nullptr, const char* tablespace = nullptr)
+    {
+        return sqluhReadEntry(fh, &entry, &workArea, timestamp, qualifier, name, tablespace,
+                              &flags);
+    }
+};
