@@ -1,0 +1,258 @@
+// zq3ckrst: the command line and the sequence of a run.
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "tool/zq3ckrst.h"
+
+char VERBOSE = 0; // listings wanted
+
+// What the command line asks for.
+struct planOptions {
+    char alias[aliasLength + 1];
+    char timestamp[timestampLength + 1];
+    restoreKind kind;
+    bool namesGiven;
+    int firstName; // index of the argument
+    int numNames;
+    unsigned int seen; // seenAlias, seenTimestamp
+    bool helpGiven;    // nothing else is to be done
+};
+enum : unsigned int { seenAlias = 1, seenTimestamp = 2 };
+
+static void getHelp()
+{
+    fputs("\n"
+          "zq3ckrst: This utility allows the user to query the databse history\n"
+          "          in order to generate a suggested sequence of backup image\n"
+          "          timestamps and also gives a simplified restore syntax needed\n"
+          "          for a manual restore.\n"
+          "\n"
+          "   -d <db name>     - Specify the database you wish to be restored.\n"
+          "   -t <timestamp>   - Specify the incremental (delta) timestamp\n"
+          "                      you wish to restore from.\n"
+          "   -r <restoreType> - Specify DATABASE or TABLESPACE restore type.\n"
+          "   -n <list of tablespace names>\n"
+          "                    - If TABLESPACE restore type chosen, specify a\n"
+          "                      list of tablespace names you wish to be restored\n"
+          "                      separated by spaces.\n"
+          "   -hu?             - Displays help/usage.\n"
+          "\n"
+          "\n"
+          "Usage: zq3ckrst [-hu?] -d <db name> -t <timestamp>\n"
+          "                [-r <restoreType> [-n <list of tablespace names>]]\n"
+          "\n"
+          "NOTES:\n"
+          "      (1) The database history must exist in order for this utility \n"
+          "          to be used. If the database history does not exist, first \n"
+          "          use the HISTORY FILE option on the RESTORE command before \n"
+          "          using this utility.\n"
+          "      (2) It is highly recommended that you not use the FORCE option \n"
+          "          on the PRUNE HISTORY command. The default operation of this \n"
+          "          command prevents you from deleting history entries that may \n"
+          "          be required for recovery from the most recent, full database \n"
+          "          backup image, but with the FORCE option, it is possible to \n"
+          "          delete entries that are required, which will affect the \n"
+          "          output of this utility.\n"
+          "      (3) It is recommended that you keep good records of your \n"
+          "          backups and use this utility as a guide.\n"
+          "\n"
+          "Examples:\n"
+          "\n"
+          "   zq3ckrst -d sample -t 20001015193455 -r database\n"
+          "   zq3ckrst -d sample -t 20001015193455 -r tablespace\n"
+          "   zq3ckrst -d sample -t 20001015193455 -r tablespace -n tbsp1 tbsp2\n"
+          "\n",
+          stderr);
+}
+
+// --- The command line ----------------------------------------------------------------------------
+//
+// Each option's function takes the option's value at argv[*at + 1] and leaves *at at the last
+// argument that it used.
+
+static int takeAlias(planOptions* options, int argc, char** argv, int* at)
+{
+    if (++*at >= argc || strlen(argv[*at]) > aliasLength)
+        return reportError(msgAlias);
+    strcpy(options->alias, argv[*at]);
+    options->seen |= seenAlias;
+    return 0;
+}
+
+static int takeTimestamp(planOptions* options, int argc, char** argv, int* at)
+{
+    if (++*at >= argc || strlen(argv[*at]) != timestampLength)
+        return reportError(msgTimestamp);
+    strcpy(options->timestamp, argv[*at]);
+    options->seen |= seenTimestamp;
+    return 0;
+}
+
+static int takeRestoreType(planOptions* options, int argc, char** argv, int* at)
+{
+    if (++*at >= argc)
+        return reportError(msgNoRestoreType);
+    str2upper(argv[*at]);
+    if (strcmp(argv[*at], "DATABASE") == 0)
+        options->kind = restoreDatabase;
+    else if (strcmp(argv[*at], "TABLESPACE") == 0)
+        options->kind = restoreTablespace;
+    else
+        return reportError(msgRestoreType);
+    return 0;
+}
+
+static int takeNames(planOptions* options, int argc, char** argv, int* at)
+{
+    if (options->namesGiven)
+        return 0; // only the first list counts; the names of this one are skipped
+    options->namesGiven = true;
+    options->firstName = *at + 1;
+    while (*at + 1 < argc && argv[*at + 1][0] != '-') {
+        ++*at;
+        options->numNames++;
+    }
+    return options->numNames == 0 ? reportError(msgNoNames) : 0;
+}
+
+static int takeOption(planOptions* options, int argc, char** argv, int* at)
+{
+    switch (argv[*at][1]) {
+    case 'd':
+        return takeAlias(options, argc, argv, at);
+    case 't':
+        return takeTimestamp(options, argc, argv, at);
+    case 'r':
+        return takeRestoreType(options, argc, argv, at);
+    case 'n':
+        return takeNames(options, argc, argv, at);
+    case 'v':
+        VERBOSE = 1;
+        return 0;
+    default:
+        getHelp();
+        options->helpGiven = true;
+        return 0;
+    }
+}
+
+// Returns 0 or the code of the first mistake, which was reported and followed by the help text.
+static int parseCommandLine(planOptions* options, int argc, char** argv)
+{
+    int rc = 0;
+    if (argc < 2) {
+        getHelp();
+        options->helpGiven = true;
+    }
+    for (int at = 1; at < argc && rc == 0 && !options->helpGiven; at++)
+        if (argv[at][0] == '-')
+            rc = takeOption(options, argc, argv, &at);
+
+    if (rc == 0 && !options->helpGiven && options->seen != (seenAlias | seenTimestamp))
+        rc = reportError(msgNoAliasOrTimestamp);
+    if (rc != 0)
+        getHelp();
+    return rc;
+}
+
+static void settleRestoreKind(planOptions* options)
+{
+    if (options->kind == restoreTablespace || !options->namesGiven)
+        return;
+    fprintf(stderr, "\nWARNING:  zq3ckrst - Tablespace name(s) given with \"DATABASE\" restore\n");
+    fprintf(stderr, "                     type option; will continue as a tablespace restore\n");
+    fprintf(stderr, "                     using name(s) specified.\n\n");
+    options->kind = restoreTablespace;
+}
+
+// --- The run -------------------------------------------------------------------------------------
+
+static int refuseTablespaceImage(const restorePlan* plan, restoreKind kind)
+{
+    bool tablespaceImage = plan->histData.entries[plan->histData.backupIndex].object == 'P';
+    return kind == restoreDatabase && tablespaceImage ? reportError(msgTablespaceImage) : 0;
+}
+
+static void listEntriesFound(restorePlan* plan)
+{
+    if (!VERBOSE)
+        return;
+    printf("\n\nNumber of entries found: %d\n", plan->histData.numEntries);
+    printf("Index of backup entry specified: %d\n", plan->histData.backupIndex);
+    showEntries(&plan->histData);
+}
+
+static void renameTablespaces(restorePlan* plan)
+{
+    if (!isRenamePassDue(plan))
+        return;
+    updateHistoryEntriesforRename(&plan->histData);
+    if (VERBOSE) {
+        printf("\n\nAfter update for rename tablespaces ...\n");
+        showEntries(&plan->histData);
+    }
+}
+
+// Fills and prunes the matrix. Without tablespaces only the listings remain.
+static int traceTimeline(restorePlan* plan)
+{
+    int rc = allocateTimelineMatrix(plan);
+    if (rc == 0)
+        rc = fillTimelineMatrix(plan->matrix, &plan->histData, plan->list, plan->numTablespaces,
+                                plan->numBackups);
+    if (rc == 0 && VERBOSE)
+        showBeginningTimeline(plan);
+    if (rc == 0)
+        rc = scanAndUpdateTimelineMatrix(plan->matrix, plan->list, plan->numTablespaces,
+                                         plan->numBackups);
+    if (rc == 0 && VERBOSE)
+        showNewTimeline(plan);
+    return rc;
+}
+
+static int planRestore(restorePlan* plan, planOptions* options, char** argv)
+{
+    plan->histData.backupIndex = -1;
+    plan->histData.renameIndex = -1;
+    int rc =
+        fetchHistoryEntries(options->alias, options->timestamp, &plan->histData, &plan->numBackups);
+    if (rc == 0)
+        rc = refuseTablespaceImage(plan, options->kind);
+    if (rc != 0)
+        return rc;
+
+    listEntriesFound(plan);
+    rc = listBackupImages(plan);
+    if (rc != 0)
+        return rc;
+
+    renameTablespaces(plan);
+    if (options->kind == restoreDatabase || !options->namesGiven)
+        rc = listTargetTablespaces(plan);
+    else
+        rc = listNamedTablespaces(plan, argv + options->firstName, options->numNames);
+    if (rc == 0)
+        rc = traceTimeline(plan);
+    if (rc == 0)
+        rc = printRestoreOrder(plan, options->alias, options->timestamp, options->kind);
+    return rc;
+}
+
+int main(int argc, char** argv)
+{
+    // A plan for a large history is printed in large pieces, to a terminal too.
+    static char outputBuffer[65536];
+    setvbuf(stdout, outputBuffer, _IOFBF, sizeof outputBuffer);
+
+    planOptions options = {};
+    int rc = parseCommandLine(&options, argc, argv);
+    if (rc != 0 || options.helpGiven)
+        return rc;
+
+    settleRestoreKind(&options);
+    restorePlan plan = {};
+    rc = planRestore(&plan, &options, argv);
+    freePlan(&plan);
+    return rc;
+}
