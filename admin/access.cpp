@@ -1,0 +1,184 @@
+// Directories, their locks, and opening a history.
+#include "admin/zq3hist.h"
+
+#include <cerrno>
+#include <csignal>
+#include <cstring>
+#include <initializer_list>
+#include <sys/stat.h>
+#include <unistd.h>
+
+int takeArguments(int argc, char** argv, const char* form, int least, int most, bool* json)
+{
+    int kept = 1;
+    for (int i = 1; i < argc; i++) {
+        if (json != nullptr && strcmp(argv[i], "--json") == 0)
+            *json = true;
+        else if (argv[i][0] == '-' && argv[i][1] != '\0')
+            return failUsage("%s: unknown option %s", argv[0], argv[i]);
+        else
+            argv[kept++] = argv[i];
+    }
+    for (int i = kept; i < argc; i++)
+        argv[i] = nullptr;
+    if (kept - 1 < least || (most >= 0 && kept - 1 > most))
+        return failUsage("usage: zq3hist %s %s", argv[0], form);
+    return 0;
+}
+
+int takePlace(const char* argument, historyPlace* place)
+{
+    struct stat status;
+    size_t length = strlen(argument);
+    const char* separator = length != 0 && argument[length - 1] == '/' ? "" : "/";
+    if (length + strlen(separator) > maxDirectoryLength)
+        return fail(argument, "the directory's name has more than %u bytes", maxDirectoryLength);
+    if (stat(argument, &status) != 0)
+        return failWithCode(sqloSystemError | errno, "open the directory", argument);
+    if (!S_ISDIR(status.st_mode))
+        return fail(argument, "not a directory");
+    snprintf(place->directory, sizeof place->directory, "%s%s", argument, separator);
+    snprintf(place->historyPath, sizeof place->historyPath, "%s%s" SQLUH_HISTORY_NAME, argument,
+             separator);
+    snprintf(place->shadowPath, sizeof place->shadowPath, "%s%s" SQLUH_SHADOW_NAME, argument,
+             separator);
+    return 0;
+}
+
+bool hasHistoryFile(const historyPlace* place)
+{
+    return ossPathExists(place->historyPath);
+}
+
+bool queryLock(const historyPlace* place, SQLO_NLCK* lock, SQLO_NLCKSTATE* state)
+{
+    return hasHistoryFile(place) &&
+           sqloNLCKInit(place->historyPath, lock, sqloNLCKUseNodeNumber) == 0 &&
+           sqloNLCKQuery(lock, state) == 0;
+}
+
+static void fatalSignals(sigset_t* set)
+{
+    sigemptyset(set);
+    static constexpr int numbers[] = {SIGINT, SIGTERM, SIGHUP, SIGQUIT};
+    for (int number : numbers)
+        sigaddset(set, number);
+}
+
+static void holdSignals(void)
+{
+    sigset_t set;
+    fatalSignals(&set);
+    sigprocmask(SIG_BLOCK, &set, nullptr);
+}
+
+void releaseSignals(void)
+{
+    sigset_t set;
+    fatalSignals(&set);
+    sigprocmask(SIG_UNBLOCK, &set, nullptr);
+}
+
+// A file that may not be read counts as unusable for the library, which would move it aside where
+// the directory lets it: whoever lacks the rights must not get that far.
+static int checkRights(const historyPlace* place, int rights)
+{
+    for (const char* path : {place->historyPath, place->shadowPath})
+        if (ossPathExists(path) && access(path, rights) != 0)
+            return failWithCode(sqloSystemError | errno, "use the history", path);
+    return 0;
+}
+
+int awaitLock(const historyPlace* place, int rights)
+{
+    SQLO_NLCK lock = {};
+    SQLO_NLCKSTATE state = {};
+    bool told = false;
+    if (!hasHistoryFile(place) && !ossPathExists(place->shadowPath))
+        return failWithCode(HISTORY_FILE_MISSING, "open the history", place->directory);
+    if (checkRights(place, rights) != 0)
+        return exitFailed;
+    while (queryLock(place, &lock, &state)) {
+        if (state.state == sqloNLCKSetupDied || state.state == sqloNLCKStale)
+            return failWithCode(sqloNLCKOwnerDied, "take the lock", place->directory);
+        if (state.state == sqloNLCKForeign)
+            return failWithCode(sqloNLCKKeyConflict, "take the lock", place->directory);
+        if (state.state == sqloNLCKAbsent)
+            break;
+        if (!told)
+            fprintf(stderr, "zq3hist: waiting for the lock, which process %d holds\n", state.pid);
+        told = true;
+        usleep(50 * 1000);
+    }
+    holdSignals();
+    return 0;
+}
+
+int failOpening(int code, const char* what, const historyPlace* place)
+{
+    fileReport history, shadow;
+    lookAtFile(place->historyPath, &history);
+    lookAtFile(place->shadowPath, &shadow);
+    if (code != HISTORY_FILE_DAMAGED || repairDue(&history, &shadow) == repairAnew)
+        return failWithCode(code, what, place->directory);
+    return fail(place->directory,
+                "cannot %s: the history needs a repair that failed; the diagnostic log tells why "
+                "(a full disk, for one), and nothing is lost",
+                what);
+}
+
+int openHistory(historyPlace* place, unsigned int accessMode, SQLUH_HANDLE** handle)
+{
+    int rc = awaitLock(place, accessMode == SQLUH_OPEN_READ ? R_OK : R_OK | W_OK);
+    if (rc != 0)
+        return rc;
+    rc = sqluhOpen(handle, place->directory, accessMode);
+    if (rc == HISTORY_FILE_RECREATED)
+        sqluhClose(handle);
+    if (rc != 0)
+        releaseSignals();
+    return rc == 0 ? 0 : failOpening(rc, "open the history", place);
+}
+
+int closeHistory(const historyPlace* place, SQLUH_HANDLE** handle, const char* what)
+{
+    int rc = sqluhClose(handle);
+    releaseSignals();
+    return rc == 0 ? 0 : failWithCode(rc, what, place->directory);
+}
+
+static bool isEmptyFile(const char* path)
+{
+    struct stat status;
+    return stat(path, &status) == 0 && status.st_size == 0;
+}
+
+int createIfMissing(historyPlace* place)
+{
+    if (hasHistoryFile(place) && !isEmptyFile(place->historyPath))
+        return 0;
+    if (ossPathExists(place->shadowPath))
+        return 0; // the open rebuilds the history from it
+    if (strlen(place->directory) > maxCreateDirectoryLength)
+        return fail(place->directory, "a new history's directory has a name of at most %u bytes",
+                    maxCreateDirectoryLength);
+
+    // The lock is made from the history file and needs an empty one. It is filled, not replaced, so
+    // whoever waits for the lock waits for the right one; and only if nobody else did it meanwhile.
+    SQLUH_HANDLE* handle = nullptr;
+    if (hasHistoryFile(place) && awaitLock(place, R_OK | W_OK) != 0)
+        return exitFailed;
+    holdSignals();
+    int rc = sqluhHandleAllocAndInit(place->directory, &handle);
+    if (rc == 0)
+        rc = sqluhLock(handle);
+    if (rc == 0 && isEmptyFile(place->historyPath) && !ossPathExists(place->shadowPath))
+        rc = sqluhCreate(place->directory);
+    if (handle != nullptr) {
+        int unlocked = sqluhUnlock(handle);
+        rc = rc != 0 ? rc : unlocked;
+        sqluhHandleFree(&handle);
+    }
+    releaseSignals();
+    return rc == 0 ? 0 : failWithCode(rc, "create the history", place->directory);
+}

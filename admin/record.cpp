@@ -1,0 +1,210 @@
+// Records: their memory, and reading one from a history.
+#include "admin/record.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
+#include "history/sqluhcol.h"
+
+static constexpr textBuffer zq3HistoryData::*textMembers[] = {
+    &zq3HistoryData::objectPart, &zq3HistoryData::secondTimestamp, &zq3HistoryData::firstText,
+    &zq3HistoryData::lastText,   &zq3HistoryData::idText,          &zq3HistoryData::qualifierText,
+    &zq3HistoryData::nameText,   &zq3HistoryData::longText,        &zq3HistoryData::noteText,
+    &zq3HistoryData::commandText};
+
+historyRecord* newRecord(void)
+{
+    historyRecord* record = static_cast<historyRecord*>(calloc(1, sizeof *record));
+    if (record != nullptr) {
+        record->entry.data = &record->data;
+        record->data.eventSqlca = &record->event;
+        sqloinca(&record->event);
+    }
+    return record;
+}
+
+void freeRecord(historyRecord* record)
+{
+    if (record == nullptr)
+        return;
+    for (textBuffer zq3HistoryData::*text : textMembers)
+        free((record->data.*text).data);
+    for (uint32_t i = 0; i < record->data.maxTablespaces; i++)
+        free(record->data.tablespaceBuffers[i].data);
+    free(record->data.tablespaceBuffers);
+    free(record);
+}
+
+// Makes room for a text of so many characters and the terminator.
+static bool reserveText(textBuffer* text, uint32_t length)
+{
+    if (length < text->capacity)
+        return true;
+    if (length == UINT32_MAX)
+        return false;
+    char* grown = static_cast<char*>(realloc(text->data, size_t{length} + 1));
+    if (grown == nullptr)
+        return false;
+    text->data = grown;
+    text->capacity = length + 1;
+    return true;
+}
+
+bool setText(textBuffer* text, const char* bytes, size_t length)
+{
+    if (length >= UINT32_MAX || !reserveText(text, static_cast<uint32_t>(length)))
+        return false;
+    memcpy(text->data, bytes, length);
+    text->data[length] = '\0';
+    text->length = static_cast<uint32_t>(length);
+    return true;
+}
+
+// Makes room for so many names; those that are new are empty and without a buffer.
+static bool reserveTablespaces(zq3HistoryData* data, uint32_t count)
+{
+    if (count <= data->maxTablespaces)
+        return true;
+    uint32_t capacity = count < UINT32_MAX / 2 ? count + count / 2 : count;
+    textBuffer* grown = static_cast<textBuffer*>(
+        reallocarray(data->tablespaceBuffers, capacity, sizeof(textBuffer)));
+    if (grown == nullptr)
+        return false;
+    memset(grown + data->maxTablespaces, 0, (capacity - data->maxTablespaces) * sizeof *grown);
+    data->tablespaceBuffers = grown;
+    data->maxTablespaces = capacity;
+    return true;
+}
+
+bool addTablespace(historyRecord* record, const char* bytes, size_t length)
+{
+    zq3HistoryData* data = &record->data;
+    if (data->numTablespaces == UINT32_MAX || !reserveTablespaces(data, data->numTablespaces + 1) ||
+        !setText(&data->tablespaceBuffers[data->numTablespaces], bytes, length))
+        return false;
+    data->numTablespaces++;
+    return true;
+}
+
+bool addRecord(historyList* list, historyRecord* record)
+{
+    if (list->count == list->capacity) {
+        size_t capacity = list->capacity == 0 ? 64 : 2 * list->capacity;
+        void* grown = reallocarray(list->records, capacity, sizeof *list->records);
+        if (grown == nullptr)
+            return false;
+        list->records = static_cast<historyRecord**>(grown);
+        list->capacity = capacity;
+    }
+    list->records[list->count++] = record;
+    return true;
+}
+
+void freeList(historyList* list)
+{
+    for (size_t i = 0; i < list->count; i++)
+        freeRecord(list->records[i]);
+    free(list->records);
+    *list = {};
+}
+
+// --- Reading -------------------------------------------------------------------------------------
+
+// Whether the entry just read fitted; if not, makes room for what did not.
+static int makeRoom(historyRecord* record, bool* fitted)
+{
+    zq3HistoryData* data = &record->data;
+    *fitted = data->numTablespaces <= data->maxTablespaces;
+    bool room = reserveTablespaces(data, data->numTablespaces);
+    for (textBuffer zq3HistoryData::*member : textMembers) {
+        textBuffer* text = &(data->*member);
+        *fitted = *fitted && text->length < text->capacity;
+        room = room && reserveText(text, text->length);
+    }
+    // Where there was no slot for a name, its length is not known yet either.
+    for (uint32_t i = 0; *fitted && i < data->numTablespaces; i++)
+        *fitted = data->tablespaceBuffers[i].length < data->tablespaceBuffers[i].capacity;
+    for (uint32_t i = 0; room && i < data->numTablespaces; i++)
+        room = reserveText(&data->tablespaceBuffers[i], data->tablespaceBuffers[i].length);
+    return room ? 0 : sqloSystemError | ENOMEM;
+}
+
+// Takes a line whole where the reader stops at the length that the entry states: the writer puts
+// down text and length as they are given to it.
+static bool takeLine(textBuffer* text, uint32_t* length, const char* line, const char* column)
+{
+    uint32_t stated;
+    if (!hexColumns(column, &stated))
+        return true; // not as the writer writes it: what the reader made of it counts
+    uint32_t used = static_cast<uint32_t>(strnlen(line, lineTextLength));
+    while (used > 0 && line[used - 1] == ' ')
+        used--;
+    uint32_t kept = stated >= used && stated <= lineTextLength ? stated : used;
+    *length = stated;
+    return setText(text, line, strnlen(line, kept));
+}
+
+// The reader gives a blank for a letter that the file holds as "-".
+static void takeLetter(char* letter, const char* head, unsigned int field)
+{
+    if (head[entryFields[field].at] == SQLUH_EMPTY_WORD[0])
+        *letter = SQLUH_EMPTY_WORD[0];
+}
+
+// Takes from the entry's first lines what the reader changes.
+static int takeAsWritten(historyRecord* record, const char* head)
+{
+    bool framed = true;
+    for (const sqluhField& field : entryFields)
+        framed &= head[field.at + field.width] == ':';
+    if (!framed)
+        return 0;
+    zq3HistoryData* data = &record->data;
+    SQLUH_ENTRY* entry = &record->entry;
+    takeLetter(&data->object, head, fieldObject);
+    takeLetter(&data->operationType, head, fieldOperationType);
+    takeLetter(&data->auxCode, head, fieldAuxCode);
+    bool taken = takeLine(&data->noteText, &entry->noteLength, head + entryNoteAt,
+                          head + entryFields[fieldNoteLength].at);
+    if (taken && entry->longTextLength != 0)
+        taken = takeLine(&data->longText, &entry->longTextLength, head + entryLongTextAt,
+                         head + entryFields[fieldLongTextLength].at);
+    return taken ? 0 : sqloSystemError | ENOMEM;
+}
+
+// Whether the file ends at offset; otherwise an end of file met there lies inside an entry.
+static bool isEndOf(SQLO_FHANDLE file, long long offset)
+{
+    long long end = 0;
+    return sqloseek(file, 0, sqloFromEnd, &end) == 0 && end <= offset;
+}
+
+int readRecord(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, historyRecord* record,
+               long long* offset)
+{
+    char head[entryLongTextAt + lineLength] = {};
+    uint32_t headRead = 0;
+    unsigned int flags = 0;
+    bool fitted = false;
+    int rc = sqloseek(file, 0, sqloFromCurrent, offset);
+    if (rc == 0)
+        rc = sqloread(file, head, sizeof head, &headRead);
+    if (rc == END_OF_FILE)
+        rc = 0;
+    for (int round = 0; rc == 0 && !fitted && round < 4; round++) {
+        rc = sqloseek(file, *offset, sqloFromStart, nullptr);
+        if (rc == 0)
+            rc = sqluhReadEntry(file, &record->entry, workArea, nullptr, nullptr, nullptr, nullptr,
+                                &flags);
+        if (rc == TABLESPACE_LIST_TRUNCATED)
+            rc = 0;
+        if (rc == 0)
+            rc = makeRoom(record, &fitted);
+    }
+    if (rc == 0)
+        rc = takeAsWritten(record, head);
+    if (rc == END_OF_FILE && !isEndOf(file, *offset))
+        rc = HISTORY_FILE_DAMAGED;
+    return rc;
+}

@@ -1,0 +1,36 @@
+// One entry of a history with room for all it can hold.
+#pragma once
+
+#include "history/sqluhist.h"
+
+struct historyRecord {
+    SQLUH_ENTRY entry;   // its data member points at data
+    zq3HistoryData data; // owns its texts; each is terminated and length tells its true length
+    sqlca event;        // what data.eventSqlca points at; counts only if entry.sqlcaLength is not 0
+    bool numberByPlace; // the entry's number is that of its place in the history
+};
+
+struct historyList {
+    historyRecord** records;
+    size_t count;
+    size_t capacity;
+};
+
+// Allocates an empty record; null without memory. freeRecord accepts null.
+historyRecord* newRecord(void);
+void freeRecord(historyRecord* record);
+
+// Replaces a text of a record, or appends a tablespace name. False without memory.
+bool setText(textBuffer* text, const char* bytes, size_t length);
+bool addTablespace(historyRecord* record, const char* bytes, size_t length);
+
+// Appends a record, which is the list's from then on. False without memory.
+bool addRecord(historyList* list, historyRecord* record);
+void freeList(historyList* list);
+
+// Reads the entry at the file's position in full, so that writing the record gives the same bytes
+// again. Returns 0, END_OF_FILE at the end of the file and nowhere else, HISTORY_FILE_DAMAGED (also
+// for an entry that the file's end cuts short), or another code of the reader; *offset receives
+// where the entry begins.
+int readRecord(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, historyRecord* record,
+               long long* offset);

@@ -1,0 +1,56 @@
+// zq3hist repair: opens and closes the history, which repairs it, and says what that did.
+#include "admin/zq3hist.h"
+
+#include <unistd.h>
+
+static const char* repairedWords(repairKind done)
+{
+    return done == repairShadow    ? "The shadow was made anew from the history file."
+           : done == repairHistory ? "The history file was made anew from the shadow; a batch that "
+                                     "was not finished is undone."
+                                   : "Neither file could be used. Both were moved aside, to "
+                                     "zq3rhist.a and zq3rhist.b, and an empty history was made.";
+}
+
+static repairKind lookAtBoth(const historyPlace* place)
+{
+    fileReport history, shadow;
+    lookAtFile(place->historyPath, &history);
+    lookAtFile(place->shadowPath, &shadow);
+    return repairDue(&history, &shadow);
+}
+
+int repairMain(int argc, char** argv)
+{
+    historyPlace place = {};
+    int rc = takeArguments(argc, argv, "DIR", 1, 1, nullptr);
+    if (rc == 0)
+        rc = takePlace(argv[1], &place);
+    if (rc == 0)
+        rc = awaitLock(&place, R_OK | W_OK);
+    if (rc != 0)
+        return rc;
+
+    // An open does one repair; after one of the history the shadow's mark takes another.
+    repairKind due = lookAtBoth(&place);
+    if (due == repairNothing)
+        puts("Nothing to repair: both files can be used and are in step.");
+    bool lost = false;
+    for (int round = 0; rc == 0 && due != repairNothing && round < 3; round++) {
+        SQLUH_HANDLE* handle = nullptr;
+        rc = sqluhOpen(&handle, place.directory, SQLUH_OPEN_UPDATE);
+        lost = lost || rc == HISTORY_FILE_RECREATED;
+        if (rc >= 0)
+            puts(repairedWords(rc == HISTORY_FILE_RECREATED ? repairAnew : due));
+        int closed = sqluhClose(&handle);
+        rc = rc < 0 ? rc : closed;
+        due = lookAtBoth(&place);
+    }
+    releaseSignals();
+    if (rc != 0)
+        return failOpening(rc, "repair the history", &place);
+    if (lost)
+        return fail(place.directory,
+                    "the history is empty: restore a backup of it, or load it anew");
+    return exitDone;
+}

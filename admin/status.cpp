@@ -1,0 +1,163 @@
+// zq3hist status: both files and the lock, as they stand.
+#include "admin/zq3hist.h"
+
+#include <cstring>
+
+#include "admin/stanza.h"
+
+struct directoryReport {
+    fileReport history, shadow;
+    repairKind due;
+    bool lockKnown;
+    SQLO_NLCK lock;
+    SQLO_NLCKSTATE lockState;
+};
+
+static const char* statusWords(char status, bool isShadow)
+{
+    switch (status) {
+    case statusConsistent:
+        return "consistent";
+    case statusCommitted: // what the shadow keeps of a commit
+        return isShadow ? "consistent since the last commit" : "a batch waits for the shadow";
+    case statusPending:
+        return isShadow ? "the history was rebuilt from it" : "a batch is unfinished";
+    default:
+        return "no known status";
+    }
+}
+
+static const char* lockWords(int state)
+{
+    switch (state) {
+    case sqloNLCKAbsent:
+        return "free";
+    case sqloNLCKSettingUp:
+        return "being taken";
+    case sqloNLCKSetupDied:
+        return "left by a process that died while it took it";
+    case sqloNLCKHeld:
+        return "held";
+    case sqloNLCKStale:
+        return "left by a process that died while it held it";
+    default:
+        return "another program's semaphore set has its key";
+    }
+}
+
+static bool isUnreadable(const fileReport* file)
+{
+    return file->present && (file->rc & static_cast<int>(0xFFFF0000)) == sqloSystemError;
+}
+
+static const char* verdict(const directoryReport* report)
+{
+    repairKind due = report->due;
+    if (due == repairAnew && (isUnreadable(&report->history) || isUnreadable(&report->shadow)))
+        return "cannot be read";
+    return due == repairNothing   ? "usable; both files are in step"
+           : due == repairShadow  ? "usable; the next open rebuilds the shadow from the history"
+           : due == repairHistory ? "usable; the next open rebuilds the history from the shadow"
+                                  : "not usable; the next open would move both files aside";
+}
+
+static void showFile(const char* title, const char* name, const fileReport* file)
+{
+    bool isShadow = strcmp(name, SQLUH_SHADOW_NAME) == 0;
+    printf("%-10s%s: ", title, name);
+    if (!file->present) {
+        puts("missing");
+        return;
+    }
+    printf("%llu bytes, ", file->size);
+    if (file->rc != 0) {
+        printf("header not readable: %s\n", wordsForCode(file->rc));
+        return;
+    }
+    fputs("status '", stdout);
+    putEscaped(stdout, &file->header.status, 1);
+    printf("' (%s), %u entries, newest ", statusWords(file->header.status, isShadow),
+           file->header.entryCount);
+    putEscaped(stdout, file->header.timestamp, timestampWidth);
+    printf(" at offset %llu, node %u\n", static_cast<unsigned long long>(file->header.offset3),
+           file->header.nodeNumber);
+}
+
+static void showLock(const directoryReport* report)
+{
+    printf("%-10s", "lock");
+    if (!report->lockKnown) {
+        puts("unknown");
+        return;
+    }
+    printf("%s (key 0x%08X", lockWords(report->lockState.state),
+           static_cast<unsigned int>(report->lock.key));
+    if (report->lockState.pid > 0)
+        printf(", process %d", report->lockState.pid);
+    puts(")");
+}
+
+static void showJsonFile(const char* key, const fileReport* file)
+{
+    const SQLUH_HEADER* header = &file->header;
+    printf(",\"%s\":{\"present\":%s", key, file->present ? "true" : "false");
+    if (file->present)
+        printf(",\"size\":%llu,\"usable\":%s", file->size, file->usable ? "true" : "false");
+    if (file->rc == 0) {
+        fputs(",\"status\":", stdout);
+        putJsonText(stdout, &header->status, 1);
+        fputs(",\"timestamp\":", stdout);
+        putJsonText(stdout, header->timestamp, timestampWidth);
+        printf(",\"entries\":%u,\"newestAt\":%llu,\"maxTablespaces\":%u,\"maxCommandLength\":%u"
+               ",\"node\":%u",
+               header->entryCount, static_cast<unsigned long long>(header->offset3),
+               header->number8, header->maxCommandLength, header->nodeNumber);
+    }
+    putchar('}');
+}
+
+static void showJson(const historyPlace* place, const directoryReport* report)
+{
+    static const char* const repairs[] = {"none", "shadow", "history", "anew"};
+    static const char* const states[] = {"free", "being taken", "setup died",
+                                         "held", "holder died", "foreign"};
+    fputs("{\"directory\":", stdout);
+    putJsonText(stdout, place->directory, strlen(place->directory));
+    printf(",\"usable\":%s,\"repair\":\"%s\"", report->due != repairAnew ? "true" : "false",
+           repairs[report->due]);
+    showJsonFile("history", &report->history);
+    showJsonFile("shadow", &report->shadow);
+    fputs(",\"lock\":", stdout);
+    if (report->lockKnown)
+        printf("{\"state\":\"%s\",\"key\":%u,\"process\":%d}}\n", states[report->lockState.state],
+               static_cast<unsigned int>(report->lock.key), report->lockState.pid);
+    else
+        puts("null}");
+}
+
+int statusMain(int argc, char** argv)
+{
+    historyPlace place = {};
+    directoryReport report = {};
+    bool json = false;
+    int rc = takeArguments(argc, argv, "[--json] DIR", 1, 1, &json);
+    if (rc == 0)
+        rc = takePlace(argv[1], &place);
+    if (rc != 0)
+        return rc;
+    lookAtFile(place.historyPath, &report.history);
+    lookAtFile(place.shadowPath, &report.shadow);
+    if (!report.history.present && !report.shadow.present && !json)
+        return failWithCode(HISTORY_FILE_MISSING, "show the history", place.directory);
+    report.due = repairDue(&report.history, &report.shadow);
+    report.lockKnown = queryLock(&place, &report.lock, &report.lockState);
+    if (json) {
+        showJson(&place, &report);
+    } else {
+        showFile("history", SQLUH_HISTORY_NAME, &report.history);
+        showFile("shadow", SQLUH_SHADOW_NAME, &report.shadow);
+        showLock(&report);
+        printf("%-10s%s\n", "", verdict(&report));
+    }
+    return report.due == repairAnew ? exitFailed : exitDone;
+}

@@ -1,0 +1,129 @@
+// The administrator's tool for history directories: its subcommands and what they share.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <cstdio>
+
+#include "history/sqluhist.h"
+
+// Exit statuses, which the subcommands return.
+enum : int {
+    exitDone = 0,
+    exitFailed = 1, // the history is not sound, or what was asked for could not be done
+    exitUsage = 2,  // the command line is wrong
+};
+
+// Each takes its own name as argv[0] and returns an exit status.
+int loadMain(int argc, char** argv);
+int dumpMain(int argc, char** argv);
+int statusMain(int argc, char** argv);
+int verifyMain(int argc, char** argv);
+int repairMain(int argc, char** argv);
+int copyMain(int argc, char** argv);
+int backupMain(int argc, char** argv);
+int restoreMain(int argc, char** argv);
+int unlockMain(int argc, char** argv);
+int imagesMain(int argc, char** argv);
+int planMain(int argc, char** argv);
+
+// --- Messages (message.cpp) ----------------------------------------------------------------------
+
+// Says "zq3hist: what, where" on standard error, what being formatted, and returns exitFailed.
+int fail(const char* where, const char* format, ...) __attribute__((format(printf, 2, 3)));
+
+// Says the same in the words for a code of the library, with what to do about it: "zq3hist:
+// cannot WHAT: reason, where".
+int failWithCode(int code, const char* what, const char* where);
+
+// Complains about the command line and returns exitUsage.
+int failUsage(const char* format, ...) __attribute__((format(printf, 1, 2)));
+
+// The words for a code of the library. They live until the next call.
+const char* wordsForCode(int code);
+
+// Writes bytes with everything but printable ASCII as escapes of the stanza form.
+void putEscaped(FILE* out, const char* text, size_t length);
+
+// --- Directories and locks (access.cpp) ----------------------------------------------------------
+
+// A history directory as the library takes it, and its two files.
+struct historyPlace {
+    char directory[pathCapacity]; // ends with the separator
+    char historyPath[pathCapacity];
+    char shadowPath[pathCapacity];
+};
+
+// Takes a directory from the command line, with or without its last separator. Complains and
+// returns exitFailed when it is too long or no directory, else 0.
+int takePlace(const char* argument, historyPlace* place);
+
+// Takes an argument list of the form [--json] DIRECTORY: json may be null. Returns 0 or exitUsage.
+int takeArguments(int argc, char** argv, const char* form, int least, int most, bool* json);
+
+bool hasHistoryFile(const historyPlace* place);
+
+// The state of the lock, looked at without touching it. False when the directory has no history
+// file to make a key of, or the system does not tell.
+bool queryLock(const historyPlace* place, SQLO_NLCK* lock, SQLO_NLCKSTATE* state);
+
+// Waits until no living process holds the lock, and says so when it has to; from then on the
+// signals that would end the process are held back until releaseSignals, since dying with the lock
+// leaves it to an administrator. rights: what access(2) must grant for the two files. Complains and
+// returns exitFailed when there is no history, when a right is missing, or when the wait would
+// never end; else 0.
+int awaitLock(const historyPlace* place, int rights);
+void releaseSignals(void);
+
+// Says why an open failed, telling a repair that failed from a history that is beyond one, and
+// returns exitFailed.
+int failOpening(int code, const char* what, const historyPlace* place);
+
+// Opens the history, which repairs it if it must. Complains on failure and returns exitFailed. A
+// history that had to be made anew is a failure, too: the handle is then closed.
+int openHistory(historyPlace* place, unsigned int accessMode, SQLUH_HANDLE** handle);
+
+// Closes what openHistory opened. what: the job that fails with the close.
+int closeHistory(const historyPlace* place, SQLUH_HANDLE** handle, const char* what);
+
+// Makes an empty pair of files, under the lock, when the directory has none. Complains on failure
+// and returns exitFailed, else 0.
+int createIfMissing(historyPlace* place);
+
+// --- The two files (files.cpp) -------------------------------------------------------------------
+
+// What one of the two files shows from outside.
+struct fileReport {
+    bool present;
+    unsigned long long size;
+    int rc;              // of reading the header
+    SQLUH_HEADER header; // valid if rc is 0
+    bool usable;
+};
+void lookAtFile(const char* path, fileReport* report);
+
+// What the next open will do about the two files.
+enum repairKind { repairNothing, repairShadow, repairHistory, repairAnew };
+repairKind repairDue(const fileReport* history, const fileReport* shadow);
+
+// What reading all entries of a file found.
+struct entriesReport {
+    int rc;           // 0, or what ended the reading early
+    long long offset; // of the entry that could not be read, or of the end
+    uint32_t count;
+    uint32_t maxTablespaces;
+    uint32_t maxCommandLength;
+    char newest[timestampWidth + 1]; // largest timestamp of 14 digits; empty: none
+    long long newestAt;              // offset of its last entry
+    uint32_t digest;                 // equal for equal entries
+};
+
+// Reads all entries of an open file, behind its header. progress: null, or what a progress bar on
+// the terminal is titled with when it takes long.
+void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* progress,
+                    entriesReport* report);
+
+// Opens a file and reads header and entries. False, having complained, when one of them is damaged
+// or its status is neither blank nor 'C'. name: what the file is called in messages; what: the job
+// that fails.
+bool isSoundImage(const char* path, const char* name, const char* what);
