@@ -1,0 +1,76 @@
+#!/usr/bin/env bash
+# Do the documents say what the programs do? match.sh ZQ3CKRST ZQ3HIST
+set -u
+zq3ckrst=$1 zq3hist=$2
+cd "$(dirname "$0")/../.." || exit 1
+failures=0
+
+# same WHAT EXPECTED FOUND: two lists of lines are equal, whatever their order.
+same() {
+  local expected found
+  expected=$(sort -u <<<"$2") found=$(sort -u <<<"$3")
+  [ -n "$expected" ] && [ "$expected" = "$found" ] && return
+  echo "$1 (< expected, > found):"
+  diff <(echo "$expected") <(echo "$found")
+  failures=$((failures + 1))
+}
+
+# holds FILE TEXT...: each text is in the file's text, line breaks and formatting aside.
+holds() {
+  local file=$1 plain text
+  shift
+  case $file in
+    man/*) plain=$(mandoc -Tascii -Owidth=1000 "$file" | sed "s,.\x08,,g" | tr -s ' \t\n' ' ') ;;
+    *) plain=$(tr -s ' \t\n' ' ' <"$file") ;;
+  esac
+  for text; do
+    [[ $plain == *"$text"* ]] || { echo "$file lacks: $text"; failures=$((failures + 1)); }
+  done
+}
+
+# Which other pages the machine has is not the pages' fault.
+lint=$(mandoc -Tlint man/* 2>/dev/null | grep -v 'referenced manual not found')
+[ -z "$lint" ] || { echo "$lint"; failures=$((failures + 1)); }
+
+# zq3ckrst: -v is the one option that the help text does not show.
+help=$("$zq3ckrst" -h 2>&1)
+options=$(grep -oP '^   -\K[a-z?]+(?= )' <<<"${help%%Usage*}" | grep -o .; echo v)
+same "options of zq3ckrst(1)" "$options" \
+  "$(grep -oP '^\.It Fl \K.*' man/zq3ckrst.1 | grep -oP '(^|, |\\&)\K[a-z?]')"
+same "options completed for zq3ckrst" "$(grep -v '[u?]' <<<"$options")" \
+  "$(grep -oP 'compgen -W "\K-d[^"]*' completion/zq3ckrst.bash | grep -o '[a-z]')"
+messages=$(tr -d '\n' <tool/zq3ckrst.h | grep -oP 'planMessage \K.*?;')
+same "sites in zq3ckrst(1)" "$(grep -oP ', *\K\d+(?=\})' <<<"$messages")" \
+  "$(grep -oP '^\.It Li .* Pq \\-\d+[,;] \K.*' man/zq3ckrst.1 | grep -oP '\d+')"
+mapfile -t texts < <(grep -oP '= \{"\K[^"%\\]*' <<<"$messages" | sed 's/ *$//')
+holds man/zq3ckrst.1 "${texts[@]}"
+holds docs/troubleshooting.md "${texts[@]}"
+same "exit statuses in zq3ckrst(1)" \
+  "$(grep -oP '^    \w+ = -\K\d+(?=,)' tool/zq3ckrst.h | while read -r code; do
+    echo $((256 - code)) -$code; done)" \
+  "$(grep -oP '^\.It \K\d+ Ta \\-\d+' man/zq3ckrst.1 | sed 's/ Ta \\/ /')"
+
+# zq3hist: the commands with their arguments as the help text gives them, and the fields of stanzas.
+help=$("$zq3hist" --help)
+same "commands of zq3hist(1)" \
+  "$(grep -oP '^  \K[a-z]+ +(\[--json\] )?[A-Z. \[\]]+(?= )' <<<"$help" | tr -s ' ' | sed 's/ $//' |
+    tr a-z A-Z)" \
+  "$(mandoc -Tascii -Owidth=1000 man/zq3hist.1 | sed "s,.\x08,,g" | sed '/^DESCRIPTION/q' |
+    grep -oP '^ {5}zq3hist \K[a-z]+.*' | sed 's/ \.\.\./.../' | tr a-z A-Z)"
+mapfile -t words < <(grep -oP '^  \K(--)?[a-z]+' <<<"$help"; grep -oP '\[\K--[a-z]+' <<<"$help")
+holds man/zq3hist.1 "${words[@]}"
+holds completion/zq3hist.bash "${words[@]}"
+mapfile -t texts < <(grep -ohP '(^ *\{"|#define FIELD_\w+ ")\K[A-Z][^"]*' admin/fields.*)
+holds man/zq3hist.1 "${texts[@]}"
+
+# zq3rhist(5) and the log records.
+same "fields of an entry in zq3rhist(5)" \
+  "$(tr -d '\n' <history/sqluhist.h | grep -oP 'entryFields\[\w+\] = \{\K.*?(?=\};)' |
+    grep -oP '\{\K\d+, \d+' | tr -d ,)" \
+  "$(sed -n '/^\.Ss Entry/,/^\.El/p' man/zq3rhist.5 | grep -oP '^\.It \K\d+ Ta \d+ Ta \w+' |
+    sed 's/ Ta / /;s/ Ta .*//')"
+mapfile -t texts < <(tr '\n' ' ' <history/sqluhlog.h |
+  grep -oP '#define TEXT_\w+[ \\]+"\K[^"%\\]*' | sed 's/ *$//; s/  / /g')
+holds docs/troubleshooting.md "${texts[@]}"
+
+exit $((failures > 0))
