@@ -148,8 +148,8 @@ extern const char DELETED_RENAMED[nameSize];
 // image located. timestamp: of the target, 14 characters. *numBackups is 0 before and the number of
 // backup images up to and with the target afterwards; data->backupIndex and renameIndex are -1
 // before. Returns 0, scanOpenFailed, scanGetFailed, scanCloseFailed, outOfMemory or imageNotFound;
-// the entries read so far stay in *data after a failure, too. Without a timestamp (null) no target is
-// looked for: the entries are read and sorted.
+// the entries read so far stay in *data after a failure, too. Without a timestamp (null) no target
+// is looked for: the entries are read and sorted.
 int fetchHistoryEntries(char* alias, char* timestamp, historyData* data, int* numBackups);
 
 // qsort's comparator of historyEntry records: by timestamp, then in the order of the scan.

@@ -308,6 +308,7 @@ TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
         pdtEntry1("a\tb\n", 4, "f");
         sqltData("f", "path", std::string(200, 'x').data(), 200);
         pdtExit(-2161, "f");
+        std::filesystem::remove_all(directory); // _exit runs no destructor
         _exit(sqltGetCompTraceFlag() != 0 ? sqlz_krcbp->nodeNumber : 99);
     }
     const std::string command = "ZQ3TRACE=" + directory + "trace" + " ZQ3NODE=7 " +
