@@ -27,9 +27,6 @@
 #define TEXT_NOT_USEABLE "History files are not useable.\nrc = %d.\n"
 #define TEXT_FILE_SIZE "File size"
 #define TEXT_FILE_CHECKSUM "File header checksum"
-#define TEXT_OWNER_DIED "Named Lock owner died !!!"
-#define TEXT_KEY_CONFLICT "Semaphore key conflict"
-#define TEXT_SET_REMOVED "Semaphore was removed"
 
 static inline pdItem textItem(const char* text)
 {

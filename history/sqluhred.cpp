@@ -1,6 +1,5 @@
 // Reading: the header, with the conversion of older versions, and the entries.
 
-#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
