@@ -149,41 +149,68 @@ static int countByReader(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, entryCount
 }
 
 // Opens a file that has no name any more, to be written through the descriptor and read through the
-// OS-services layer, which knows files by path only. In memory where the folder for temporary files
-// cannot have one.
-static int openNameless(int* descriptor, SQLO_FHANDLE* file)
+// OS-services layer, which knows files by path only: among the temporary files, or in memory.
+static int openNameless(bool inMemory, int* descriptor, SQLO_FHANDLE* file)
 {
-    char path[PATH_MAX];
+    char path[PATH_MAX] = "";
     const char* folder = getenv("TMPDIR");
     if (folder == nullptr || folder[0] == '\0')
         folder = "/tmp";
-    *descriptor = snprintf(path, sizeof path, "%s/zq3scan.XXXXXX", folder) < PATH_MAX
-                      ? mkostemp(path, O_CLOEXEC)
-                      : -1;
-    if (*descriptor >= 0) {
-        int rc = sqloopenp(path, sqloOpenRead, sqloPermissions, file);
-        unlink(path);
-        return rc;
+    if (inMemory) {
+        *descriptor = memfd_create("zq3 history scan", MFD_CLOEXEC);
+        snprintf(path, sizeof path, "/proc/self/fd/%d", *descriptor);
+    } else if (snprintf(path, sizeof path, "%s/zq3scan.XXXXXX", folder) < PATH_MAX) {
+        *descriptor = mkostemp(path, O_CLOEXEC);
+    } else {
+        errno = ENAMETOOLONG;
     }
-    *descriptor = memfd_create("zq3 history scan", MFD_CLOEXEC);
     if (*descriptor < 0)
         return sqloSystemError | errno;
-    snprintf(path, sizeof path, "/proc/self/fd/%d", *descriptor);
-    return sqloopenp(path, sqloOpenRead, sqloPermissions, file);
+    int rc = sqloopenp(path, sqloOpenRead, sqloPermissions, file);
+    if (!inMemory)
+        unlink(path);
+    return rc;
 }
 
-static int copyHistory(SQLUH_HANDLE* handle, int* descriptor, SQLO_FHANDLE* file, entryCount* count)
+static void closeCopy(int* descriptor, SQLO_FHANDLE* file)
 {
-    int rc = sqloseek(handle->fileHandle, 0, sqloFromEnd, &count->size);
+    if (*descriptor >= 0)
+        close(*descriptor);
+    if (file->descriptor != sqloNoFile.descriptor)
+        sqloclose(*file);
+    *descriptor = -1;
+    *file = sqloNoFile;
+}
+
+// Copies the history into a nameless file of the one or the other kind.
+static int copyInto(bool inMemory, SQLO_FHANDLE from, int* descriptor, SQLO_FHANDLE* file,
+                    entryCount* count)
+{
+    *count = {};
+    count->next = headerLength;
+    int rc = sqloseek(from, 0, sqloFromEnd, &count->size);
     if (rc != 0)
         return rc;
     char* buffer = static_cast<char*>(malloc(copyLength + countedLength));
     if (buffer == nullptr)
         return sqloSystemError | ENOMEM;
-    rc = openNameless(descriptor, file);
+    rc = openNameless(inMemory, descriptor, file);
     if (rc == 0)
-        rc = copyAndCount(handle->fileHandle, *descriptor, buffer, count);
+        rc = copyAndCount(from, *descriptor, buffer, count);
     free(buffer);
+    return rc;
+}
+
+// A folder for temporary files that is full, or cannot be written, keeps nobody from a plan: the
+// copy then goes into memory.
+static int copyHistory(SQLO_FHANDLE from, int* descriptor, SQLO_FHANDLE* file, entryCount* count)
+{
+    int rc = copyInto(false, from, descriptor, file, count);
+    if (rc != 0) {
+        closeCopy(descriptor, file);
+        if (copyInto(true, from, descriptor, file, count) == 0)
+            rc = 0;
+    }
     return rc;
 }
 
@@ -212,22 +239,19 @@ int takeSnapshot(char* directory, SQLUH_WORKAREA* workArea, historySnapshot* sna
     int descriptor = -1;
     *snapshot = {};
     snapshot->file = sqloNoFile;
-    count.next = headerLength;
 
     int warning = sqluhOpen(&handle, directory, SQLUH_OPEN_READ);
     if (warning < 0)
         return warning;
-    int rc = copyHistory(handle, &descriptor, &snapshot->file, &count);
+    int rc = copyHistory(handle->fileHandle, &descriptor, &snapshot->file, &count);
     int closed = sqluhClose(&handle);
     if (rc == 0)
         rc = closed;
     if (rc == 0)
         rc = settleSnapshot(workArea, &count, snapshot);
-    if (descriptor >= 0)
+    if (rc != 0)
+        closeCopy(&descriptor, &snapshot->file);
+    else
         close(descriptor);
-    if (rc != 0 && snapshot->file.descriptor != sqloNoFile.descriptor) {
-        sqloclose(snapshot->file);
-        snapshot->file = sqloNoFile;
-    }
     return rc != 0 ? rc : warning;
 }
