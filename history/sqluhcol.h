@@ -1,11 +1,14 @@
-// Taking canonical text apart by column: eight characters at a time, as one 64-bit word.
+// Numbers and words in text, by column; most of them eight characters at a time, as one 64-bit
+// word.
 //
-// These decide only whether a text stands exactly as the writer writes it and what it then says.
-// What they refuse goes through the scanning formats, which accept more.
+// Those that can refuse decide only whether a text stands exactly as the writer writes it and what
+// it then says. What they refuse of a fixed part goes through the scanning formats, which accept
+// more.
 #pragma once
 
 #include <bit>
 #include <cstdint>
+#include <cstdlib>
 #include <cstring>
 
 // The eight characters at text, the first in the lowest byte.
@@ -43,6 +46,37 @@ static inline bool hexColumns(const char* text, uint32_t* value)
     return true;
 }
 
+// Value of each character as a hexadecimal digit, or 0xFF.
+struct digitTable {
+    uint8_t value[256];
+};
+
+static constexpr digitTable makeDigitTable(void)
+{
+    digitTable table = {};
+    for (unsigned int c = 0; c < 256; c++)
+        table.value[c] = static_cast<uint8_t>(c >= '0' && c <= '9'   ? c - '0'
+                                              : c >= 'A' && c <= 'F' ? c - 'A' + 10
+                                              : c >= 'a' && c <= 'f' ? c - 'a' + 10
+                                                                     : 0xFF);
+    return table;
+}
+static constexpr digitTable hexDigits = makeDigitTable();
+
+// Reads width hexadecimal digits; false when another character stands among them.
+static inline bool hexDigitsAt(const char* text, uint32_t width, uint32_t* value)
+{
+    uint32_t result = 0;
+    uint32_t seen = 0;
+    for (uint32_t i = 0; i < width; i++) {
+        uint32_t digit = hexDigits.value[static_cast<unsigned char>(text[i])];
+        seen |= digit;
+        result = result << 4 | (digit & 0x0F);
+    }
+    *value = result;
+    return seen <= 0x0F;
+}
+
 // Reads eight decimal digits; false when another character stands among them.
 static inline bool decimalColumns(const char* text, uint32_t* value)
 {
@@ -54,6 +88,16 @@ static inline bool decimalColumns(const char* text, uint32_t* value)
     uint64_t low = (digits >> 16 & 0x000000FF000000FF) * 0x0000271000000001; // 10^4 and 1
     *value = static_cast<uint32_t>((high + low) >> 32);
     return true;
+}
+
+// The number in width characters (at most 31) as strtoul takes it, which accepts more than the
+// above: 0 where there is none.
+static inline uint32_t numberAt(const char* text, uint32_t width, int base)
+{
+    char digits[32];
+    memcpy(digits, text, width);
+    digits[width] = '\0';
+    return static_cast<uint32_t>(strtoul(digits, nullptr, base));
 }
 
 // A bit for each of the first count (1 to 8) characters: set where it is printable and no blank.

@@ -30,10 +30,7 @@ int sqluhCreate(char* directory)
     } else {
         ossSnprintf(historyPath, sizeof historyPath, "%s" SQLUH_HISTORY_NAME, directory);
         ossSnprintf(shadowPath, sizeof shadowPath, "%s" SQLUH_SHADOW_NAME, directory);
-        rc = sqloopenp(historyPath, sqloOpenNew, sqloPermissions, &fh);
-        if (rc == sqloFileExisted)
-            rc = 0;
-        logged(rc);
+        rc = logged(createdCode(sqloopenp(historyPath, sqloOpenNew, sqloPermissions, &fh)));
     }
     if (rc == 0) {
         initialHeader(&header);

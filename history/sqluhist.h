@@ -4,9 +4,16 @@
 // 1024 bytes, then entry records back to back to the end of the file. Directories are given as
 // strings that end with the path separator.
 //
-// Every function returns 0, a negative failure or a positive warning that still delivers. Beside
-// the codes listed at a function, every call that touches a file, memory or the lock may return the
-// code of the OS-services call that failed.
+// Texts are terminated, and whatever a pointer leads to stays the caller's, unless a comment says
+// otherwise. Lengths, sizes and offsets are in bytes.
+//
+// A code is 0, a negative failure, or a positive warning that still delivers. The comments name all
+// that can come back; of those passed up,
+//   a call's code   is what the OS-services call returned (sqo/sqlo.h), unchanged;
+//   transfer code   is that of a failed or short read or write as sqlzGetZRCInfo maps it,
+//                   HISTORY_FILE_DAMAGED where it maps it to 0;
+//   lock code       is sqloNLCKKeyFailure, sqloNLCKKeyConflict, sqloNLCKOwnerDied, or
+//                   sqloSystemError with the errno (sqo/sqlonlck.h).
 #pragma once
 
 #include <cstddef>
@@ -78,7 +85,8 @@ static constexpr char headerScanFormat[] =
 
 // The header in memory. Its 92 bytes, integers little-endian, are what the header's checksum is
 // taken over, so the layout is part of the file format; packing keeps the size at 92 where 64-bit
-// integers are aligned to 8 bytes.
+// integers are aligned to 8 bytes. Members named by a number are fields whose meaning belongs to
+// the code that adds entries: this library carries them.
 #pragma pack(push, 4)
 struct SQLUH_HEADER {
     uint32_t checksum;
@@ -226,12 +234,14 @@ enum : unsigned int {
     matchSqlcodeSet = 0x40, // the entry's sqlca line holds an sqlcode that is not 0
 };
 
-// The checksum of both record kinds: the exclusive-or of the buffer's 32-bit little-endian words,
-// the last partial word padded with zeros. The buffer need not be aligned.
+// Returns the checksum of both record kinds: the exclusive-or of the buffer's 32-bit little-endian
+// words, the last partial word padded with zeros. The buffer need not be aligned.
 uint32_t sqluhChecksum(void* buffer, unsigned int length);
 
 // sprintf under the "C" locale: returns the number of characters formatted, the terminator not
-// counted. Switches LC_CTYPE of the whole process for the duration of the call, unless it is "C".
+// counted; negative when formatting failed. buffer has room for all of it. Switches LC_CTYPE of the
+// whole process for the duration of the call, unless it is "C"; a locale's name of more than 33
+// characters is not restored.
 int sqluhSprintf(char* buffer, const char* format, ...) __attribute__((format(printf, 2, 3)));
 
 // --- Reading and writing records -----------------------------------------------------------------
@@ -239,37 +249,44 @@ int sqluhSprintf(char* buffer, const char* format, ...) __attribute__((format(pr
 
 // Writes the header at offset 0 and leaves the file at 1024. Sets the record's version to the
 // current one and its checksum. Returns 0; HISTORY_FILE_DAMAGED when it could not be formed or
-// fewer bytes were written; a failed write's code as sqlzGetZRCInfo maps it.
+// fewer bytes were written; a transfer code; the allocation's or the seek's code.
 int sqluhWriteHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header);
 
 // Reads the header into *header, converting those of older versions, and leaves the file at 1024.
-// The record's checksum is 0 afterwards. Returns 0; END_OF_FILE for a file of 0 bytes;
-// HISTORY_FILE_DAMAGED; a failed read's code as sqlzGetZRCInfo maps it. After a failure *header may
-// hold part of a header and must not be used.
+// The record's checksum is 0 afterwards. Returns 0; END_OF_FILE for a file of 0 bytes, and when the
+// entry that an older header names lies at or behind the end of the file; HISTORY_FILE_DAMAGED; a
+// transfer code; an allocation's or a seek's code. After a failure *header may hold part of a
+// header and must not be used, and the file may stand anywhere.
 int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header);
 
-// Tells whether the record's checksum matches; leaves the member 0.
+// Tells whether the checksum in the record, which still has the version of its file, matches;
+// leaves the member 0.
 bool sqluhCheckHeaderChecksum(SQLUH_HEADER* header);
 
 // Stores the length in characters of the longest command text of all entries (on failure: of those
-// read so far) and leaves the file at 1024. Returns 0 or the reader's code.
+// read so far) and leaves the file at 1024. Returns 0; a failure of sqluhReadEntry other than
+// END_OF_FILE; a seek's or the allocation's code.
 int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength);
 
-// Positions the file at its first entry; stores the new offset.
+// Positions the file at its first entry; newOffset, unless null, receives the offset. Returns 0 or
+// the seek's code.
 int sqluhRewind(SQLO_FHANDLE fh, long long* newOffset);
 
-// Allocates a work area of size bytes, zero-filled. On failure the record stays as it was.
+// Allocates a work area of size bytes, zero-filled; its buffer is the caller's to release. Returns
+// 0, or the allocation's code with the record as it was.
 int sqluhInitWorkArea(SQLUH_WORKAREA* workArea, uint32_t size);
 
 // Reads the entry at the file's position and leaves the file behind it.
 //
 // entry: its data member points to the record to fill, whose buffers are the caller's. workArea: at
-// least 512 bytes; grown, and kept so, when an entry is larger. The filters may be null; matchFlags
-// receives the bits above. A text is cut to its buffer and terminated; its length member tells the
-// length in the file.
+// least 512 bytes; grown, and kept so, when an entry is larger. The filters may be null; of
+// timestampFilter 14 characters count. matchFlags receives the bits above. A text is cut to its
+// buffer and terminated; its length member tells the length in the file, a note's at most 30.
 // Returns 0; TABLESPACE_LIST_TRUNCATED, as 0 but names beyond maxTablespaces were not stored;
-// END_OF_FILE when no entry is left; HISTORY_FILE_DAMAGED; a failed read's code as sqlzGetZRCInfo
-// maps it.
+// END_OF_FILE when no entry is left, or the file ends right behind a fixed part;
+// HISTORY_FILE_DAMAGED; a transfer code; a seek's or the allocation's code when the work area could
+// not be grown. After a failure *entry and its data may be filled in part, and the file stands
+// where the last read left it.
 int sqluhReadEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
                    const char* timestampFilter, const char* qualifierFilter, const char* nameFilter,
                    const char* tablespaceFilter, unsigned int* matchFlags);
@@ -307,12 +324,13 @@ struct SQLUH_HANDLE {
     bool restoredFromImage; // rewritten from a backup image; the close copies it over the shadow
 };
 
-// Allocates and initialises a handle; opens and locks nothing. directory: at most 1011 bytes.
-// Returns 0 or the allocation's code or sqluhPathTooLong, with null stored.
+// Allocates and initialises a handle, the caller's until sqluhHandleFree; opens and locks nothing.
+// directory: at most 1011 bytes; copied. Returns 0, or with null stored sqluhPathTooLong or an
+// allocation's code.
 int sqluhHandleAllocAndInit(char* directory, SQLUH_HANDLE** handleOut);
 
-// Releases the handle and what it owns and sets the caller's pointer to null. Neither closes the
-// file nor releases the lock.
+// Releases the handle and what it owns and sets the caller's pointer to null; null is accepted.
+// Neither closes the file nor releases the lock.
 void sqluhHandleFree(SQLUH_HANDLE** handle);
 
 // Access modes of sqluhOpen; every value but 4 opens for reading and writing.
@@ -320,28 +338,38 @@ enum : unsigned int { SQLUH_OPEN_READ = 4, SQLUH_OPEN_UPDATE = 12 };
 
 // Takes the directory's lock, checks and repairs the two files, opens the history file and reads
 // its header. Waits without limit for the lock; whoever holds a handle on the directory must not
-// open it again. Returns 0 or HISTORY_FILE_RECREATED with an open handle, to be released by
-// sqluhClose; or with null stored HISTORY_FILE_DAMAGED, a code of sqloNLCKInit or sqloNLCKLock, or
-// sqluhPathTooLong.
+// open it again. A file that cannot be opened or read counts as damaged, whatever the reason.
+// Returns 0 or HISTORY_FILE_RECREATED with an open handle, to be released by sqluhClose; or with
+// null stored HISTORY_FILE_DAMAGED; sqluhPathTooLong; a lock code; an allocation's code; a failure
+// of sqluhCreate.
 int sqluhOpen(SQLUH_HANDLE** handleOut, char* directory, unsigned int accessMode);
 
 // Closes the file, copies a restored history over the shadow, releases the lock and frees the
-// handle, whatever fails on the way; the caller's pointer is null afterwards. Returns the first
-// failure.
+// handle, whatever fails on the way; the caller's pointer, which may have been null, is null
+// afterwards. Returns 0 or the first failure: the close's code, the copy's, or a code of
+// sqluhUnlock.
 int sqluhClose(SQLUH_HANDLE** handle);
 
-// Takes and releases the directory's lock through the handle. An unlock without a lock returns 0.
+// Takes the directory's lock for the handle, without limit of time; puts an empty history file
+// where there is none to make the key from. Returns 0, or a lock code with no lock held.
 int sqluhLock(SQLUH_HANDLE* handle);
+
+// Releases the lock if the handle holds it. Returns 0, or sqloSystemError with the errno and the
+// handle still locked.
 int sqluhUnlock(SQLUH_HANDLE* handle);
 
 // --- Creation, recovery, verification ------------------------------------------------------------
 
-// Makes a new, empty pair of files. directory: at most 243 bytes, or sqluhPathTooLong.
+// Makes a new, empty pair of files in place of what is there, under the caller's lock. directory:
+// at most 243 bytes. Returns 0; sqluhPathTooLong; the open's, the close's or the copy's code; a
+// code of sqluhWriteHeader.
 int sqluhCreate(char* directory);
 
 // Allocates a handle, takes the lock, examines both files and, if optToRecover, repairs them. The
-// handle, if stored, is the caller's to unlock and free; no file is open through it. Returns 0,
-// HISTORY_FILE_RECREATED or HISTORY_FILE_DAMAGED.
+// handle is the caller's to unlock and free, also after a failure, unless null is stored; no file
+// is open through it. Returns 0; HISTORY_FILE_RECREATED; HISTORY_FILE_DAMAGED when neither file can
+// be used and none may be repaired, or a repair failed; a code of sqluhHandleAllocAndInit, with
+// null stored; a lock code; a failure of sqluhRecoverFromFatalError.
 int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOut, char* directory,
                                                          bool optToRecover);
 
@@ -349,67 +377,95 @@ int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOu
 // it creates an empty history file where there is none.
 bool sqluhCheckIfHistoryFilesAreUseable(char* directory);
 
-// Tells whether the two files have one size and readable headers. Contents are not compared.
+// Tells whether the two files have one size and readable headers. Contents are not compared. No
+// file is open through the handle; its header is overwritten.
 bool sqluhVerifyHistFilesAreIndentical(SQLUH_HANDLE* handle);
 
-// The repairs. The lock is held and no file is open through the handle.
+// Make one file a copy of the other. The lock is held and no file is open through the handle.
+// Return 0, the copy's code, or a code of sqluhUpdateHeaderStatus.
 int sqluhRecoverHistoryFromShadow(SQLUH_HANDLE* handle);
 int sqluhRecoverShadowFromHistory(SQLUH_HANDLE* handle);
+
+// Moves both files aside, as far as they can be moved, and makes an empty pair; a handle that is
+// locked then holds the new file's lock. No file is open through it. Returns 0; sqluhPathTooLong
+// for a directory of more than 243 bytes, and nothing moved; a lock code; a code of sqluhCreate.
 int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle);
 
-// Rewrites the status letter in the header of the file at path.
+// Rewrites the status letter in the header of the file at path, which nobody has open; does not
+// wait for the disk. Returns 0; the open's or the close's code; a code of sqluhReadHeader or
+// sqluhWriteHeader.
 int sqluhUpdateHeaderStatus(char* path, char status);
 
-// Stores the size in bytes of directory + fileName; on failure *size stays as it was.
+// Stores the size of directory + fileName. Returns 0, or with *size as it was sqluhPathTooLong or
+// the file query's code.
 int sqluh_history_file_get_size(char* directory, char* fileName, unsigned long long* size);
 
-// Verification reads entries and repairs nothing. Each returns 0 or the first code met that is
-// neither 0 nor TABLESPACE_LIST_TRUNCATED; END_OF_FILE ends the entries and is a result only of
-// sqluhVerifyOneEntry, sqluhVerifyCurrentEntry and of an empty file.
+// Verification reads entries and repairs nothing. workArea: as for sqluhReadEntry.
+//
+// Checks the entry at the file's position and leaves the file behind it. Returns 0 or a failure of
+// sqluhReadEntry: END_OF_FILE when no entry is left.
 int sqluhVerifyOneEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
+
+// Checks the entries from the file's position to its end. Returns 0, or the first failure of
+// sqluhReadEntry other than END_OF_FILE.
 int sqluhVerifyHistoryEntries(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
+
+// Checks the header and all entries of the file at path. Returns 0; the open's or the close's code;
+// a code of sqluhReadHeader (END_OF_FILE for an empty file) or of sqluhVerifyHistoryEntries.
 int sqluhVerifyUnopenedHistoryFile(char* path, SQLUH_WORKAREA* workArea);
+
+// sqluhVerifyHistoryEntries for the handle's open file, with its work area: same results.
 int sqluh_verify_history_files(SQLUH_HANDLE* handle);
+
+// sqluhVerifyOneEntry, but leaves the position as it was. Returns its codes or a seek's.
 int sqluhVerifyCurrentEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
 
 // Checks that offset is not behind the end of the file and leaves the position as it was. Returns
-// 0; END_OF_FILE when it is.
+// 0; END_OF_FILE when it is; a seek's code. A file whose end cannot be told passes.
 int sqluhVerifySeekOffsetNotPastEOF(SQLO_FHANDLE fileHandle, long long offset);
 
 // --- Writing and batches -------------------------------------------------------------------------
 
 // Writes entry at the history file's position and records the write for replay. The caller holds
 // the handle of a batch, positions the file and keeps the header's counts. Sets the entry's size,
-// version and checksum, and the length of tablespace names given with 0. Returns 0;
-// HISTORY_FILE_DAMAGED when the lengths do not agree with the contents, and nothing was written; a
-// failed write's code as sqlzGetZRCInfo maps it, after which part of the record may be in the file.
+// version and checksum, and the length of tablespace names given with 0. A text that is missing or
+// shorter than its length is padded with blanks. Returns 0; HISTORY_FILE_DAMAGED when the lengths
+// do not agree with the contents or come to 2 GiB or more, and nothing was written; the
+// allocation's or the seek's code, and nothing was written; a transfer code, after which part of
+// the record may be in the file.
 int sqluhWriteEntry(SQLUH_HANDLE* handle, SQLUH_ENTRY* entry);
 
-// Records a write for replay. entryCount: the header's at the time of the write. Returns 0 when it
-// was recorded or recording stopped; an allocation's code when that failed (replayDisabled is then
-// set).
+// Records a write of length bytes at offset for replay; keeps a copy of the bytes where it needs
+// one. entryCount: the header's at the time of the write. Returns 0 when it was recorded or
+// recording has stopped; an allocation's code when that failed (replayDisabled is then set).
 int sqluhAddReplayEntry(SQLUH_REPLAYAREA* area, long long offset, unsigned int length,
                         const char* bytes, unsigned int entryCount);
 
-// Brings the shadow up to date with a batch that is complete in the history file.
+// Brings the shadow up to date with a batch that is complete in the history file, durably. Returns
+// 0; the first failing call's code (a read's or write's unmapped; a short write's transfer code); a
+// code of sqluhWriteHeader. After a failure the handle's file may be closed.
 int sqluhReplayWorkInShadow(SQLUH_HANDLE* handle);
 
 enum : unsigned int { sqluhAbandon = 0, sqluhCommit = 1 }; // flags of sqluhEndBatch
 
 extern "C" {
 
-// Opens the directory for a batch: on success the handle is open and locked and the history file
-// says 'P'. Returns 0 (also on files that the open had to make anew) or a code of sqluhOpen or
-// sqluhWriteHeader with no handle left.
+// Opens the directory for a batch: on success the handle, to be released by sqluhEndBatch, is open
+// and locked and the history file durably says 'P'. Returns 0 (also on files that the open had to
+// make anew), or with null stored a failure of sqluhOpen, a code of sqluhWriteHeader, or the sync's
+// code.
 int sqluhBeginBatch(SQLUH_HANDLE** handle, char* directory);
 
-// Commits (bit 0 of flags set) or abandons the batch, and closes the handle in every case. Returns
-// the first failure. After a failed commit the next open settles whether the batch survived.
+// Commits (bit 0 of flags set) or abandons the batch, and closes the handle in every case; null is
+// accepted. Returns 0 or the first failure: a code of sqluhWriteHeader, of
+// sqluhReplayWorkInShadow or of sqluhClose, or a sync's code. After a failed commit the next open
+// settles whether the batch survived. A handle without an open file or without the lock is only
+// closed: nothing is committed, and 0 does not mean that it was.
 int sqluhEndBatch(SQLUH_HANDLE** handle, unsigned int flags);
 
-// Copies the history file of one directory over that of another, whose lock is not taken. Returns
-// 0; HISTORY_FILE_RECREATED, and nothing copied, when the source was unusable; a code of the open,
-// the copy or the close.
+// Copies the history file of one directory over that of another, whose lock is not taken; each
+// directory: at most 1011 bytes. Returns 0; HISTORY_FILE_RECREATED, and nothing copied, when the
+// source was unusable; sqluhPathTooLong; a failure of sqluhOpen or sqluhClose; the copy's code.
 int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory);
 
 } // extern "C"
@@ -418,26 +474,33 @@ int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory);
 
 // Allocates one block with a scan record, its sqlca, numTablespaces name buffers of 19 bytes and
 // its text buffers; the command text's holds commandTextLength characters and exists only when
-// asked for. The block is the caller's until sqluhFreeHistoryData, which accepts null.
+// asked for. pool: null for the default one. The block is the caller's until sqluhFreeHistoryData,
+// which accepts a pointer to null and leaves one. Returns 0, or the allocation's code with nothing
+// stored.
 int sqluhAllocateHistoryData(zq3HistoryData** dataOut, SMemPool* pool, unsigned int numTablespaces,
                              bool withCommandText, unsigned int commandTextLength);
 void sqluhFreeHistoryData(zq3HistoryData** data);
 
-// Reads a piece of the history file for a backup image: up to bufferSize bytes from offset. Fewer
-// bytes than asked for mean the end of the file.
+// Reads a piece of the open history file for a backup image: up to bufferSize bytes from offset
+// into buffer, their number into *bytesRead. Fewer than asked for mean the end of the file. Returns
+// 0, or the seek's or the read's code; *bytesRead then means nothing.
 int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned int bufferSize,
                              unsigned char* buffer, unsigned int* bytesRead);
 
-// Writes a piece of a backup image over the history file; the piece at offset 0 comes first and
-// replaces the file.
+// Writes a piece of a backup image, length bytes for offset, over the open history file; the piece
+// at offset 0 comes first and replaces the file. Whatever comes back, sqluhClose then copies the
+// history file over the shadow. Returns 0; the code of the failing close, delete, open, seek or
+// write, unmapped; a short write's transfer code; a lock code, of the new file's lock.
 int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned char* buffer,
                                unsigned int length);
 
-// Tells whether the directory's history holds no entry. Returns 0, HISTORY_FILE_MISSING, or a code
-// of the open or the close; *isEmpty is false unless 0 comes back.
+// Tells whether the directory's history holds no entry, by its header's count. Returns 0 (also on
+// files that the open had to make anew); HISTORY_FILE_MISSING; sqluhPathTooLong; a failure of
+// sqluhOpen or sqluhClose. *isEmpty is false unless 0 comes back.
 int sqluhIsHistoryFileEmpty(char* directory, bool* isEmpty);
 
-// Turns the error in *ca into the warning HISTORY_WARNING with the old code as its token.
+// Turns the error in *ca into the warning HISTORY_WARNING with the old code, in decimal, as its
+// token.
 void sqluh_build_warning(sqlca* ca);
 
 // Tests of a backup's operation-type letter; a letter of neither kind is a full image.

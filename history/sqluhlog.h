@@ -1,4 +1,5 @@
-// How the library writes to the diagnostic log: the records that every source needs.
+// What every source of the library needs: the texts and records of the diagnostic log, and the
+// handling of codes.
 #pragma once
 
 #include "history/sqluhist.h"
@@ -86,6 +87,13 @@ static inline int transferCode(int rc)
 {
     int mapped = sqlzGetZRCInfo(rc);
     return mapped != 0 ? mapped : HISTORY_FILE_DAMAGED;
+}
+
+// 0 for the code of an open that may create, when the file was there before: it is open all the
+// same.
+static inline int createdCode(int rc)
+{
+    return rc == sqloFileExisted ? 0 : rc;
 }
 
 // Allocates size zero-filled bytes, with the place of the request.

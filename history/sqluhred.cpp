@@ -1,425 +1,18 @@
-// Reading: the header, with the conversion of older versions, and the entries.
+// Reading entries.
 
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
 #include "history/sqluhcol.h"
+#include "history/sqluhfix.h"
 #include "history/sqluhist.h"
 #include "history/sqluhlog.h"
 
-// --- Numbers in text -----------------------------------------------------------------------------
-
-static uint32_t numberAt(const char* text, uint32_t width, int base)
-{
-    char digits[32];
-    memcpy(digits, text, width);
-    digits[width] = '\0';
-    return static_cast<uint32_t>(strtoul(digits, nullptr, base));
-}
-
-// width: 10 or 11. Straight digits behind an optional sign are what the writer writes.
-static int32_t signedNumberAt(const char* text, uint32_t width)
-{
-    const char* last8 = text + width - 8;
-    bool sign = text[0] == '+' || text[0] == '-';
-    uint32_t low = 0;
-    uint32_t high = 0;
-    bool canonical = decimalColumns(last8, &low);
-    for (const char* at = text + sign; at < last8; at++) {
-        uint32_t digit = static_cast<uint32_t>(static_cast<unsigned char>(*at)) - '0';
-        canonical &= digit <= 9;
-        high = high * 10 + digit;
-    }
-    if (canonical) {
-        uint64_t value = uint64_t{high} * 100000000 + low;
-        return static_cast<int32_t>(text[0] == '-' ? 0 - value : value);
-    }
-    char digits[32];
-    memcpy(digits, text, width);
-    digits[width] = '\0';
-    return static_cast<int32_t>(strtoll(digits, nullptr, 10));
-}
-
-// Value of each character as a hexadecimal digit, or 0xFF.
-struct digitTable {
-    uint8_t value[256];
-};
-
-static constexpr digitTable makeDigitTable(void)
-{
-    digitTable table = {};
-    for (unsigned int c = 0; c < 256; c++)
-        table.value[c] = static_cast<uint8_t>(c >= '0' && c <= '9'   ? c - '0'
-                                              : c >= 'A' && c <= 'F' ? c - 'A' + 10
-                                              : c >= 'a' && c <= 'f' ? c - 'a' + 10
-                                                                     : 0xFF);
-    return table;
-}
-static constexpr digitTable hexDigits = makeDigitTable();
-
-// Reads width hexadecimal digits; false when another character stands among them.
-static bool hexDigitsAt(const char* text, uint32_t width, uint32_t* value)
-{
-    uint32_t result = 0;
-    uint32_t seen = 0;
-    for (uint32_t i = 0; i < width; i++) {
-        uint32_t digit = hexDigits.value[static_cast<unsigned char>(text[i])];
-        seen |= digit;
-        result = result << 4 | (digit & 0x0F);
-    }
-    *value = result;
-    return seen <= 0x0F;
-}
-
-// --- The header ----------------------------------------------------------------------------------
-
-bool sqluhCheckHeaderChecksum(SQLUH_HEADER* header)
-{
-    pdtEntry();
-
-    uint32_t stored = header->checksum;
-    header->checksum = 0;
-    bool shortImage = header->version >= 7020200 && header->version < 8010000;
-    uint32_t computed =
-        sqluhChecksum(header, shortImage ? headerImageLength7020200 : headerImageLength);
-    bool matches = computed == stored || sqluhChecksum(header, headerImageLengthShort) == stored;
-    if (!matches && sqltGetCompTraceFlag()) {
-        sqltData(__func__, "stored checksum", &stored, sizeof stored);
-        sqltData(__func__, "computed checksum", &computed, sizeof computed);
-    }
-
-    pdtExit(matches);
-    return matches;
-}
-
-int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength)
-{
-    pdtEntry();
-
-    zq3HistoryData data = {};
-    SQLUH_ENTRY entry = {};
-    entry.data = &data;
-    SQLUH_WORKAREA workArea = {};
-    unsigned int flags = 0;
-    long long offset = 0;
-    uint32_t longest = 0;
-
-    int rc = logged(sqluhRewind(fh, &offset));
-    if (rc == 0)
-        rc = logged(sqluhInitWorkArea(&workArea, defaultWorkAreaSize));
-    if (rc == 0) {
-        do {
-            rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
-            if ((rc == 0 || rc == TABLESPACE_LIST_TRUNCATED) && entry.commandLength > longest)
-                longest = entry.commandLength;
-        } while (rc == 0 || rc == TABLESPACE_LIST_TRUNCATED);
-        if (rc == END_OF_FILE)
-            rc = 0;
-        rc = firstOf(rc, logged(sqluhRewind(fh, &offset)));
-        sqlofmblkEx(workArea.buffer);
-    }
-    *maxLength = longest;
-
-    pdtExit(rc);
-    return rc;
-}
-
-// Reads the header's text into buffer, which holds one byte more for the terminator.
-static int readHeaderText(SQLO_FHANDLE fh, char* buffer)
-{
-    uint32_t bytesRead = 0;
-    int rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr));
-    if (rc != 0)
-        return rc;
-
-    rc = sqloread(fh, buffer, headerLength, &bytesRead);
-    if (rc == 0 && bytesRead == headerLength)
-        return 0;
-    if (rc == END_OF_FILE && (bytesRead == 0 || bytesRead == headerLength))
-        return rc;
-    bool partial = rc == END_OF_FILE || rc == 0;
-    logRecord({textItem(partial ? TEXT_HEADER_PARTIAL : TEXT_HEADER_READ), codeItem("rc = ", rc),
-               numberItem("Bytes read: ", bytesRead), dataItem("", buffer, headerLength)});
-    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
-}
-
-// Fields 1 to 13. What a damaged text leaves out stays zero: the checksum tells.
-static void scanHeaderFields(const char* text, SQLUH_HEADER* header)
-{
-    unsigned long long offsets[3] = {};
-    unsigned int checksum = 0;
-    unsigned int numbers[7] = {};
-    unsigned short node = 0;
-    char status = '\0';
-
-    sscanf(text, headerScanFormat, &checksum, &offsets[0], &offsets[1], &offsets[2], &numbers[0],
-           &numbers[1], &numbers[2], &numbers[3], &numbers[4], &numbers[5], &numbers[6], &node,
-           &status);
-    header->checksum = checksum;
-    header->offset1 = offsets[0];
-    header->offset2 = offsets[1];
-    header->offset3 = offsets[2];
-    header->entryCount = numbers[0];
-    header->number6 = numbers[1];
-    header->number7 = numbers[2];
-    header->number8 = numbers[3];
-    header->number9 = numbers[4];
-    header->number10 = numbers[5];
-    header->number11 = numbers[6];
-    header->nodeNumber = node;
-    header->status = status;
-}
-
-// The fields behind the status letter, which stand at places that depend on the version. Returns
-// the place of field 17.
-static uint32_t takeVersionedFields(const char* text, SQLUH_HEADER* header)
-{
-    header->version = numberAt(text + headerVersionAt, headerNumberWidth, 10);
-    if (header->version < 6010000)
-        return headerMaxCommandAt6010000;
-    header->number15 = numberAt(text + headerNumber15At, headerNumberWidth, 16);
-    if (header->version < 7020200)
-        return headerMaxCommandAt7020200;
-    if (text[headerTimestampAt] == SQLUH_EMPTY_WORD[0]) {
-        memset(header->timestamp, ' ', timestampWidth);
-        return headerMaxCommandAtNoTimestamp;
-    }
-    memcpy(header->timestamp, text + headerTimestampAt, timestampWidth);
-    return headerMaxCommandAt;
-}
-
-// Parses the header's text. Returns 0, or HISTORY_FILE_DAMAGED when the entries had to be scanned
-// for field 17 and could not be.
-static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header)
-{
-    memset(header, 0, sizeof *header);
-    scanHeaderFields(text, header);
-    uint32_t maxCommandAt = takeVersionedFields(text, header);
-    if (text[maxCommandAt] != ' ') {
-        header->maxCommandLength = numberAt(text + maxCommandAt, headerNumberWidth, 16);
-        return 0;
-    }
-    uint32_t longest = 0;
-    int rc = sqluhFindMaxCommandLen(fh, &longest);
-    header->maxCommandLength = longest;
-    return rc == 0 ? 0 : loggedPlain(HISTORY_FILE_DAMAGED);
-}
-
-// The work area for the entry that an old header names. Its tablespace count is believed only as
-// far as the file is long: a damaged count must not ask for memory that no entry can need.
-static uint32_t oldEntryAreaSize(SQLO_FHANDLE fh, const SQLUH_HEADER* header)
-{
-    uint64_t extra = uint64_t{workAreaPerTablespace} * header->number8;
-    long long here = 0;
-    long long end = 0;
-    if (sqloseek(fh, 0, sqloFromCurrent, &here) != 0 || sqloseek(fh, 0, sqloFromEnd, &end) != 0 ||
-        sqloseek(fh, here, sqloFromStart, nullptr) != 0)
-        return defaultWorkAreaSize;
-    if (extra > static_cast<uint64_t>(end))
-        extra = static_cast<uint64_t>(end);
-    if (extra > UINT32_MAX - defaultWorkAreaSize)
-        extra = UINT32_MAX - defaultWorkAreaSize;
-    return defaultWorkAreaSize + static_cast<uint32_t>(extra);
-}
-
-// Takes the header's timestamp from the entry at offset3.
-static int takeTimestampFromEntry(SQLO_FHANDLE fh, SQLUH_HEADER* header)
-{
-    char objectPart[18] = {};
-    zq3HistoryData data = {};
-    data.objectPart.data = objectPart;
-    data.objectPart.capacity = sizeof objectPart;
-    SQLUH_ENTRY entry = {};
-    entry.data = &data;
-    SQLUH_WORKAREA workArea = {};
-    unsigned int flags = 0;
-    long long offset = 0;
-
-    int rc = logged(sqloseek(fh, static_cast<long long>(header->offset3), sqloFromStart, nullptr));
-    if (rc == 0)
-        rc = logged(sqluhInitWorkArea(&workArea, oldEntryAreaSize(fh, header)));
-    if (rc == 0) {
-        rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
-        if (rc == TABLESPACE_LIST_TRUNCATED)
-            rc = 0;
-        sqlofmblkEx(workArea.buffer);
-        logged(rc);
-    }
-    if (rc != 0)
-        return rc;
-
-    // The header's text can carry neither a zero byte nor a leading "-" here; blanks, which also
-    // stand for an empty timestamp, keep the next header that is written readable.
-    for (uint32_t i = 0; i < timestampWidth; i++)
-        header->timestamp[i] = objectPart[i] != '\0' ? objectPart[i] : ' ';
-    if (objectPart[0] == SQLUH_EMPTY_WORD[0])
-        memset(header->timestamp, ' ', timestampWidth);
-    return logged(sqluhRewind(fh, &offset));
-}
-
-// Brings a header of a version below 7020200 into the current form, in memory.
-static int convertOldHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
-{
-    if (header->offset3 != 0) {
-        int rc = takeTimestampFromEntry(fh, header);
-        if (rc != 0)
-            return rc;
-    } else {
-        memcpy(header->timestamp, SQLUH_EMPTY_TIMESTAMP, timestampWidth);
-    }
-    if (header->version < 6010000)
-        header->number15 = header->number7;
-    header->version = currentVersion;
-    return 0;
-}
-
-int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
-{
-    pdtEntry();
-
-    void* block = nullptr;
-    int rc = logged(allocateZeroed(headerLength + 1, &block));
-    if (rc == 0) {
-        char* text = static_cast<char*>(block);
-        rc = readHeaderText(fh, text);
-        if (rc == 0) {
-            int scanned = parseHeader(fh, text, header);
-            rc = sqluhCheckHeaderChecksum(header) ? 0 : logged(HISTORY_FILE_DAMAGED);
-            if (rc == 0 && header->version < 7020200)
-                rc = convertOldHeader(fh, header);
-            rc = firstOf(rc, scanned);
-        }
-        sqlofmblkEx(block);
-    }
-    if (rc < 0 && rc != END_OF_FILE) {
-        sqlt_logadmin(__func__, pdAdminReadFailed);
-        logRecord({textItem(TEXT_HEADER_FAILED)});
-    }
-
-    pdtExit(rc);
-    return rc;
-}
-
-// --- The fixed part of an entry ------------------------------------------------------------------
-
-// What the fixed part holds, as the scanning format gives it.
-struct fixedPart {
-    uint32_t checksum, entryNumber, size, version, noteLength, longTextLength, qualifierLength,
-        nameLength, numTablespaces, sqlcaLength, commandLength;
-    uint16_t entryNode;
-    char status, operation, object, operationType, auxCode;
-    char objectPart[18], secondTimestamp[15], firstText[13], lastText[13], logPosition[13],
-        idText[25];
-};
-
-static bool canonicalNumber(const char* text, unsigned int field, uint32_t* value)
-{
-    return hexColumns(text + entryFields[field].at, value);
-}
-
-template <uint32_t size>
-static bool canonicalWord(const char* text, unsigned int field, char (&word)[size])
-{
-    const char* from = text + entryFields[field].at;
-    uint32_t length = wordLength<size - 1>(from);
-    memcpy(word, from, size - 1);
-    word[length] = '\0';
-    return length != 0;
-}
-
-// What stands between the fields of a canonical fixed part: colons, the blanks that end line 1, its
-// line feed. What is behind field 23 is not looked at, here or by the scanning format.
-struct entryFrame {
-    char mask[entryFixedLength]; // 0xFF where text counts
-    char text[entryFixedLength];
-};
-
-static constexpr entryFrame makeEntryFrame(void)
-{
-    entryFrame frame = {};
-    for (const sqluhField& field : entryFields)
-        frame.text[field.at + field.width] = ':';
-    for (uint32_t i = 0; i < entryReserved1Length; i++)
-        frame.text[entryReserved1At + i] = ' ';
-    frame.text[lineLength - 1] = '\n';
-    for (uint32_t i = 0; i < entryFixedLength; i++)
-        frame.mask[i] = frame.text[i] != '\0' ? '\xFF' : '\0';
-    return frame;
-}
-static constexpr entryFrame canonicalFrame = makeEntryFrame();
-
-static bool hasCanonicalFrame(const char* text)
-{
-    unsigned char different = 0;
-    for (uint32_t i = 0; i < entryFixedLength; i++)
-        different |=
-            static_cast<unsigned char>((text[i] ^ canonicalFrame.text[i]) & canonicalFrame.mask[i]);
-    char operation = text[entryFields[fieldOperation].at];
-    return different == 0 && operation > 0x20 && operation < 0x7F;
-}
-
-// Takes a fixed part apart by column when it stands exactly as the writer writes it. Returns false,
-// and leaves *fixed in part, when it does not: the scanning format then decides.
-static bool takeCanonicalFixedPart(const char* text, fixedPart* fixed)
-{
-    if (!hasCanonicalFrame(text))
-        return false;
-    uint32_t node = 0;
-    bool canonical = canonicalNumber(text, fieldChecksum, &fixed->checksum) &&
-                     hexDigitsAt(text + entryFields[fieldNode].at, 4, &node) &&
-                     canonicalNumber(text, fieldNumber, &fixed->entryNumber) &&
-                     canonicalNumber(text, fieldSize, &fixed->size) &&
-                     decimalColumns(text + entryFields[fieldVersion].at, &fixed->version) &&
-                     canonicalNumber(text, fieldNoteLength, &fixed->noteLength) &&
-                     canonicalNumber(text, fieldLongTextLength, &fixed->longTextLength) &&
-                     canonicalNumber(text, fieldQualifierLength, &fixed->qualifierLength) &&
-                     canonicalNumber(text, fieldNameLength, &fixed->nameLength) &&
-                     canonicalNumber(text, fieldNumTablespaces, &fixed->numTablespaces) &&
-                     canonicalNumber(text, fieldSqlcaLength, &fixed->sqlcaLength) &&
-                     canonicalNumber(text, fieldCommandLength, &fixed->commandLength) &&
-                     canonicalWord(text, fieldObjectPart, fixed->objectPart) &&
-                     canonicalWord(text, fieldSecondTimestamp, fixed->secondTimestamp) &&
-                     canonicalWord(text, fieldFirstText, fixed->firstText) &&
-                     canonicalWord(text, fieldLastText, fixed->lastText) &&
-                     canonicalWord(text, fieldLogPosition, fixed->logPosition) &&
-                     canonicalWord(text, fieldIdText, fixed->idText);
-    fixed->entryNode = static_cast<uint16_t>(node);
-    fixed->status = text[entryFields[fieldStatus].at];
-    fixed->operation = text[entryFields[fieldOperation].at];
-    fixed->object = text[entryFields[fieldObject].at];
-    fixed->operationType = text[entryFields[fieldOperationType].at];
-    fixed->auxCode = text[entryFields[fieldAuxCode].at];
-    // A zero byte ends the text for the scanning format.
-    return canonical && fixed->status != '\0' && fixed->object != '\0' &&
-           fixed->operationType != '\0' && fixed->auxCode != '\0';
-}
-
-// Takes a fixed part apart with the scanning format. Returns the number of fields found; those not
-// found are left as they were, the words empty.
-static int scanFixedPart(const char* text, fixedPart* fixed)
-{
-    char line[entryFixedLength + 1];
-    memcpy(line, text, entryFixedLength);
-    line[entryFixedLength] = '\0';
-    memset(fixed->objectPart, 0, sizeof fixed->objectPart);
-    memset(fixed->secondTimestamp, 0, sizeof fixed->secondTimestamp);
-    memset(fixed->firstText, 0, sizeof fixed->firstText);
-    memset(fixed->lastText, 0, sizeof fixed->lastText);
-    memset(fixed->logPosition, 0, sizeof fixed->logPosition);
-    memset(fixed->idText, 0, sizeof fixed->idText);
-    int found = sscanf(
-        line, entryScanFormat, &fixed->checksum, &fixed->entryNode, &fixed->entryNumber,
-        &fixed->size, &fixed->version, &fixed->status, &fixed->noteLength, &fixed->longTextLength,
-        &fixed->qualifierLength, &fixed->nameLength, &fixed->numTablespaces, &fixed->sqlcaLength,
-        &fixed->commandLength, &fixed->operation, &fixed->object, &fixed->operationType,
-        fixed->objectPart, fixed->secondTimestamp, fixed->firstText, fixed->lastText,
-        fixed->logPosition, fixed->idText, &fixed->auxCode);
-    return found < 0 ? 0 : found;
-}
+// --- The fixed part ------------------------------------------------------------------------------
 
 // The caller's numbers and letters, which a scan that stops early leaves as they were.
-static void fixedFromEntry(fixedPart* fixed, const SQLUH_ENTRY* entry)
+static void fixedFromEntry(sqluhFixedPart* fixed, const SQLUH_ENTRY* entry)
 {
     const zq3HistoryData* data = entry->data;
     fixed->checksum = entry->checksum;
@@ -441,7 +34,7 @@ static void fixedFromEntry(fixedPart* fixed, const SQLUH_ENTRY* entry)
     fixed->auxCode = data->auxCode;
 }
 
-static void entryFromFixed(SQLUH_ENTRY* entry, const fixedPart* fixed)
+static void entryFromFixed(SQLUH_ENTRY* entry, const sqluhFixedPart* fixed)
 {
     zq3HistoryData* data = entry->data;
     entry->checksum = fixed->checksum;
@@ -468,12 +61,12 @@ static char blankForEmpty(char letter)
     return letter == SQLUH_EMPTY_WORD[0] ? ' ' : letter;
 }
 
-static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, fixedPart* fixed)
+static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedPart* fixed)
 {
     int found = entryFieldCount;
-    if (!takeCanonicalFixedPart(text, fixed)) {
+    if (!sqluhTakeCanonicalFixedPart(text, fixed)) {
         fixedFromEntry(fixed, entry);
-        found = scanFixedPart(text, fixed);
+        found = sqluhScanFixedPart(text, fixed);
     }
     entryFromFixed(entry, fixed);
     if (found < static_cast<int>(entryFieldCount)) {
@@ -664,7 +257,7 @@ static void takeLogPosition(const char* text, uint8_t* position)
     }
 }
 
-static void takeLine2(zq3HistoryData* data, const fixedPart* fixed)
+static void takeLine2(zq3HistoryData* data, const sqluhFixedPart* fixed)
 {
     copyWord(&data->objectPart, fixed->objectPart, SQLUH_EMPTY_TIMESTAMP);
     copyWord(&data->secondTimestamp, fixed->secondTimestamp, SQLUH_EMPTY_TIMESTAMP);
@@ -708,8 +301,11 @@ static unsigned int takeObjectNames(SQLUH_ENTRY* entry, char* at, const char* qu
     return flags;
 }
 
+// For a head that is no number: does not fit, whatever room there is.
+static constexpr uint64_t noTablespaceLength = UINT64_MAX - tablespaceLineExtra;
+
 // The length at the head of a tablespace line: what scanning a hexadecimal number of eight
-// characters gives; above every 32-bit number when there is none.
+// characters gives.
 static uint64_t tablespaceLength(const char* line)
 {
     // The next line's place waits for this number, so the usual one, of two digits, takes the
@@ -724,11 +320,11 @@ static uint64_t tablespaceLength(const char* line)
     char digits[headerNumberWidth + 1];
     memcpy(digits, line, headerNumberWidth);
     digits[headerNumberWidth] = '\0';
-    return sscanf(digits, "%8x", &length) == 1 ? length : UINT64_MAX - tablespaceLineExtra;
+    return sscanf(digits, "%8x", &length) == 1 ? length : noTablespaceLength;
 }
 
 // The name of the tablespace line at at, ended where its line feed stood, and its length; null when
-// the line does not fit before end or has no length. Starts with *head 0.
+// the line does not fit before end or has no length. Starts with *head 0, which is no number.
 //
 // Neighbouring names often have one length. Comparing the head with the last one lets the processor
 // go on with the next line before this one's number is known.
@@ -755,7 +351,7 @@ static char* takeTablespaces(char* at, const char* end, uint32_t count, textBuff
     // One look for zero bytes, which end a name early, spares one for each name.
     bool zeroFree = stored != 0 && memchr(at, '\0', static_cast<size_t>(end - at)) == nullptr;
     uint64_t head = 0;
-    uint64_t length = 0;
+    uint64_t length = noTablespaceLength;
     for (uint32_t i = 0; i < count; i++) {
         char* name = nextTablespace(at, end, &head, &length);
         if (name == nullptr)
@@ -773,12 +369,36 @@ static char* takeTablespaces(char* at, const char* end, uint32_t count, textBuff
 static char* passTablespaces(char* at, const char* end, uint32_t count)
 {
     uint64_t head = 0;
-    uint64_t length = 0;
+    uint64_t length = noTablespaceLength;
     for (uint32_t i = 0; i < count && at != nullptr; i++) {
         char* name = nextTablespace(at, end, &head, &length);
         at = name != nullptr ? name + length + 1 : nullptr;
     }
     return at;
+}
+
+// A number of the sqlca line. width: 10 or 11. Straight digits behind an optional sign are what the
+// writer writes.
+static int32_t signedNumberAt(const char* text, uint32_t width)
+{
+    const char* last8 = text + width - 8;
+    bool sign = text[0] == '+' || text[0] == '-';
+    uint32_t low = 0;
+    uint32_t high = 0;
+    bool canonical = decimalColumns(last8, &low);
+    for (const char* at = text + sign; at < last8; at++) {
+        uint32_t digit = static_cast<uint32_t>(static_cast<unsigned char>(*at)) - '0';
+        canonical &= digit <= 9;
+        high = high * 10 + digit;
+    }
+    if (canonical) {
+        uint64_t value = uint64_t{high} * 100000000 + low;
+        return static_cast<int32_t>(text[0] == '-' ? 0 - value : value);
+    }
+    char digits[32];
+    memcpy(digits, text, width);
+    digits[width] = '\0';
+    return static_cast<int32_t>(strtoll(digits, nullptr, 10));
 }
 
 static void fillSqlca(sqlca* ca, const char* line)
@@ -830,7 +450,7 @@ struct entryFilters {
 };
 
 // Takes everything behind the fixed part, in the record's order.
-static int takeSections(SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea, const fixedPart* fixed,
+static int takeSections(SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea, const sqluhFixedPart* fixed,
                         const entryFilters* filters, uint32_t maxTablespaces, unsigned int* flags)
 {
     zq3HistoryData* data = entry->data;
@@ -885,7 +505,7 @@ int sqluhReadEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea
 
     const entryFilters filters = {timestampFilter, qualifierFilter, nameFilter, tablespaceFilter};
     uint32_t maxTablespaces = entry->data->maxTablespaces;
-    fixedPart fixed;
+    sqluhFixedPart fixed;
     long long offset = 0;
     *matchFlags = 0;
     // For the message only: a file that cannot tell its position fails the read that follows.

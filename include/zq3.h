@@ -38,12 +38,12 @@ struct zq3HistoryData {
     textBuffer secondTimestamp; // 14-digit timestamp
     textBuffer firstText;       // up to 12 characters
     textBuffer lastText;        // up to 12 characters
-    textBuffer idText;        // up to 24 characters; of a restore: the timestamp of the image used
-    textBuffer qualifierText; // first object name
-    textBuffer nameText;      // second object name
-    textBuffer longText;      // up to 255 characters
-    textBuffer noteText;      // up to 30 characters
-    textBuffer commandText;   // the command, any length
+    textBuffer idText;          // up to 24 characters; a restore's: timestamp of the image used
+    textBuffer qualifierText;   // first object name
+    textBuffer nameText;        // second object name
+    textBuffer longText;        // up to 255 characters
+    textBuffer noteText;        // up to 30 characters
+    textBuffer commandText;     // the command, any length
     uint8_t logPosition[6];
     uint16_t entryNode;
     uint32_t entryNumber;
@@ -63,8 +63,8 @@ struct zq3HistoryData {
 // Argument of zq3HistoryOpenScan.
 struct zq3HistoryOpenStruct {
     char* databaseAlias;     // plain name of 1 to 8 characters, terminated
-    char* timestamp;         // null: every entry
-    char* objectName;        // null: every entry
+    char* timestamp;         // null: every entry; nothing else is taken
+    char* objectName;        // null: every entry; nothing else is taken
     uint32_t numRows;        // out: number of entries that the scan will return
     uint32_t maxTablespaces; // out: largest number of names that one entry of the scan lists
     uint16_t callerAction;   // 0
@@ -93,19 +93,31 @@ static_assert(sizeof(void*) != 8 ||
 
 extern "C" {
 
+// All three: version is zq3Version, the record and ca are the caller's. Returns 0 when the call
+// could be made; the outcome is then ca->sqlcode: 0, a negative failure or a positive warning. Any
+// other result means that the call itself was wrong; ca, unless null, then holds an SQLCODE too:
+// -2040 the version is not zq3Version, -2041 a record is null or a member has no such value, -2042
+// no scan is open under the handle (not from the open). A negative SQLCODE that is not listed here
+// is the code of what failed underneath: the lock, a file, memory.
+
 // Opens a scan of one database's recovery history and fills numRows, maxTablespaces and handle.
 //
-// version: zq3Version. openStruct: a zq3HistoryOpenStruct, the caller's. ca: receives the SQLCODE.
-// Returns 0 when the call could be made; the outcome is ca->sqlcode, where a negative value means
-// that no scan is open and a positive one is a warning. A result other than 0 means that the call
-// itself was wrong (version, null record); ca, if given, then holds a negative SQLCODE too.
+// openStruct: a zq3HistoryOpenStruct. SQLCODEs: 0; 2160 both files of the history were unusable and
+// an empty one was made; or, with no scan open and *openStruct as it was, -2036 the alias is no
+// plain name or has no history, -2043 too many scans are open, -2044 no memory, or another negative
+// code of opening or copying the history.
 int zq3HistoryOpenScan(unsigned int version, void* openStruct, sqlca* ca);
 
-// Delivers the next entry of an open scan into fetchStruct->historyRecord. Same results as the
-// open.
+// Delivers the next entry of an open scan into the record.
+//
+// fetchStruct: a zq3HistoryFetchStruct. SQLCODEs: 0; 2165 the entry lists more tablespaces than the
+// record has room for, the rest was delivered; 100 there was no further entry; -2161 the entry is
+// damaged, or another negative code of reading it. After 100 or a failure the record is empty, and
+// after a failure every further get fails with its code.
 int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca* ca);
 
-// Ends a scan. handle: points at the 16-bit handle. Same results as the open.
+// Ends a scan. handle: points at the 16-bit handle. SQLCODEs: 0, or the negative code of a failed
+// close; the scan has ended all the same.
 int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca);
 
 } // extern "C"

@@ -1,6 +1,8 @@
 // The OS-services interface: files and memory. Declarations only; libzq3osse.so.1 provides them.
 //
-// Every call returns 0, or a negative code: one of those below, or sqloSystemError with the errno.
+// A call that returns a code returns 0 or a negative one, as the call's comment says; where it says
+// no more, sqloSystemError with the errno. A buffer or record stays its caller's, a path is
+// terminated, and counts, sizes and offsets are in bytes.
 #pragma once
 
 #include <cstddef>
@@ -55,53 +57,62 @@ struct ossFileInfo {
 
 extern "C" {
 
-// Opens a file and fills *fh. options: one of the words above; permissions: bits of a file that
-// this call creates. A file created by it is durably in its directory when the call returns. On
-// failure *fh is sqloNoFile.
+// Opens a regular file and fills *fh, which is the caller's to close. options: one of the words
+// above; permissions: bits of a file that this call creates. A file created by it is durably in its
+// directory when the call returns. Returns 0 or sqloFileExisted with the file open; or, with *fh
+// sqloNoFile, DISK_FULL when a created file's name could not be stored, or sqloSystemError.
 int sqloopenp(const char* path, unsigned int options, unsigned int permissions, SQLO_FHANDLE* fh);
+
+// Closes a file. Its handle is of no use afterwards, whatever comes back.
 int sqloclose(SQLO_FHANDLE fh);
 
-// Reads count bytes at the current position. Returns 0 when all were delivered, END_OF_FILE when
-// the file ended first; *bytesRead holds the number delivered either way.
+// Reads count bytes at the current position and moves it behind them. Returns 0 when all were
+// delivered, END_OF_FILE when the file ended first, or sqloSystemError; *bytesRead holds the number
+// delivered in every case.
 int sqloread(SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* bytesRead);
 
-// Writes count bytes at the current position. Returns 0 only when all were written, DISK_FULL when
-// there was no space; *bytesWritten holds the number written either way.
+// Writes count bytes at the current position and moves it behind them. Returns 0 only when all were
+// written, DISK_FULL when there was no space, or sqloSystemError; *bytesWritten holds the number
+// written in every case.
 int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* bytesWritten);
 
-// Moves the position by offset from origin (start, current, end); *newOffset, unless null, receives
-// the new position.
+// Move the position to offset from origin (start, current, end), also behind the end of the file;
+// *newOffset, unless null, receives the new position. On failure the position stays as it was.
 int sqloseek(SQLO_FHANDLE fh, long long offset, unsigned int origin, long long* newOffset);
 int sqlochgfileptr(SQLO_FHANDLE fh, long long offset, unsigned int origin, long long* newOffset);
 
-// Makes everything that was written to the file durable.
+// Makes everything that was written to the file durable. A failure is final: what was written may
+// be lost, also when a second call returns 0. Returns 0, DISK_FULL or sqloSystemError.
 int sqlosync(SQLO_FHANDLE fh);
 
 // Makes target a durable copy of source, keeping target's inode if it exists. The source is made
 // durable first; the target's first 1024 bytes are written last, so that a copy that stopped
-// part-way has no readable header. A copy of a file onto itself is refused. options: 0.
+// part-way has no readable header. A copy of a file onto itself is refused. options: 0. Returns 0,
+// DISK_FULL or sqloSystemError; the target then is as it was or has no readable header, or is whole
+// when only its closing failed.
 int sqlocopy(const char* source, const char* target, unsigned int options);
 
 // Renames source to target, durably. A target that holds anything is first kept under its own name
 // with ".1", ".2", ... appended: whoever moves a damaged file aside loses nothing by doing it
-// twice.
+// twice. Returns 0, DISK_FULL or sqloSystemError.
 int sqlomove(const char* source, const char* target);
 
-// Deletes a file, durably. options: 0.
+// Deletes a file, durably. options: 0. Returns 0, DISK_FULL or sqloSystemError.
 int sqlodelete(const char* path, unsigned int options);
 
+// Tells whether anything stands at the path that can be looked at.
 bool ossPathExists(const char* path);
 
 // Fills info for the file that the request names.
 int ossFileGetInfoV9(const ossFileRequest* request, ossFileInfo* info);
 
-// snprintf.
+// snprintf: returns the length of the whole text, also when it was cut; negative on failure.
 int ossSnprintf(char* buffer, size_t size, const char* format, ...)
     __attribute__((format(printf, 3, 4)));
 
 // Allocates size bytes and stores the block's address through block, which belongs to the caller
-// until sqlofmblkEx. options: sqloZeroFilled or 0. file, line: the place of the request. On failure
-// stores null.
+// until sqlofmblkEx. options: sqloZeroFilled or 0. file, line: the place of the request. reserved:
+// 0. On failure stores null.
 int sqlogmblkEx(SMemPool* pool, size_t size, unsigned int options, void** block, const char* file,
                 unsigned int line, unsigned int reserved);
 void sqlofmblkEx(void* block);
@@ -114,8 +125,8 @@ int sqloMemBlockReallocate(void** block, size_t size, unsigned int options, cons
 // Initialises a communication area: identifier, length, code 0, blank texts.
 void sqloinca(sqlca* ca);
 
-// The code to be returned to the engine for a code of a read or write. A code that is no failure
-// (0, of a transfer that came out short) maps to an I/O error.
+// Returns the code to be handed to the engine for a code of a read or write. A code that is no
+// failure (0, of a transfer that came out short) maps to an I/O error.
 int sqlzGetZRCInfo(int code);
 
 } // extern "C"

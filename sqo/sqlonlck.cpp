@@ -18,7 +18,6 @@
 
 #include <cerrno>
 #include <csignal>
-#include <cstring>
 #include <ctime>
 #include <unistd.h>
 
@@ -87,6 +86,9 @@ int sqloNLCKInit(const char* path, SQLO_NLCK* lock, unsigned int options)
     if ((options & sqloNLCKUseNodeNumber) != 0)
         project = sqlz_krcbp->nodeNumber + 1;
     lock->key = ftok(path, project);
+    // A set under this key would be its creator's alone and keep nobody out.
+    if (lock->key == IPC_PRIVATE)
+        lock->key = -1;
     if (lock->key == -1) {
         const pdItem items[] = {{pdKindText, "No lock key for path:", 0, nullptr, 0},
                                 {pdKindText, path, 0, nullptr, 0},

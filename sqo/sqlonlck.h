@@ -39,19 +39,21 @@ enum : int {
 struct SQLO_NLCKSTATE {
     int32_t state; // one of the above
     int32_t pid;   // process that last operated on the semaphore; 0: none, or not visible
-    int32_t id;    // semaphore set; -1 when absent or not readable
+    int32_t id;    // semaphore set; -1 when there is none, or none that may be opened
 };
 
 extern "C" {
 
-// Makes the key from an existing file's path. options: 0, or sqloNLCKUseNodeNumber to make the
-// project identifier from the engine's node number. Returns 0 or sqloNLCKKeyFailure.
+// Makes the key from an existing file's path and stores it in the caller's record. options: 0, or
+// sqloNLCKUseNodeNumber to make the project identifier from the engine's node number. Returns 0, or
+// sqloNLCKKeyFailure with the key -1.
 int sqloNLCKInit(const char* path, SQLO_NLCK* lock, unsigned int options);
 
 // Takes the lock. options: 0, or sqloNLCKReportInterrupts. wait: 0 returns sqloNLCKBusy at once
-// when the lock is held; any other value waits without limit. Returns 0 with the lock held, or
-// without it sqloNLCKBusy, sqloNLCKKeyConflict, sqloNLCKOwnerDied (to every caller, until an
-// administrator removes the set), sqloNLCKInterrupted, or sqloSystemError with the errno.
+// when the lock is held; any other value waits without limit. Either way a set that is still being
+// set up is waited for. Returns 0 with the lock held, or without it sqloNLCKBusy,
+// sqloNLCKKeyConflict, sqloNLCKOwnerDied (to every caller, until an administrator removes the set),
+// sqloNLCKInterrupted, or sqloSystemError with the errno.
 int sqloNLCKLock(SQLO_NLCK* lock, unsigned int options, int wait);
 
 // Releases a held lock and wakes those who wait. Returns 0 or sqloSystemError with the errno.
@@ -60,8 +62,8 @@ int sqloNLCKUnlock(SQLO_NLCK* lock);
 // Ends the use of the record. Always 0; it holds nothing.
 int sqloNLCKTerm(SQLO_NLCK* lock);
 
-// Tells the state of the key's set without touching it. Fills *state; returns 0, or sqloSystemError
-// with the errno.
+// Tells the state of the key's set without touching it. Returns 0 with *state filled, or
+// sqloSystemError with the errno.
 int sqloNLCKQuery(const SQLO_NLCK* lock, SQLO_NLCKSTATE* state);
 
 // Removes the set of a dead process, and only such a set: state must be the outcome of

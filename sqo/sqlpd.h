@@ -1,7 +1,8 @@
 // The diagnostic log and the trace facility. Declarations only; libzq3osse.so.1 provides them.
 //
 // The functions are named by their own name, which the compiler supplies: no table of identifiers
-// has to be kept in step with the code.
+// has to be kept in step with the code. No call fails its caller or changes errno, and none keeps
+// what it is given.
 #pragma once
 
 #include <cstddef>

@@ -4,8 +4,6 @@
 
 #include <cstdlib>
 
-#include "osse.h"
-
 static SQLZ_KRCB controlBlock = {0};
 
 __attribute__((visibility("default"))) SQLZ_KRCB* sqlz_krcbp = &controlBlock;

@@ -24,9 +24,9 @@ inline int storeFailure(int number)
                                                 : systemFailure(number);
 }
 
-// open(2): repeated when interrupted, close-on-exec, never one of the three standard descriptors,
-// which a program started without them would otherwise print into. Returns -1 with errno on
-// failure.
+// open(2): repeated when interrupted, close-on-exec, without waiting for the other end of a pipe,
+// never one of the three standard descriptors, which a program started without them would otherwise
+// print into. Returns -1 with errno on failure.
 int osseOpen(const char* path, int flags, mode_t permissions);
 
 // Opens a regular file; anything else (directory, pipe, device) is refused without blocking. flags

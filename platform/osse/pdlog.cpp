@@ -101,13 +101,11 @@ static void addItem(osseText* record, const pdItem* item)
 {
     if (item->kind == pdKindCode) {
         addCode(record, orEmpty(item->text), static_cast<int>(item->value));
+    } else if (item->kind == pdKindNumber) {
+        addLabel(record, orEmpty(item->text));
+        osseTextFormat(record, "%lld", static_cast<long long>(item->value));
     } else {
-        if (item->kind == pdKindNumber)
-            addLabel(record, orEmpty(item->text));
-        else
-            addMessage(record, orEmpty(item->text));
-        if (item->kind == pdKindNumber)
-            osseTextFormat(record, "%lld", static_cast<long long>(item->value));
+        addMessage(record, orEmpty(item->text));
     }
 }
 

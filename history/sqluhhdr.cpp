@@ -1,0 +1,235 @@
+// Reading the header, with the conversion of older versions.
+
+#include <cstdio>
+#include <cstring>
+
+#include "history/sqluhcol.h"
+#include "history/sqluhist.h"
+#include "history/sqluhlog.h"
+
+bool sqluhCheckHeaderChecksum(SQLUH_HEADER* header)
+{
+    pdtEntry();
+
+    uint32_t stored = header->checksum;
+    header->checksum = 0;
+    bool shortImage = header->version >= 7020200 && header->version < 8010000;
+    uint32_t computed =
+        sqluhChecksum(header, shortImage ? headerImageLength7020200 : headerImageLength);
+    bool matches = computed == stored || sqluhChecksum(header, headerImageLengthShort) == stored;
+    if (!matches && sqltGetCompTraceFlag()) {
+        sqltData(__func__, "stored checksum", &stored, sizeof stored);
+        sqltData(__func__, "computed checksum", &computed, sizeof computed);
+    }
+
+    pdtExit(matches);
+    return matches;
+}
+
+int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength)
+{
+    pdtEntry();
+
+    zq3HistoryData data = {};
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    SQLUH_WORKAREA workArea = {};
+    unsigned int flags = 0;
+    long long offset = 0;
+    uint32_t longest = 0;
+
+    int rc = logged(sqluhRewind(fh, &offset));
+    if (rc == 0)
+        rc = logged(sqluhInitWorkArea(&workArea, defaultWorkAreaSize));
+    if (rc == 0) {
+        do {
+            rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
+            if ((rc == 0 || rc == TABLESPACE_LIST_TRUNCATED) && entry.commandLength > longest)
+                longest = entry.commandLength;
+        } while (rc == 0 || rc == TABLESPACE_LIST_TRUNCATED);
+        if (rc == END_OF_FILE)
+            rc = 0;
+        rc = firstOf(rc, logged(sqluhRewind(fh, &offset)));
+        sqlofmblkEx(workArea.buffer);
+    }
+    *maxLength = longest;
+
+    pdtExit(rc);
+    return rc;
+}
+
+// Reads the header's text into buffer, which holds one byte more for the terminator.
+static int readHeaderText(SQLO_FHANDLE fh, char* buffer)
+{
+    uint32_t bytesRead = 0;
+    int rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr));
+    if (rc != 0)
+        return rc;
+
+    rc = sqloread(fh, buffer, headerLength, &bytesRead);
+    if (rc == 0 && bytesRead == headerLength)
+        return 0;
+    if (rc == END_OF_FILE && (bytesRead == 0 || bytesRead == headerLength))
+        return rc;
+    bool partial = rc == END_OF_FILE || rc == 0;
+    logRecord({textItem(partial ? TEXT_HEADER_PARTIAL : TEXT_HEADER_READ), codeItem("rc = ", rc),
+               numberItem("Bytes read: ", bytesRead), dataItem("", buffer, headerLength)});
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
+}
+
+// Fields 1 to 13. What a damaged text leaves out stays zero: the checksum tells.
+static void scanHeaderFields(const char* text, SQLUH_HEADER* header)
+{
+    unsigned long long offsets[3] = {};
+    unsigned int checksum = 0;
+    unsigned int numbers[7] = {};
+    unsigned short node = 0;
+    char status = '\0';
+
+    sscanf(text, headerScanFormat, &checksum, &offsets[0], &offsets[1], &offsets[2], &numbers[0],
+           &numbers[1], &numbers[2], &numbers[3], &numbers[4], &numbers[5], &numbers[6], &node,
+           &status);
+    header->checksum = checksum;
+    header->offset1 = offsets[0];
+    header->offset2 = offsets[1];
+    header->offset3 = offsets[2];
+    header->entryCount = numbers[0];
+    header->number6 = numbers[1];
+    header->number7 = numbers[2];
+    header->number8 = numbers[3];
+    header->number9 = numbers[4];
+    header->number10 = numbers[5];
+    header->number11 = numbers[6];
+    header->nodeNumber = node;
+    header->status = status;
+}
+
+// The fields behind the status letter, which stand at places that depend on the version. Returns
+// the place of field 17.
+static uint32_t takeVersionedFields(const char* text, SQLUH_HEADER* header)
+{
+    header->version = numberAt(text + headerVersionAt, headerNumberWidth, 10);
+    if (header->version < 6010000)
+        return headerMaxCommandAt6010000;
+    header->number15 = numberAt(text + headerNumber15At, headerNumberWidth, 16);
+    if (header->version < 7020200)
+        return headerMaxCommandAt7020200;
+    if (text[headerTimestampAt] == SQLUH_EMPTY_WORD[0]) {
+        memset(header->timestamp, ' ', timestampWidth);
+        return headerMaxCommandAtNoTimestamp;
+    }
+    memcpy(header->timestamp, text + headerTimestampAt, timestampWidth);
+    return headerMaxCommandAt;
+}
+
+// Parses the header's text. Returns 0, or HISTORY_FILE_DAMAGED when the entries had to be scanned
+// for field 17 and could not be.
+static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header)
+{
+    memset(header, 0, sizeof *header);
+    scanHeaderFields(text, header);
+    uint32_t maxCommandAt = takeVersionedFields(text, header);
+    if (text[maxCommandAt] != ' ') {
+        header->maxCommandLength = numberAt(text + maxCommandAt, headerNumberWidth, 16);
+        return 0;
+    }
+    uint32_t longest = 0;
+    int rc = sqluhFindMaxCommandLen(fh, &longest);
+    header->maxCommandLength = longest;
+    return rc == 0 ? 0 : loggedPlain(HISTORY_FILE_DAMAGED);
+}
+
+// The work area for the entry that an old header names. Its tablespace count is believed only as
+// far as the file is long: a damaged count must not ask for memory that no entry can need.
+static uint32_t oldEntryAreaSize(SQLO_FHANDLE fh, const SQLUH_HEADER* header)
+{
+    uint64_t extra = uint64_t{workAreaPerTablespace} * header->number8;
+    long long here = 0;
+    long long end = 0;
+    if (sqloseek(fh, 0, sqloFromCurrent, &here) != 0 || sqloseek(fh, 0, sqloFromEnd, &end) != 0 ||
+        sqloseek(fh, here, sqloFromStart, nullptr) != 0)
+        return defaultWorkAreaSize;
+    if (extra > static_cast<uint64_t>(end))
+        extra = static_cast<uint64_t>(end);
+    if (extra > UINT32_MAX - defaultWorkAreaSize)
+        extra = UINT32_MAX - defaultWorkAreaSize;
+    return defaultWorkAreaSize + static_cast<uint32_t>(extra);
+}
+
+// Takes the header's timestamp from the entry at offset3.
+static int takeTimestampFromEntry(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    char objectPart[18] = {};
+    zq3HistoryData data = {};
+    data.objectPart.data = objectPart;
+    data.objectPart.capacity = sizeof objectPart;
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    SQLUH_WORKAREA workArea = {};
+    unsigned int flags = 0;
+    long long offset = 0;
+
+    int rc = logged(sqloseek(fh, static_cast<long long>(header->offset3), sqloFromStart, nullptr));
+    if (rc == 0)
+        rc = logged(sqluhInitWorkArea(&workArea, oldEntryAreaSize(fh, header)));
+    if (rc == 0) {
+        rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
+        if (rc == TABLESPACE_LIST_TRUNCATED)
+            rc = 0;
+        sqlofmblkEx(workArea.buffer);
+        logged(rc);
+    }
+    if (rc != 0)
+        return rc;
+
+    // The header's text can carry neither a zero byte nor a leading "-" here; blanks, which also
+    // stand for an empty timestamp, keep the next header that is written readable.
+    for (uint32_t i = 0; i < timestampWidth; i++)
+        header->timestamp[i] = objectPart[i] != '\0' ? objectPart[i] : ' ';
+    if (objectPart[0] == SQLUH_EMPTY_WORD[0])
+        memset(header->timestamp, ' ', timestampWidth);
+    return logged(sqluhRewind(fh, &offset));
+}
+
+// Brings a header of a version below 7020200 into the current form, in memory.
+static int convertOldHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    if (header->offset3 != 0) {
+        int rc = takeTimestampFromEntry(fh, header);
+        if (rc != 0)
+            return rc;
+    } else {
+        memcpy(header->timestamp, SQLUH_EMPTY_TIMESTAMP, timestampWidth);
+    }
+    if (header->version < 6010000)
+        header->number15 = header->number7;
+    header->version = currentVersion;
+    return 0;
+}
+
+int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    pdtEntry();
+
+    void* block = nullptr;
+    int rc = logged(allocateZeroed(headerLength + 1, &block));
+    if (rc == 0) {
+        char* text = static_cast<char*>(block);
+        rc = readHeaderText(fh, text);
+        if (rc == 0) {
+            int scanned = parseHeader(fh, text, header);
+            rc = sqluhCheckHeaderChecksum(header) ? 0 : logged(HISTORY_FILE_DAMAGED);
+            if (rc == 0 && header->version < 7020200)
+                rc = convertOldHeader(fh, header);
+            rc = firstOf(rc, scanned);
+        }
+        sqlofmblkEx(block);
+    }
+    if (rc < 0 && rc != END_OF_FILE) {
+        sqlt_logadmin(__func__, pdAdminReadFailed);
+        logRecord({textItem(TEXT_HEADER_FAILED)});
+    }
+
+    pdtExit(rc);
+    return rc;
+}
