@@ -37,6 +37,8 @@ int takePlace(const char* argument, historyPlace* place)
         return failWithCode(sqloSystemError | errno, "open the directory", argument);
     if (!S_ISDIR(status.st_mode))
         return fail(argument, "not a directory");
+    if (access(argument, X_OK) != 0) // its files would seem to be missing
+        return failWithCode(sqloSystemError | errno, "search the directory", argument);
     snprintf(place->directory, sizeof place->directory, "%s%s", argument, separator);
     snprintf(place->historyPath, sizeof place->historyPath, "%s%s" SQLUH_HISTORY_NAME, argument,
              separator);
@@ -95,14 +97,14 @@ int awaitLock(const historyPlace* place, int rights)
     SQLO_NLCKSTATE state = {};
     bool told = false;
     if (!hasHistoryFile(place) && !ossPathExists(place->shadowPath))
-        return failWithCode(HISTORY_FILE_MISSING, "open the history", place->directory);
+        return failInPlace(HISTORY_FILE_MISSING, "open the history", place);
     if (checkRights(place, rights) != 0)
         return exitFailed;
     while (queryLock(place, &lock, &state)) {
         if (state.state == sqloNLCKSetupDied || state.state == sqloNLCKStale)
-            return failWithCode(sqloNLCKOwnerDied, "take the lock", place->directory);
+            return failInPlace(sqloNLCKOwnerDied, "take the lock", place);
         if (state.state == sqloNLCKForeign)
-            return failWithCode(sqloNLCKKeyConflict, "take the lock", place->directory);
+            return failInPlace(sqloNLCKKeyConflict, "take the lock", place);
         if (state.state == sqloNLCKAbsent)
             break;
         if (!told)
@@ -116,11 +118,8 @@ int awaitLock(const historyPlace* place, int rights)
 
 int failOpening(int code, const char* what, const historyPlace* place)
 {
-    fileReport history, shadow;
-    lookAtFile(place->historyPath, &history);
-    lookAtFile(place->shadowPath, &shadow);
-    if (code != HISTORY_FILE_DAMAGED || repairDue(&history, &shadow) == repairAnew)
-        return failWithCode(code, what, place->directory);
+    if (code != HISTORY_FILE_DAMAGED || repairDueIn(place) == repairAnew)
+        return failInPlace(code, what, place);
     return fail(place->directory,
                 "cannot %s: the history needs a repair that failed; the diagnostic log tells why "
                 "(a full disk, for one), and nothing is lost",
@@ -144,7 +143,7 @@ int closeHistory(const historyPlace* place, SQLUH_HANDLE** handle, const char* w
 {
     int rc = sqluhClose(handle);
     releaseSignals();
-    return rc == 0 ? 0 : failWithCode(rc, what, place->directory);
+    return rc == 0 ? 0 : failInPlace(rc, what, place);
 }
 
 static bool isEmptyFile(const char* path)
@@ -162,6 +161,8 @@ int createIfMissing(historyPlace* place)
     if (strlen(place->directory) > maxCreateDirectoryLength)
         return fail(place->directory, "a new history's directory has a name of at most %u bytes",
                     maxCreateDirectoryLength);
+    if (access(place->directory, W_OK) != 0)
+        return failWithCode(sqloSystemError | errno, "create the history", place->directory);
 
     // The lock is made from the history file and needs an empty one. It is filled, not replaced, so
     // whoever waits for the lock waits for the right one; and only if nobody else did it meanwhile.
@@ -180,5 +181,5 @@ int createIfMissing(historyPlace* place)
         sqluhHandleFree(&handle);
     }
     releaseSignals();
-    return rc == 0 ? 0 : failWithCode(rc, "create the history", place->directory);
+    return rc == 0 ? 0 : failInPlace(rc, "create the history", place);
 }

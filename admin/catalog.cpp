@@ -12,7 +12,7 @@
 
 // The planner knows histories by alias, in the folder of databases: it is shown a folder that has
 // this one history under a plain name.
-static int fetchThroughFolder(const char* directory, historyData* history)
+static int fetchThroughFolder(const historyPlace* place, historyData* history)
 {
     char folder[pathCapacity];
     char link[sizeof folder + sizeof "/" CATALOG_ALIAS];
@@ -21,18 +21,20 @@ static int fetchThroughFolder(const char* directory, historyData* history)
     int numBackups = 0;
     snprintf(folder, sizeof folder, "%s/zq3histXXXXXX",
              temporary != nullptr && temporary[0] != '\0' ? temporary : "/tmp");
-    char* path = realpath(directory, nullptr);
+    char* path = realpath(place->directory, nullptr);
     if (path == nullptr || mkdtemp(folder) == nullptr) {
         int failed = errno;
         free(path);
-        return failWithCode(sqloSystemError | failed, "read the history", directory);
+        return failWithCode(sqloSystemError | failed, "read the history", place->directory);
     }
     snprintf(link, sizeof link, "%s/" CATALOG_ALIAS, folder);
     int rc = symlink(path, link) == 0 && setenv("ZQ3DBPATH", folder, 1) == 0
                  ? 0
-                 : failWithCode(sqloSystemError | errno, "read the history", directory);
-    if (rc == 0 && fetchHistoryEntries(alias, nullptr, history, &numBackups) != 0)
-        rc = fail(directory, "cannot read the history; zq3hist verify DIR may tell more");
+                 : failWithCode(sqloSystemError | errno, "read the history", place->directory);
+    if (rc == 0 && fetchHistoryEntries(alias, nullptr, history, &numBackups) != 0) {
+        rc = fail(place->directory, "cannot read the history");
+        hint(place, "zq3hist verify DIR may tell more");
+    }
     unlink(link);
     rmdir(folder);
     free(path);
@@ -51,7 +53,7 @@ int readCatalog(historyPlace* place, imageCatalog* catalog)
     catalog->history.backupIndex = catalog->history.renameIndex = -1;
     int rc = awaitLock(place, R_OK);
     if (rc == 0)
-        rc = fetchThroughFolder(place->directory, &catalog->history);
+        rc = fetchThroughFolder(place, &catalog->history);
     releaseSignals();
     for (int i = catalog->history.numEntries - 1; i >= 0; i--) {
         if (isImage(&catalog->history.entries[i]))

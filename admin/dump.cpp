@@ -22,7 +22,7 @@ static int writeEntries(historyPlace* place, SQLUH_HANDLE* handle, bool json, FI
     if (rc == HISTORY_FILE_DAMAGED)
         return fail(place->directory, "the entry at offset %lld is damaged; those before it follow",
                     offset);
-    return rc == END_OF_FILE ? 0 : failWithCode(rc, "read the history", place->directory);
+    return rc == END_OF_FILE ? 0 : failInPlace(rc, "read the history", place);
 }
 
 static int copyOut(FILE* spool)

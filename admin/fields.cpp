@@ -70,11 +70,6 @@ const char* wordForLetter(const letterField* field, char letter)
     return nullptr;
 }
 
-void defaultEvent(sqlca* event)
-{
-    sqloinca(event);
-}
-
 // An empty text is written as "-", and comes back so.
 static bool isEmptyText(const char* text, uint32_t length)
 {

@@ -57,8 +57,5 @@ char defaultLetter(const letterField* field, char operation);
 // The word for a letter of the field; null when it has none.
 const char* wordForLetter(const letterField* field, char letter);
 
-// An event that a record has when only its SQLCODE is given.
-void defaultEvent(sqlca* event);
-
-// Whether two events are written to the same line.
+// Whether a file holds the same for the field of two events.
 bool isSameInFile(const sqlcaField* field, const sqlca* a, const sqlca* b);

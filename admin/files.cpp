@@ -34,6 +34,14 @@ repairKind repairDue(const fileReport* history, const fileReport* shadow)
     return inStep ? repairNothing : repairShadow;
 }
 
+repairKind repairDueIn(const historyPlace* place)
+{
+    fileReport history, shadow;
+    lookAtFile(place->historyPath, &history);
+    lookAtFile(place->shadowPath, &shadow);
+    return repairDue(&history, &shadow);
+}
+
 // --- Progress ------------------------------------------------------------------------------------
 
 struct progressBar {
@@ -82,7 +90,7 @@ static void endProgress(const progressBar* bar)
 
 // --- Entries -------------------------------------------------------------------------------------
 
-static void countEntry(entriesReport* report, const SQLUH_ENTRY* entry)
+void countEntry(entriesReport* report, const SQLUH_ENTRY* entry)
 {
     const zq3HistoryData* data = entry->data;
     const char* timestamp = data->objectPart.data;
@@ -92,7 +100,7 @@ static void countEntry(entriesReport* report, const SQLUH_ENTRY* entry)
         report->maxTablespaces = data->numTablespaces;
     if (entry->commandLength > report->maxCommandLength)
         report->maxCommandLength = entry->commandLength;
-    if (strspn(timestamp, "0123456789") >= timestampWidth &&
+    if (timestamp != nullptr && strspn(timestamp, "0123456789") >= timestampWidth &&
         memcmp(timestamp, report->newest, timestampWidth) >= 0) {
         memcpy(report->newest, timestamp, timestampWidth);
         report->newestAt = report->offset;
@@ -143,8 +151,11 @@ static bool isSoundFile(SQLO_FHANDLE file, const char* name, const char* what)
         return false;
     }
     if (header.status != statusConsistent && header.status != statusCommitted) {
-        fail(name, "cannot %s: a batch is unfinished in the history (status '%c')", what,
-             header.status);
+        fail(name,
+             header.status == statusPending
+                 ? "cannot %s: a batch is unfinished in the history (status 'P')"
+                 : "cannot %s: the file is no history",
+             what);
         return false;
     }
     rc = sqluhInitWorkArea(&workArea, defaultWorkAreaSize);

@@ -30,14 +30,18 @@ static int readAll(FILE* in, char** text, size_t* length)
     return sqloSystemError | ENOMEM;
 }
 
+static bool isStandardInput(const char* path)
+{
+    return path == nullptr || strcmp(path, "-") == 0;
+}
+
 static int readInput(const char* path, char** text, size_t* length)
 {
-    bool isStandard = path == nullptr || strcmp(path, "-") == 0;
-    FILE* in = isStandard ? stdin : fopen(path, "r");
+    FILE* in = isStandardInput(path) ? stdin : fopen(path, "r");
     if (in == nullptr)
         return sqloSystemError | errno;
     int rc = readAll(in, text, length);
-    if (!isStandard)
+    if (in != stdin)
         fclose(in);
     return rc;
 }
@@ -56,7 +60,7 @@ static int failMistake(const char* name, const stanzaMistake* mistake)
 
 static int parseInput(const char* path, historyList* list)
 {
-    const char* name = path == nullptr || strcmp(path, "-") == 0 ? "standard input" : path;
+    const char* name = isStandardInput(path) ? "standard input" : path;
     char* text = nullptr;
     size_t length = 0;
     stanzaMistake mistake = {};
@@ -79,20 +83,11 @@ static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport*
     int rc = sqloseek(handle->fileHandle, 0, sqloFromEnd, &totals->offset);
     for (size_t i = 0; rc == 0 && i < list->count; i++) {
         historyRecord* record = list->records[i];
-        const char* timestamp = record->data.objectPart.data;
         if (record->numberByPlace)
             record->data.entryNumber = totals->count + 1;
         rc = sqluhWriteEntry(handle, &record->entry);
-        header->entryCount = ++totals->count;
-        if (record->data.numTablespaces > totals->maxTablespaces)
-            totals->maxTablespaces = record->data.numTablespaces;
-        if (record->entry.commandLength > totals->maxCommandLength)
-            totals->maxCommandLength = record->entry.commandLength;
-        if (timestamp != nullptr && strspn(timestamp, "0123456789") >= timestampWidth &&
-            memcmp(timestamp, totals->newest, timestampWidth) >= 0) {
-            memcpy(totals->newest, timestamp, timestampWidth);
-            totals->newestAt = totals->offset;
-        }
+        countEntry(totals, &record->entry);
+        header->entryCount = totals->count;
         totals->offset += record->entry.size;
     }
     // offset3 is where the newest entry begins, timestamp is that entry's; old readers take the one
@@ -124,19 +119,18 @@ static int runBatch(historyPlace* place, historyList* list)
     readAllEntries(handle->fileHandle, &handle->workArea, "Reading the history", &totals);
     if (totals.rc != 0) {
         abandon(place, &handle);
-        return failWithCode(totals.rc, "append to the history", place->directory);
+        return failInPlace(totals.rc, "append to the history", place);
     }
     rc = appendRecords(handle, list, &totals);
     if (rc != 0) {
         abandon(place, &handle);
-        return failWithCode(rc, "write the entries", place->directory);
+        return failInPlace(rc, "write the entries", place);
     }
     rc = sqluhEndBatch(&handle, sqluhCommit);
     if (rc != 0) {
-        failWithCode(rc, "commit the batch", place->directory);
-        fputs("zq3hist: hint: the next open settles whether the entries are in; zq3hist dump DIR "
-              "shows them before they are loaded again\n",
-              stderr);
+        failInPlace(rc, "commit the batch", place);
+        hint(place, "the next open settles whether the entries are in; zq3hist dump DIR shows them "
+                    "before they are loaded again");
     }
     return rc == 0 ? 0 : exitFailed;
 }
@@ -144,11 +138,8 @@ static int runBatch(historyPlace* place, historyList* list)
 // A history that no file of the pair holds would silently be begun anew by the batch.
 static int checkUsable(historyPlace* place)
 {
-    fileReport history, shadow;
-    lookAtFile(place->historyPath, &history);
-    lookAtFile(place->shadowPath, &shadow);
-    return repairDue(&history, &shadow) == repairAnew
-               ? failWithCode(HISTORY_FILE_DAMAGED, "append to the history", place->directory)
+    return repairDueIn(place) == repairAnew
+               ? failInPlace(HISTORY_FILE_DAMAGED, "append to the history", place)
                : 0;
 }
 

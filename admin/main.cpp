@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstring>
+#include <fcntl.h>
 #include <unistd.h>
 
 struct subcommand {
@@ -56,8 +57,18 @@ static int runSubcommand(int argc, char** argv)
     return failUsage("no subcommand %s", argv[1]);
 }
 
+// A standard stream that the program was started without must not become a file that it opens:
+// messages would go into that file. What takes its place refuses to be read or written.
+static void fillStandardStreams(void)
+{
+    for (int stream = STDIN_FILENO; stream <= STDERR_FILENO; stream++)
+        if (fcntl(stream, F_GETFD) == -1)
+            open("/dev/null", stream == STDIN_FILENO ? O_WRONLY : O_RDONLY);
+}
+
 int main(int argc, char** argv)
 {
+    fillStandardStreams();
     if (argc < 2)
         return failUsage("no subcommand given");
     // A reader that goes away is a failed write, never an end with the lock in hand.

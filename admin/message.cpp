@@ -52,7 +52,62 @@ int failUsage(const char* format, ...)
     return exitUsage;
 }
 
-// What a code means, and what an administrator does about it; %s is the place.
+// --- Hints ---------------------------------------------------------------------------------------
+
+// Whether every shell takes the character for nothing but itself.
+static bool isPlain(char c)
+{
+    return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
+           (c != '\0' && strchr("/._-+:,@%", c) != nullptr);
+}
+
+// A word that the shell reads as this text. Bytes that a terminal might act upon are escaped.
+static void putShellWord(FILE* out, const char* text)
+{
+    bool plain = true, printable = true;
+    for (const char* c = text; *c != '\0'; c++) {
+        plain = plain && isPlain(*c);
+        printable = printable && *c >= 0x20 && *c <= 0x7E && *c != '\'';
+    }
+    if (plain || printable) {
+        fprintf(out, plain ? "%s" : "'%s'", text);
+        return;
+    }
+    fputs("$'", out);
+    for (const char* c = text; *c != '\0'; c++)
+        if (*c == '\'' || *c == '\\')
+            fprintf(out, "\\%c", *c);
+        else if (*c < 0x20 || *c > 0x7E)
+            fprintf(out, "\\x%02X", static_cast<unsigned char>(*c));
+        else
+            putc(*c, out);
+    putc('\'', out);
+}
+
+void hint(const historyPlace* place, const char* advice)
+{
+    static const char placeholder[] = "DIR";
+    char path[2 * pathCapacity];
+    fputs("zq3hist: hint: ", stderr);
+    for (const char* at; (at = strstr(advice, placeholder)) != nullptr;) {
+        fwrite(advice, 1, static_cast<size_t>(at - advice), stderr);
+        advice = at + strlen(placeholder);
+        size_t nameLength = 0;
+        if (*advice == '/') {
+            advice++; // the directory ends with one
+            nameLength = strcspn(advice, " ");
+        }
+        snprintf(path, sizeof path, "%s%.*s", place->directory, static_cast<int>(nameLength),
+                 advice);
+        putShellWord(stderr, path);
+        advice += nameLength;
+    }
+    fprintf(stderr, "%s\n", advice);
+}
+
+// --- Codes ---------------------------------------------------------------------------------------
+
+// What a code means, and what an administrator does about it.
 struct explanation {
     int code;
     const char* words;
@@ -66,7 +121,8 @@ static constexpr explanation explanations[] = {
      "zq3hist load DIR FILE makes one"},
     {HISTORY_FILE_RECREATED,
      "neither file could be used; both were moved aside and an empty history was made",
-     "zq3hist restore DIR FILE puts a backup in its place; the old files are zq3rhist.a and .b"},
+     "zq3hist restore DIR FILE puts a backup in its place; the old files "
+     "are " SQLUH_SAVED_HISTORY_NAME " and " SQLUH_SAVED_SHADOW_NAME},
     {sqloNLCKKeyFailure, "no lock key can be made of the history file",
      "it may be missing, or in a directory that may not be searched"},
     {sqloNLCKKeyConflict, "another program's semaphore set has the lock's key",
@@ -87,13 +143,18 @@ static const explanation* explanationOf(int code)
     return nullptr;
 }
 
+bool isSystemCode(int code)
+{
+    return (code & static_cast<int>(0xFFFF0000)) == sqloSystemError;
+}
+
 const char* wordsForCode(int code)
 {
     static char text[64];
     const explanation* known = explanationOf(code);
     if (known != nullptr)
         return known->words;
-    if ((code & static_cast<int>(0xFFFF0000)) == sqloSystemError)
+    if (isSystemCode(code))
         return strerror(code & 0xFFFF);
     snprintf(text, sizeof text, "code %d (0x%08X)", code, static_cast<unsigned int>(code));
     return text;
@@ -101,9 +162,14 @@ const char* wordsForCode(int code)
 
 int failWithCode(int code, const char* what, const char* where)
 {
-    fail(where, "cannot %s: %s", what, wordsForCode(code));
+    return fail(where, "cannot %s: %s", what, wordsForCode(code));
+}
+
+int failInPlace(int code, const char* what, const historyPlace* place)
+{
+    failWithCode(code, what, place->directory);
     const explanation* known = explanationOf(code);
     if (known != nullptr && known->advice != nullptr)
-        fprintf(stderr, "zq3hist: hint: %s\n", known->advice);
+        hint(place, known->advice);
     return exitFailed;
 }

@@ -142,9 +142,10 @@ int planMain(int argc, char** argv)
            (!isImage(&catalog.history.entries[target]) ||
             strcmp(catalog.history.entries[target].timestamp, argv[2]) != 0))
         target++;
-    if (rc == 0 && target == catalog.history.numEntries)
-        rc = fail(place.directory, "no image has the timestamp %s; zq3hist images DIR lists all",
-                  argv[2]);
+    if (rc == 0 && target == catalog.history.numEntries) {
+        rc = fail(place.directory, "no image has the timestamp %s", argv[2]);
+        hint(&place, "zq3hist images DIR lists all");
+    }
     if (rc == 0)
         rc = planImage(&catalog, target, &scope, &plan);
     // A plan with a hole is no plan; scripts are told of the hole by the object's members.

@@ -5,19 +5,12 @@
 
 static const char* repairedWords(repairKind done)
 {
-    return done == repairShadow    ? "The shadow was made anew from the history file."
-           : done == repairHistory ? "The history file was made anew from the shadow; a batch that "
-                                     "was not finished is undone."
-                                   : "Neither file could be used. Both were moved aside, to "
-                                     "zq3rhist.a and zq3rhist.b, and an empty history was made.";
-}
-
-static repairKind lookAtBoth(const historyPlace* place)
-{
-    fileReport history, shadow;
-    lookAtFile(place->historyPath, &history);
-    lookAtFile(place->shadowPath, &shadow);
-    return repairDue(&history, &shadow);
+    return done == repairShadow ? "The shadow was made anew from the history file."
+           : done == repairHistory
+               ? "The history file was made anew from the shadow; a batch that "
+                 "was not finished is undone."
+               : "Neither file could be used. Both were moved aside, to " SQLUH_SAVED_HISTORY_NAME
+                 " and " SQLUH_SAVED_SHADOW_NAME ", and an empty history was made.";
 }
 
 int repairMain(int argc, char** argv)
@@ -32,7 +25,7 @@ int repairMain(int argc, char** argv)
         return rc;
 
     // An open does one repair; after one of the history the shadow's mark takes another.
-    repairKind due = lookAtBoth(&place);
+    repairKind due = repairDueIn(&place);
     if (due == repairNothing)
         puts("Nothing to repair: both files can be used and are in step.");
     bool lost = false;
@@ -44,7 +37,7 @@ int repairMain(int argc, char** argv)
             puts(repairedWords(rc == HISTORY_FILE_RECREATED ? repairAnew : due));
         int closed = sqluhClose(&handle);
         rc = rc < 0 ? rc : closed;
-        due = lookAtBoth(&place);
+        due = repairDueIn(&place);
     }
     releaseSignals();
     if (rc != 0)

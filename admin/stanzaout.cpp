@@ -69,7 +69,7 @@ static void putSqlca(FILE* out, const sqlca* event)
 {
     sqlca usual;
     uint32_t tokensLength = 0;
-    defaultEvent(&usual);
+    sqloinca(&usual);
     putNumber(out, sqlcaFields[0].name, event->sqlcode);
     for (const sqlcaField& field : sqlcaFields) {
         const char* member = reinterpret_cast<const char*>(event) + field.at;

@@ -47,7 +47,7 @@ static const char* lockWords(int state)
 
 static bool isUnreadable(const fileReport* file)
 {
-    return file->present && (file->rc & static_cast<int>(0xFFFF0000)) == sqloSystemError;
+    return file->present && isSystemCode(file->rc);
 }
 
 static const char* verdict(const directoryReport* report)
@@ -148,7 +148,7 @@ int statusMain(int argc, char** argv)
     lookAtFile(place.historyPath, &report.history);
     lookAtFile(place.shadowPath, &report.shadow);
     if (!report.history.present && !report.shadow.present && !json)
-        return failWithCode(HISTORY_FILE_MISSING, "show the history", place.directory);
+        return failInPlace(HISTORY_FILE_MISSING, "show the history", &place);
     report.due = repairDue(&report.history, &report.shadow);
     report.lockKnown = queryLock(&place, &report.lock, &report.lockState);
     if (json) {

@@ -21,6 +21,14 @@ static int formTemporary(const char* where, char* path)
     return length < static_cast<int>(pathCapacity) ? 0 : fail(where, "the name is too long");
 }
 
+// Whether two paths lead to one file or directory.
+static bool isSame(const char* a, const char* b)
+{
+    struct stat first, second;
+    return stat(a, &first) == 0 && stat(b, &second) == 0 && first.st_dev == second.st_dev &&
+           first.st_ino == second.st_ino;
+}
+
 // Puts the verified file at temporary in the place of the target's history.
 static int installHistory(historyPlace* place, char* temporary)
 {
@@ -66,7 +74,7 @@ int restoreMain(int argc, char** argv)
     // too.
     int copied = sqlocopy(argv[2], temporary, 0);
     if (copied != 0)
-        rc = failWithCode(copied, "copy the backup", argv[2]);
+        rc = failWithCode(copied, "copy the backup to the directory", place.directory);
     if (rc == 0 && !isSoundImage(temporary, argv[2], "restore the history"))
         rc = exitFailed;
     if (rc == 0)
@@ -80,7 +88,6 @@ int restoreMain(int argc, char** argv)
 int copyMain(int argc, char** argv)
 {
     historyPlace source = {}, target = {};
-    struct stat from, to;
     SQLUH_HANDLE* handle = nullptr;
     char temporary[pathCapacity];
     int rc = takeArguments(argc, argv, "SRC DST", 2, 2, nullptr);
@@ -92,8 +99,7 @@ int copyMain(int argc, char** argv)
         rc = formTemporary(target.historyPath, temporary);
     if (rc != 0)
         return rc;
-    if (stat(source.directory, &from) == 0 && stat(target.directory, &to) == 0 &&
-        from.st_dev == to.st_dev && from.st_ino == to.st_ino)
+    if (isSame(source.directory, target.directory))
         return fail(target.directory, "source and target are the same directory");
 
     // One lock at a time: keys may clash, and the second lock would then wait for the first.
@@ -113,6 +119,18 @@ int copyMain(int argc, char** argv)
     if (rc == 0)
         puts("The history was copied.");
     return rc;
+}
+
+// A backup takes the place of an older one of that name, but neither of the history, which others
+// may be using, nor of a device or a pipe.
+static int checkBackupName(const historyPlace* place, const char* path)
+{
+    struct stat there;
+    if (isSame(path, place->historyPath) || isSame(path, place->shadowPath))
+        return fail(path, "the backup would replace the history itself");
+    if (lstat(path, &there) == 0 && !S_ISREG(there.st_mode))
+        return fail(path, "the backup would replace something that is no regular file");
+    return 0;
 }
 
 // Reads the open history piece by piece into the file at path, which is durable afterwards.
@@ -172,6 +190,8 @@ int backupMain(int argc, char** argv)
     int rc = takeArguments(argc, argv, "DIR FILE", 2, 2, nullptr);
     if (rc == 0)
         rc = takePlace(argv[1], &place);
+    if (rc == 0)
+        rc = checkBackupName(&place, argv[2]);
     if (rc == 0)
         rc = formTemporary(argv[2], temporary);
     if (rc == 0)

@@ -12,12 +12,12 @@ int unlockMain(int argc, char** argv)
     if (rc != 0)
         return rc;
     if (!hasHistoryFile(&place))
-        return failWithCode(HISTORY_FILE_MISSING, "look at the lock", place.directory);
+        return failInPlace(HISTORY_FILE_MISSING, "look at the lock", &place);
     rc = sqloNLCKInit(place.historyPath, &lock, sqloNLCKUseNodeNumber);
     if (rc == 0)
         rc = sqloNLCKQuery(&lock, &state);
     if (rc != 0)
-        return failWithCode(rc, "look at the lock", place.directory);
+        return failInPlace(rc, "look at the lock", &place);
 
     switch (state.state) {
     case sqloNLCKAbsent:
@@ -29,13 +29,13 @@ int unlockMain(int argc, char** argv)
     case sqloNLCKSettingUp:
         return fail(place.directory, "the lock is just being taken and was left alone");
     case sqloNLCKForeign:
-        return failWithCode(sqloNLCKKeyConflict, "remove the lock", place.directory);
+        return failInPlace(sqloNLCKKeyConflict, "remove the lock", &place);
     default:
         break;
     }
     rc = sqloNLCKRemoveDead(&lock, &state);
     if (rc != 0)
-        return failWithCode(rc, "remove the lock", place.directory);
+        return failInPlace(rc, "remove the lock", &place);
     puts(state.state == sqloNLCKStale
              ? "Removed the lock of a process that died while it held it."
              : "Removed the lock of a process that died while it took it.");

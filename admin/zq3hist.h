@@ -27,26 +27,6 @@ int unlockMain(int argc, char** argv);
 int imagesMain(int argc, char** argv);
 int planMain(int argc, char** argv);
 
-// --- Messages (message.cpp) ----------------------------------------------------------------------
-
-// Says "zq3hist: what, where" on standard error, what being formatted, and returns exitFailed.
-int fail(const char* where, const char* format, ...) __attribute__((format(printf, 2, 3)));
-
-// Says the same in the words for a code of the library, with what to do about it: "zq3hist:
-// cannot WHAT: reason, where".
-int failWithCode(int code, const char* what, const char* where);
-
-// Complains about the command line and returns exitUsage.
-int failUsage(const char* format, ...) __attribute__((format(printf, 1, 2)));
-
-// The words for a code of the library. They live until the next call.
-const char* wordsForCode(int code);
-
-// Writes bytes with everything but printable ASCII as escapes of the stanza form.
-void putEscaped(FILE* out, const char* text, size_t length);
-
-// --- Directories and locks (access.cpp) ----------------------------------------------------------
-
 // A history directory as the library takes it, and its two files.
 struct historyPlace {
     char directory[pathCapacity]; // ends with the separator
@@ -54,12 +34,44 @@ struct historyPlace {
     char shadowPath[pathCapacity];
 };
 
-// Takes a directory from the command line, with or without its last separator. Complains and
-// returns exitFailed when it is too long or no directory, else 0.
-int takePlace(const char* argument, historyPlace* place);
+// --- Messages (message.cpp) ----------------------------------------------------------------------
 
-// Takes an argument list of the form [--json] DIRECTORY: json may be null. Returns 0 or exitUsage.
+// Says "zq3hist: what, where" on standard error, what being formatted, and returns exitFailed.
+int fail(const char* where, const char* format, ...) __attribute__((format(printf, 2, 3)));
+
+// Says the same in the words for a code of the library: "zq3hist: cannot WHAT: reason, where".
+int failWithCode(int code, const char* what, const char* where);
+
+// Says "zq3hist: hint: advice" on standard error. DIR in the advice stands for the directory, and
+// DIR/NAME for a file in it; each is put in as one word for the shell, ready to be typed.
+void hint(const historyPlace* place, const char* advice);
+
+// failWithCode about a history directory, with a hint what to do about the code.
+int failInPlace(int code, const char* what, const historyPlace* place);
+
+// Complains about the command line and returns exitUsage.
+int failUsage(const char* format, ...) __attribute__((format(printf, 1, 2)));
+
+// The words for a code of the library. They live until the next call.
+const char* wordsForCode(int code);
+
+// Whether a code is that of a system call that failed, its errno included.
+bool isSystemCode(int code);
+
+// Writes bytes with everything but printable ASCII as escapes of the stanza form.
+void putEscaped(FILE* out, const char* text, size_t length);
+
+// --- Directories and locks (access.cpp) ----------------------------------------------------------
+
+// Takes the options out of a subcommand's arguments: argv[1] and up are then the others, null
+// behind the last. form: the arguments as the usage line shows them; least, most: how many there
+// may be without the options, -1 for any number; json: set by --json, null where that is no option.
+// Returns 0, or exitUsage after a complaint.
 int takeArguments(int argc, char** argv, const char* form, int least, int most, bool* json);
+
+// Takes a directory from the command line, with or without its last separator. Complains and
+// returns exitFailed when it is too long, no directory, or one that may not be searched, else 0.
+int takePlace(const char* argument, historyPlace* place);
 
 bool hasHistoryFile(const historyPlace* place);
 
@@ -105,6 +117,7 @@ void lookAtFile(const char* path, fileReport* report);
 // What the next open will do about the two files.
 enum repairKind { repairNothing, repairShadow, repairHistory, repairAnew };
 repairKind repairDue(const fileReport* history, const fileReport* shadow);
+repairKind repairDueIn(const historyPlace* place); // looks at both files
 
 // What reading all entries of a file found.
 struct entriesReport {
@@ -117,6 +130,9 @@ struct entriesReport {
     long long newestAt;              // offset of its last entry
     uint32_t digest;                 // equal for equal entries
 };
+
+// Counts one more entry, which begins at report->offset.
+void countEntry(entriesReport* report, const SQLUH_ENTRY* entry);
 
 // Reads all entries of an open file, behind its header. progress: null, or what a progress bar on
 // the terminal is titled with when it takes long.

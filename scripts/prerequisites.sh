@@ -1,3 +1,4 @@
+# shellcheck shell=bash
 # Installs Debian packages that are missing. Sourced: . scripts/prerequisites.sh; need PACKAGE...
 #
 # Nothing is asked of the network, and no rights are needed, when everything is there.

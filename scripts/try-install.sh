@@ -75,6 +75,7 @@ cp "$package" "$1/package.deb"
 cp "$scratch/plan.sh" "$1/plan.sh"
 cp -r examples "$1/examples"
 # A mount namespace of its own: nothing stays mounted, whatever happens.
+# shellcheck disable=SC2016
 unshare --mount sh -euc 'mount -t proc proc "$0/proc" && exec chroot "$0" sh -euc "$1"' "$1" '
   find / -xdev -not -path "/var/*" -not -path "/proc/*" | sort >/before
   dpkg -i /package.deb

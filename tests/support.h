@@ -6,11 +6,9 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <string>
 #include <vector>
 
-#include <sys/ipc.h>
 #include <sys/sem.h>
 #include <unistd.h>
 
@@ -21,7 +19,7 @@
 inline std::string slurp(const std::string& path)
 {
     std::ifstream in(path, std::ios::binary);
-    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+    return {std::istreambuf_iterator<char>(in), {}};
 }
 
 inline void spill(const std::string& path, const std::string& bytes)
@@ -33,8 +31,9 @@ inline void spill(const std::string& path, const std::string& bytes)
 inline int lockSetOf(const std::string& historyPath)
 {
     SQLO_NLCK lock = {};
-    int rc = sqloNLCKInit(historyPath.c_str(), &lock, sqloNLCKUseNodeNumber);
-    return rc == 0 ? semget(lock.key, 0, 0) : -2;
+    return sqloNLCKInit(historyPath.c_str(), &lock, sqloNLCKUseNodeNumber) == 0
+               ? semget(lock.key, 0, 0)
+               : -2;
 }
 
 inline bool lockKeyIsFree(const std::string& historyPath)
@@ -45,33 +44,6 @@ inline bool lockKeyIsFree(const std::string& historyPath)
 inline void removeLockSet(const std::string& historyPath)
 {
     semctl(lockSetOf(historyPath), 0, IPC_RMID);
-}
-
-// The records of a diagnostic log without time, process and function: the text, then " [LABEL: N
-// bytes]" for each dump. Levels other than Error stand in front; of an administration message only
-// its number is kept.
-inline std::vector<std::string> logRecords(const std::string& path)
-{
-    static const std::string admin = "Administration message ";
-    std::vector<std::string> records;
-    std::ifstream in(path);
-    for (std::string line; std::getline(in, line);) {
-        size_t level = line.find(" level="), function = line.find(" function=");
-        if (line[0] != ' ' && function != std::string::npos) {
-            std::string name = line.substr(level + 7, function - level - 7);
-            std::string text = line.substr(line.find(':', function) + 1).erase(0, 1);
-            if (text.starts_with(admin))
-                text.erase(admin.size() + 4);
-            records.push_back((name == "Error" ? "" : name + " ") + text);
-        } else if (records.empty() || line.ends_with("|") || line.ends_with("bytes shown)")) {
-            continue;
-        } else if (line.ends_with(" bytes")) {
-            records.back() += " [" + line.substr(4) + "]";
-        } else if (!records.back().starts_with(admin)) {
-            records.back() += " / " + line.substr(4);
-        }
-    }
-    return records;
 }
 
 // A scratch directory in memory with a history directory in it whose lock key nobody uses, and a
@@ -86,19 +58,17 @@ class HistoryTest : public testing::Test
         setenv("ZQ3SYNC", "off", 1);
         // A key has 16 bits of the inode number. The memory file system numbers inodes one after
         // the other, so the files that the test makes have keys near that of a file made here.
-        for (bool isFree = false; !isFree;) {
+        do {
             std::filesystem::remove_all(root);
-            char name[32];
-            strcpy(name, access("/dev/shm", W_OK) == 0 ? "/dev/shm/zq3XXXXXX" : "/tmp/zq3XXXXXX");
-            root = std::string(mkdtemp(name)) + "/";
-            directory = root + "h/";
+            root = access("/dev/shm", W_OK) == 0 ? "/dev/shm/zq3XXXXXX" : "/tmp/zq3XXXXXX";
+            root = std::string(mkdtemp(root.data())) + "/";
+            directory = root + "SAMPLE/";
             std::filesystem::create_directory(directory);
             historyPath = directory + SQLUH_HISTORY_NAME;
             shadowPath = directory + SQLUH_SHADOW_NAME;
             spill(historyPath, "");
-            isFree = lockKeyIsFree(historyPath);
-            unlink(historyPath.c_str());
-        }
+        } while (!lockKeyIsFree(historyPath));
+        unlink(historyPath.c_str());
         logPath = root + "diag.log";
         setenv("ZQ3DIAGLOG", logPath.c_str(), 1);
     }
@@ -109,10 +79,29 @@ class HistoryTest : public testing::Test
         std::filesystem::remove_all(root);
     }
 
-    // What was logged since the last call.
+    // The records logged since the last call without time, process and function: the text, then
+    // " [LABEL: N bytes]" for each dump. Levels other than Error stand in front; of an
+    // administration message only its number is kept.
     std::vector<std::string> takeLog()
     {
-        std::vector<std::string> records = logRecords(logPath);
+        static const std::string admin = "Administration message ";
+        std::vector<std::string> records;
+        std::ifstream in(logPath);
+        for (std::string line; std::getline(in, line);) {
+            if (!line.starts_with("    ")) {
+                size_t level = line.find(" level=") + 7, function = line.find(" function=");
+                std::string name = line.substr(level, function - level) + " ";
+                std::string text = line.substr(line.find(':', function) + 1).erase(0, 1);
+                if (text.starts_with(admin))
+                    text.erase(admin.size() + 4);
+                records.push_back((name == "Error " ? "" : name) + text);
+            } else if (line.ends_with(" bytes")) {
+                records.back() += " [" + line.substr(4) + "]";
+            } else if (!line.ends_with("|") && !line.ends_with(" shown)") &&
+                       !records.back().starts_with(admin)) {
+                records.back() += " / " + line.substr(4);
+            }
+        }
         unlink(logPath.c_str());
         return records;
     }
@@ -199,16 +188,11 @@ struct entryReader {
 
     explicit entryReader(uint32_t capacity = 4096, uint32_t maxTablespaces = 64,
                          uint32_t workAreaSize = defaultWorkAreaSize)
-        : tablespaceBuffers(maxTablespaces)
+        : storage(10 + maxTablespaces, std::vector<char>(capacity, '~')),
+          tablespaceBuffers(maxTablespaces)
     {
-        const auto give = [&](textBuffer* text) {
-            storage.emplace_back(capacity, '~');
-            *text = {capacity == 0 ? nullptr : storage.back().data(), capacity, 0};
-        };
-        for (textBuffer* text : texts())
-            give(text);
-        for (textBuffer& name : tablespaceBuffers)
-            give(&name);
+        for (uint32_t i = 0; i < 10 + maxTablespaces; i++)
+            (i < 10 ? texts()[i] : tablespaceBuffers[i - 10]) = {storage[i].data(), capacity, 0};
         data.tablespaceBuffers = tablespaceBuffers.data();
         data.maxTablespaces = maxTablespaces;
         data.eventSqlca = &ca;
@@ -221,12 +205,10 @@ struct entryReader {
         sqlofmblkEx(workArea.buffer);
     }
 
-    std::vector<textBuffer*> texts()
+    // The record's ten buffers.
+    textBuffer* texts()
     {
-        std::vector<textBuffer*> all;
-        for (textBuffer* text = &data.objectPart; text <= &data.commandText; text++)
-            all.push_back(text);
-        return all;
+        return &data.objectPart;
     }
 
     int read(SQLO_FHANDLE fh, const char* timestamp = nullptr, const char* qualifier = nullptr,

@@ -3,16 +3,18 @@
 // check that a directory is sound again.
 #pragma once
 
+#include <algorithm>
 #include <functional>
 #include <map>
 #include <set>
+#include <sstream>
 
 #include "sqo/sqlzkrcb.h"
 #include "support.h"
 
 // Asked before each OS-services call (with 0) and each semaphore call (with its flags, its step or
 // its command): the code that it shall fail with instead, a semaphore call's an errno; or 0.
-extern std::function<int(const std::string& call, int command)> onCall;
+inline std::function<int(const std::string& call, int command)> onCall;
 
 enum diskKind { diskWrite, diskTruncate, diskCreate, diskUnlink, diskRename, diskSync, diskNames };
 
@@ -33,17 +35,15 @@ struct stopPoint {
     size_t cut = 0;
 };
 
-// While watching, such calls are logged. Behind the stop nothing happens any more: the process
-// ends, or (exits false) goes on with a disk that refuses every change.
+// While watching, such calls are logged. Behind the stop the disk refuses every change: it keeps
+// what a process that ends there leaves.
 struct diskControl {
     bool watching;
     stopPoint stop;
-    bool exits, stopped;
-    unsigned int batchSyncs; // sqlosync calls of this batch: numbers the barriers B1 to B4
+    bool stopped;
     std::vector<diskOp> log;
 };
-extern diskControl disk;
-enum : int { stoppedStatus = 77 };
+inline diskControl disk;
 
 #if defined(__SANITIZE_ADDRESS__)
 constexpr unsigned int slowdown = 10;
@@ -62,57 +62,252 @@ struct scenario {
     std::string before, after; // history, shadow and, after, the files moved aside
     std::vector<unsigned int> outcomes;
 };
-extern const std::vector<scenario> scenarios;
+// clang-format off
+inline const std::vector<scenario> scenarios = {
+    {"commit 1", " 10/ 10", " 11/C11", {10, 11}},  {"commit 2", " 10/ 10", " 12/C12", {10, 12}},
+    {"commit 3", " 10/ 10", " 13/C13", {10, 13}},  {"commit 4", " 10/ 10", " 14/C14", {10, 14}},
+    {"commit 5", " 10/ 10", " 15/C15", {10, 15}},  {"commit 6", " 10/ 10", " 16/C16", {10, 16}},
+    {"commit 1", " 1/ 1", " 2/C2", {1, 2}},        {"commit 2", " 1/ 1", " 3/C3", {1, 3}},
+    {"commit 1", "-/-", " 1/C1/empty", {0, 1}},    {"abandon 0", " 10/ 10", "P10/ 10", {10}},
+    {"abandon 1", " 10/ 10", "P10+788/ 10", {10}}, {"restore 2", " 10/ 10", " 12/ 12", {10, 12}},
+    {"open", " 10/ 10", " 10/ 10", {10}},          {"open", " 10/C10", " 10/C10", {10}},
+    {"open", " 10/-", " 10/ 10", {10}},            {"open", " 10/junk", " 10/ 10", {10}},
+    {"open", " 10/P10", " 10/ 10", {10}},          {"open", " 10/Q12", " 10/ 10", {10}},
+    {"open", " 10/ 10-1", " 10/ 10", {10}},        {"open", "C12/ 10", " 12/C12", {12}},
+    {"open", "C12/C12", " 12/C12", {12}},          {"open", "C12/C12-876", " 12/C12", {12}},
+    {"open", "C12/P10", " 12/C12", {12}},          {"open", "C12/-", " 12/C12", {12}},
+    {"open", "C12/junk", " 12/C12", {12}},         {"open", "P10+900/ 10", " 10/P10", {10}},
+    {"open", "P12/C10", " 10/P10", {10}},          {"open", "P12/P10", " 10/P10", {10}},
+    {"open", "Q12/ 10", " 10/P10", {10}},          {"open", "junk/C12", " 12/P12", {12}},
+    {"open", "empty/P10", " 10/P10", {10}},        {"open", "-/ 10", " 10/P10", {10}},
+    {"fatal", "-/-", " 0/ 0/empty", {0}},          {"fatal", "junk/Q10", " 0/ 0/junk/Q10", {0}},
+    {"fatal", "P10/-", " 0/ 0/P10", {0}},          {"fatal", "-/junk", " 0/ 0/empty/junk", {0}},
+};
+// clang-format on
 
 class DirectoryTest : public HistoryTest
 {
   protected:
-    uint16_t writer = 0;    // node number of the entries that append writes
-    const char* phase = ""; // of the running scenario: "commit" between begin and end of a batch
+    inline static std::vector<std::string> samples; // sound history files of 0 to 17 entries
+    uint16_t writer = 0;                            // node number of the entries that append writes
+    bool inBatch = false;                           // between begin and end of a batch
+    std::string restored;   // form of the image that the last scenario restored
+    unsigned int parts = 0; // times that faultOf took a part of it
+    SQLO_NLCK lock = {};    // as lockState filled it
 
-    DirectoryTest();
+    DirectoryTest()
+    {
+        // Keys hold 16 bits of the inode number, and these tests make many files: test programs
+        // that run side by side take different node numbers, which are in the key, too.
+        sqlz_krcbp->nodeNumber = static_cast<int16_t>(getpid() % 240);
+        setenv("ZQ3DIAGLOG", "/dev/null", 1);
+        onCall = nullptr;
+        disk = {};
+        while (samples.size() <= 17) {
+            EXPECT_EQ(0, samples.empty() ? sqluhCreate(directory.data()) : batch(1));
+            samples.push_back(slurp(historyPath));
+            EXPECT_EQ(1024 + 788 * (samples.size() - 1), samples.back().size());
+        }
+        store({});
+    }
 
-    Files load();
-    void store(const Files& files);
+    // --- Files as values -------------------------------------------------------------------------
 
-    // Sound history files of 0 to 17 entries.
-    static std::vector<std::string> samples;
+    Files load()
+    {
+        Files files;
+        for (const auto& file : std::filesystem::directory_iterator(directory))
+            files[file.path().filename()] = slurp(file.path());
+        return files;
+    }
 
-    std::string fileOf(const std::string& word);
-    Files filesOf(const std::string& words);
+    // Files that exist keep their inodes, so that a directory has few lock keys over its life.
+    void store(const Files& files)
+    {
+        for (const auto& file : std::filesystem::directory_iterator(directory))
+            if (!files.contains(file.path().filename()))
+                std::filesystem::remove(file.path());
+        for (const auto& [name, bytes] : files)
+            spill(directory + name, bytes);
+    }
 
-    // The image without what settles by itself: its status letter, and the checksum with it.
-    static std::string settledForm(std::string image);
+    // "C12": a history of 12 entries with status C; "C12-876": the same without its last 876 bytes;
+    // "P10+900": with 900 bytes of the entries that would come next; "-": no file.
+    std::string fileOf(const std::string& word)
+    {
+        char status = 0;
+        unsigned int entries = 0;
+        int more = 0;
+        if (sscanf(word.c_str(), "%c%u%d", &status, &entries, &more) < 2)
+            return word == "junk" ? std::string(3000, 'x') : "";
+        std::string path = root + "word";
+        spill(path, samples.at(entries));
+        EXPECT_EQ(0, sqluhUpdateHeaderStatus(path.data(), status));
+        const size_t length = samples.at(entries).size();
+        return (slurp(path) + samples.at(entries + 2 * (more > 0)).substr(length))
+            .substr(0, length + static_cast<size_t>(more));
+    }
+
+    Files filesOf(const std::string& words)
+    {
+        const char* names[] = {SQLUH_HISTORY_NAME, SQLUH_SHADOW_NAME, SQLUH_SAVED_HISTORY_NAME,
+                               SQLUH_SAVED_SHADOW_NAME};
+        Files files;
+        std::istringstream list(words);
+        std::string word;
+        for (size_t i = 0; std::getline(list, word, '/'); i++)
+            if (word != "-")
+                files[names[i]] = fileOf(word);
+        return files;
+    }
+
+    // The image without what settles by itself: its status letter, and the checksum with it. Only
+    // blanks stand behind a header's fields; a copy stopped in the head leaves zeros there.
+    static std::string settledForm(std::string image)
+    {
+        constexpr size_t fieldsEnd = 176;
+        if (image.size() < headerLength)
+            return image;
+        image[statusAt] = '-';
+        return image.substr(checksumWidth, fieldsEnd - checksumWidth) + image.substr(headerLength);
+    }
+
+    // The number of entries that the header tells.
+    static unsigned int countOf(const std::string& image)
+    {
+        return static_cast<unsigned int>(std::stoul(image.substr(60, 8), nullptr, 16));
+    }
+
+    // --- Uses of a directory ---------------------------------------------------------------------
 
     // Appends entries numbered on from the header's count, and keeps that count.
-    int append(SQLUH_HANDLE* handle, unsigned int entries);
-    int batch(unsigned int entries, unsigned int flags = sqluhCommit);
-    int openAndClose();
-    int run(const scenario& s);
+    int append(SQLUH_HANDLE* handle, unsigned int entries)
+    {
+        int rc = sqloseek(handle->fileHandle, 0, sqloFromEnd, nullptr);
+        for (unsigned int i = 0; rc == 0 && i < entries; i++) {
+            entryBuilder builder;
+            builder.data.entryNumber = handle->header.entryCount + 1;
+            builder.data.entryNode = writer;
+            builder.note = "entry " + std::to_string(builder.data.entryNumber);
+            builder.tablespaces = {"USERDATA01"};
+            rc = sqluhWriteEntry(handle, builder.build());
+            handle->header.entryCount += rc == 0;
+        }
+        return rc;
+    }
+
+    int batch(unsigned int entries, unsigned int flags = sqluhCommit)
+    {
+        SQLUH_HANDLE* handle = nullptr;
+        int rc = sqluhBeginBatch(&handle, directory.data());
+        EXPECT_EQ(rc != 0, handle == nullptr);
+        inBatch = rc == 0;
+        if (inBatch)
+            rc = append(handle, entries);
+        // A batch that could not be written is given up.
+        const int ended = sqluhEndBatch(&handle, rc == 0 ? flags : unsigned{sqluhAbandon});
+        EXPECT_EQ(nullptr, handle);
+        inBatch = false;
+        return rc != 0 ? rc : ended;
+    }
+
+    int openAndClose()
+    {
+        SQLUH_HANDLE* handle = nullptr;
+        const int rc = sqluhOpen(&handle, directory.data(), SQLUH_OPEN_READ);
+        EXPECT_EQ(rc < 0, handle == nullptr);
+        const int closed = sqluhClose(&handle);
+        return rc < 0 ? rc : closed != 0 ? closed : rc;
+    }
+
+    // Puts the image in the history's place, piece by piece.
+    static int restore(SQLUH_HANDLE* handle, std::string image)
+    {
+        int rc = 0;
+        const unsigned int size = static_cast<unsigned int>(image.size()), length = 2500;
+        for (unsigned int at = 0; rc == 0 && at < size; at += length)
+            rc =
+                sqluh_write_restore_buffer(handle, at, reinterpret_cast<unsigned char*>(&image[at]),
+                                           std::min(length, size - at));
+        return rc;
+    }
+
+    int run(const scenario& s)
+    {
+        restored.clear();
+        if (s.action == "open" || s.action == "fatal")
+            return openAndClose();
+        if (!s.action.starts_with("restore"))
+            return batch(static_cast<unsigned int>(s.action.back() - '0'),
+                         s.action[0] == 'c' ? sqluhCommit : sqluhAbandon);
+        const std::string image = samples.at(s.outcomes.back());
+        restored = settledForm(image);
+        SQLUH_HANDLE* handle = nullptr;
+        int rc = sqluhOpen(&handle, directory.data(), SQLUH_OPEN_UPDATE);
+        if (rc == 0)
+            rc = restore(handle, image);
+        const int closed = sqluhClose(&handle);
+        return rc != 0 ? rc : closed;
+    }
 
     // Runs with the disk watched and, where told, stopped. What was done is in disk.log.
-    template <typename use> int watch(use run, stopPoint stop = {}, bool exits = false)
+    template <typename use> int watch(use run, stopPoint stop = {})
     {
-        disk = {true, stop, exits, false, 0, {}};
+        disk = {true, stop, false, {}};
         const int rc = run();
         disk.watching = false;
         return rc;
     }
 
+    // --- Checks ----------------------------------------------------------------------------------
+
     // Opens the directory twice; then both files have one of these numbers of entries, are marked
     // sound and not locked. An empty text, or what is wrong.
-    std::string faultOf(const std::vector<unsigned int>& outcomes);
-
+    //
     // A restore replaces the history in place, piece by piece. Stopped between two pieces, it
     // leaves a part of the image from its beginning, or nothing of it.
-    bool isPartOfRestore(const scenario& s);
+    std::string faultOf(const std::vector<unsigned int>& outcomes)
+    {
+        for (int i = 0; i < 2; i++)
+            if (const int rc = openAndClose(); rc < 0)
+                return "open returns " + std::to_string(rc);
+        const std::string history = slurp(historyPath), form = settledForm(history);
+        const auto isForm = [&](unsigned int n) { return form == settledForm(samples[n]); };
+        const bool isWhole = std::ranges::any_of(outcomes, isForm);
+        const bool isPart = restored.starts_with(form) || (!restored.empty() && isForm(0));
+        parts += !isWhole && isPart;
+        if (!isWhole && !isPart)
+            return "neither old nor new: " + std::to_string(history.size()) + " bytes";
+        if (settledForm(slurp(shadowPath)) != form)
+            return "the files differ";
+        return history[statusAt] != ' ' || !lockKeyIsFree(historyPath) ? "not blank, or locked"
+                                                                       : "";
+    }
 
     // What sqloNLCKQuery says about the history's lock.
-    SQLO_NLCKSTATE lockState(SQLO_NLCK* lock);
+    SQLO_NLCKSTATE lockState()
+    {
+        SQLO_NLCKSTATE state = {};
+        if (sqloNLCKInit(historyPath.c_str(), &lock, sqloNLCKUseNodeNumber) == 0) {
+            EXPECT_EQ(0, sqloNLCKQuery(&lock, &state));
+        }
+        return state;
+    }
 
-    // Removes the sets that a dead process left, as an administrator would who finds them by pid.
-    static int removeSetsOf(pid_t pid);
+    // Removes the lock sets that this process has left, under whatever key.
+    static int removeSetsLeft()
+    {
+        struct seminfo info;
+        struct semid_ds set;
+        int removed = 0;
+        for (int index = semctl(0, 0, SEM_INFO, &info); index >= 0; index--) {
+            const int id = semctl(index, 0, SEM_STAT, &set);
+            if (id >= 0 && semctl(id, 0, GETPID) == getpid())
+                removed += semctl(id, 0, IPC_RMID) == 0;
+        }
+        return removed;
+    }
+
+  private:
+    enum : size_t { checksumWidth = 8, statusAt = 132 }; // in a header's text
 };
-
-// Waits for a child's end and returns its wait status.
-int waitFor(pid_t child);

@@ -1,19 +1,12 @@
 // The calls that the tests stand in front of. Each goes on to the real one unless a test says no.
 #include "directory/fixture.h"
 
-#include <cerrno>
 #include <cstdarg>
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
-std::function<int(const std::string&, int)> onCall;
-diskControl disk;
-
-// The OS-services call that is under way, and how often it has synced a file.
-static std::string service;
-static int syncsOfService;
+static std::string service; // the OS-services call that is under way
 
 template <typename function> static function next(function, const char* name)
 {
@@ -23,7 +16,6 @@ template <typename function> static function next(function, const char* name)
 static int enter(const char* name, int command)
 {
     service = name;
-    syncsOfService = 0;
     return onCall ? onCall(name, command) : 0;
 }
 
@@ -56,11 +48,11 @@ HOOK(sqlogmblkEx,
      (pool, size, word, block, file, line, zero), 0, (*block = nullptr, code))
 HOOK(sqloMemBlockReallocate, (void** block, size_t n, unsigned word, const char* s, unsigned line),
      (block, n, word, s, line), 0, code)
-
 HOOK(semget, (key_t key, int count, int flags) noexcept, (key, count, flags), flags,
      (errno = code, -1))
 HOOK(semop, (int id, sembuf* steps, size_t count) noexcept, (id, steps, count), steps->sem_op,
      (errno = code, -1))
+
 extern "C" int semctl(int id, int number, int command, ...) noexcept
 {
     static const auto real = next(&semctl, "semctl");
@@ -99,8 +91,6 @@ template <typename call> static auto perform(diskOp op, call happen) -> decltype
         disk.log.push_back(op);
     if (!disk.stopped)
         return result;
-    if (disk.exits)
-        _exit(stoppedStatus);
     errno = EIO;
     return -1;
 }
@@ -129,8 +119,7 @@ extern "C" int open(const char* path, int flags, ...)
     const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
     va_end(rest);
     const bool exists = access(path, F_OK) == 0;
-    const bool changes = exists ? (flags & (O_TRUNC | O_EXCL)) == O_TRUNC : (flags & O_CREAT) != 0;
-    if (!disk.watching || !changes)
+    if (!disk.watching || (flags & (exists ? O_TRUNC : O_CREAT)) == 0)
         return real(path, flags, mode);
     int fd = -1;
     const int result = perform({exists ? diskTruncate : diskCreate, 0, 0, "", path},
@@ -155,11 +144,13 @@ extern "C" int rename(const char* path, const char* newPath) noexcept
                    [&](size_t) { return real(path, newPath); });
 }
 
-static std::string barrierName()
+// Of a batch B1 to B4; of a copy that of the source, of the target's head, or of its body.
+static std::string barrierName(int fd)
 {
+    const auto ofBatch = [](const diskOp& op) { return op.name.starts_with('B'); };
     if (service == "sqlosync")
-        return std::string("B").append(std::to_string(++disk.batchSyncs));
-    if (syncsOfService++ == 0 || disk.log.empty())
+        return std::string("B") + char('1' + std::ranges::count_if(disk.log, ofBatch));
+    if (disk.log.empty() || (fcntl(fd, F_GETFL) & O_ACCMODE) == O_RDONLY)
         return "R0";
     return disk.log.back().kind == diskWrite && disk.log.back().at == 0 ? "R4" : "CH";
 }
@@ -167,9 +158,7 @@ static std::string barrierName()
 // Nothing waits for a real disk here: what a sync does is in the log.
 extern "C" int fdatasync(int fd)
 {
-    return disk.watching
-               ? perform({diskSync, inodeOf(fd), 0, "", barrierName()}, [](size_t) { return 0; })
-               : 0;
+    return perform({diskSync, inodeOf(fd), 0, "", barrierName(fd)}, [](size_t) { return 0; });
 }
 
 extern "C" int fsync(int)

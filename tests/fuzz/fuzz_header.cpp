@@ -26,10 +26,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     static char file[1024 + 5120];
     if (size == 0 || size > sizeof file)
         return 0;
-    // The first byte says whether the checksum is made to match.
-    bool stamping = (data[0] & 1) != 0 && size > headerLength;
     memcpy(file, data + 1, size - 1);
-    if (stamping)
+    // The first byte says whether the checksum is made to match.
+    if ((data[0] & 1) != 0 && size > headerLength)
         stamp(file);
 
     SQLUH_HEADER header, again;
@@ -38,16 +37,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     REQUIRE(rc <= 0);
     if (rc != 0)
         return 0;
-    long long position = 0;
-    sqloseek(memoryHandle, 0, sqloFromCurrent, &position);
-    REQUIRE(position == headerLength && header.checksum == 0);
+    REQUIRE(filePosition == headerLength && header.checksum == 0);
 
     uint32_t version = header.version;
     REQUIRE(sqluhWriteHeader(memoryHandle, &header) == 0);
     // The text cannot carry these; the reader takes them from files that nobody here wrote.
-    if (header.status == '\0' || header.timestamp[0] == '-' || version < 7020200)
-        return 0;
-    if (memchr(header.timestamp, '\0', sizeof header.timestamp) != nullptr)
+    if (header.status == '\0' || header.timestamp[0] == '-' || version < 7020200 ||
+        memchr(header.timestamp, '\0', sizeof header.timestamp) != nullptr)
         return 0;
     serveFile(reinterpret_cast<uint8_t*>(lastHeader), sizeof lastHeader);
     REQUIRE(sqluhReadHeader(memoryHandle, &again) == 0);

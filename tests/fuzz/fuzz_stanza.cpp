@@ -2,17 +2,23 @@
 // same: nothing of an entry is lost on the way.
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
+#include <string>
 
 #include "admin/stanza.h"
+#include "memoryfile.h"
 
-// Writes all records as stanzas; *text is the caller's to free.
-static void writeAll(const historyList* list, char** text, size_t* length)
+// All records as stanzas.
+static std::string written(const historyList* list)
 {
-    FILE* out = open_memstream(text, length);
+    char* text;
+    size_t length;
+    FILE* out = open_memstream(&text, &length);
     for (size_t i = 0; i < list->count; i++)
         writeStanza(out, list->records[i]);
     fclose(out);
+    std::string stanzas(text, length);
+    free(text);
+    return stanzas;
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* bytes, size_t size)
@@ -20,16 +26,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* bytes, size_t size)
     historyList first = {}, second = {};
     stanzaMistake mistake;
     if (readStanzas(reinterpret_cast<const char*>(bytes), size, 0, &first, &mistake) == 0) {
-        char *text, *again;
-        size_t length, againLength;
-        writeAll(&first, &text, &length);
-        if (readStanzas(text, length, 0, &second, &mistake) != 0)
-            abort();
-        writeAll(&second, &again, &againLength);
-        if (length != againLength || memcmp(text, again, length) != 0)
-            abort();
-        free(text);
-        free(again);
+        const std::string text = written(&first);
+        REQUIRE(readStanzas(text.data(), text.size(), 0, &second, &mistake) == 0);
+        REQUIRE(written(&second) == text);
     }
     freeList(&first);
     freeList(&second);

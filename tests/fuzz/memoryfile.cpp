@@ -8,7 +8,8 @@
 #include "sqo/sqlpd.h"
 
 static const uint8_t* fileBytes;
-static long long fileSize, filePosition;
+static long long fileSize;
+long long filePosition;
 char lastHeader[1024];
 
 void serveFile(const uint8_t* bytes, size_t size)
@@ -40,11 +41,9 @@ int sqlowrite(SQLO_FHANDLE, const void* buffer, uint32_t count, uint32_t* bytesW
 
 int sqloseek(SQLO_FHANDLE, long long offset, unsigned int origin, long long* newOffset)
 {
-    long long base = origin == sqloFromStart     ? 0
-                     : origin == sqloFromCurrent ? filePosition
-                                                 : fileSize;
+    const long long bases[] = {0, filePosition, fileSize};
     long long position = 0;
-    if (__builtin_add_overflow(base, offset, &position) || position < 0)
+    if (__builtin_add_overflow(bases[origin], offset, &position) || position < 0)
         return static_cast<int>(sqloSystemError) | 22;
     filePosition = position;
     if (newOffset != nullptr)
@@ -58,12 +57,8 @@ static char largeBlock[defaultWorkAreaSize + 65536];
 int sqlogmblkEx(SMemPool*, size_t size, unsigned int, void** block, const char*, unsigned int,
                 unsigned int)
 {
-    if (size < defaultWorkAreaSize) {
-        *block = calloc(1, size);
-    } else {
-        REQUIRE(size <= sizeof largeBlock);
-        *block = largeBlock;
-    }
+    REQUIRE(size <= sizeof largeBlock);
+    *block = size < defaultWorkAreaSize ? calloc(1, size) : largeBlock;
     return 0;
 }
 

@@ -13,6 +13,7 @@ inline constexpr SQLO_FHANDLE memoryHandle = {3, 1};
 // read, but for the header, which is written to lastHeader.
 void serveFile(const uint8_t* bytes, size_t size);
 
+extern long long filePosition;
 extern char lastHeader[1024];
 
 // Ends the run when something does not hold.

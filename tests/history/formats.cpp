@@ -8,25 +8,24 @@
 class Formats : public HistoryTest
 {
   protected:
-    SQLUH_HANDLE* handle = nullptr;
+    SQLUH_HANDLE handle = {};
 
-    void SetUp() override
+    Formats()
     {
         spill(historyPath, newHeader());
-        ASSERT_EQ(0, sqluhHandleAllocAndInit(directory.data(), &handle));
-        handle->fileHandle = open();
-        ASSERT_EQ(0, sqloseek(handle->fileHandle, 1024, sqloFromStart, nullptr));
+        handle.fileHandle = open();
+        handle.replayArea.replayDisabled = 1;
+        sqloseek(handle.fileHandle, 1024, sqloFromStart, nullptr);
     }
-    void TearDown() override
+    ~Formats() override
     {
-        sqloclose(handle->fileHandle);
-        sqluhHandleFree(&handle);
+        sqloclose(handle.fileHandle);
     }
     // The bytes that writing this entry adds to the file.
     std::string written(SQLUH_ENTRY* entry)
     {
         size_t before = slurp(historyPath).size();
-        EXPECT_EQ(0, sqluhWriteEntry(handle, entry));
+        EXPECT_EQ(0, sqluhWriteEntry(&handle, entry));
         return slurp(historyPath).substr(before);
     }
 };
@@ -42,7 +41,7 @@ TEST_F(Formats, NewPairOfFilesByteForByteInDirectoriesUpToTheLimit)
         EXPECT_EQ(newHeader(), slurp(at + "zq3rhist.asc"));
         EXPECT_EQ(newHeader(), slurp(at + "zq3rhist.bak"));
     }
-    EXPECT_EQ("C.UTF-8", std::string(setlocale(LC_CTYPE, nullptr)));
+    EXPECT_STREQ("C.UTF-8", setlocale(LC_CTYPE, nullptr));
     setlocale(LC_CTYPE, "C");
     deep.insert(deep.size() - 1, "e");
     std::filesystem::create_directories(deep);
@@ -50,36 +49,36 @@ TEST_F(Formats, NewPairOfFilesByteForByteInDirectoriesUpToTheLimit)
     EXPECT_TRUE(std::filesystem::is_empty(deep));
 }
 
-TEST_F(Formats, EntryWithEverySectionByteForByte)
+TEST_F(Formats, PathsOfAHandleAreWhollyKeptOrRefused)
 {
-    entryBuilder b;
-    // clang-format off
-    const char* texts[] = {"20260102030405001", "20260102030500", "S0000001.LOG", "S2.LOG-and-more",
-                           "20250102030405", "SCHEMA1", "T1", "/backup/one", "note"};
-    // clang-format on
-    for (size_t i = 0; i < std::size(texts); i++)
-        *b.texts()[i] = texts[i];
-    b.command = std::string(255, 'c') + std::string(255, 'd') + "e";
-    b.tablespaces = {"CATALOGROOM", "", "TS3"};
-    b.withSqlca = true;
-    // What is shorter than its field is padded with blanks.
-    // clang-format off
-    b.ca = {{'S', 'Q', 'L', 'C', 'A', ' ', ' ', ' '}, 136, -1234, 0x1F, "tokens", "PRODUCT",
-            {}, {'W', ' ', 'x'}, {'5', '1', '0', '2', '4'}};
-    // clang-format on
-    b.ca.sqlerrd[1] = INT32_MIN;
-    b.ca.sqlerrd[5] = INT32_MAX;
-    memcpy(b.data.logPosition, "\x00\x1F\xAB\xFF\x10\x09", 6);
-    b.data.entryNode = 0xBEEF;
-    b.data.entryNumber = 0xDEADBEEF;
-    b.data.object = b.data.operationType = '\0';
-    SQLUH_ENTRY* entry = b.build();
-    b.data.noteText.length = 99; // not what decides: the entry's own length does
-    b.tablespaceBuffers[2].length = 0;
-    entry->noteLength = 0x1E;
-    entry->version = 1;
-    EXPECT_EQ(fullEntry(), written(entry));
-    EXPECT_EQ(3u, b.tablespaceBuffers[2].length);
+    SQLUH_HANDLE* other = nullptr;
+    std::string longest = std::string(1010, 'd') + "/";
+    ASSERT_EQ(0, sqluhHandleAllocAndInit(longest.data(), &other));
+    EXPECT_EQ(longest, other->directory);
+    EXPECT_EQ(longest + "zq3rhist.asc", other->historyPath);
+    EXPECT_EQ(longest + "zq3rhist.bak", other->shadowPath);
+    sqluhHandleFree(&other);
+    longest += "/";
+    EXPECT_EQ(sqluhPathTooLong, sqluhHandleAllocAndInit(longest.data(), &other));
+    EXPECT_EQ(nullptr, other);
+}
+
+TEST_F(Formats, EveryFieldIsReadAndWrittenByteForByte)
+{
+    entryReader r;
+    spill(historyPath, newHeader() + fullEntry());
+    ASSERT_EQ(0, r.read(handle.fileHandle));
+    EXPECT_EQ("B  Ax", std::string(&r.data.operation, 5));
+    EXPECT_EQ("SQLUHINF", std::string(r.data.eyecatcher, 8));
+    // What the writer completes, and what it does not look at.
+    r.data.object = r.data.operationType = '\0';
+    r.tablespaceBuffers[2].length = 0;
+    r.data.noteText.length = 99;
+    r.entry.version = 1;
+    EXPECT_EQ(fullEntry(), written(&r.entry));
+    EXPECT_EQ(3u, r.tablespaceBuffers[2].length);
+    ASSERT_EQ(0, sqluhRewind(handle.fileHandle, nullptr));
+    EXPECT_EQ(0, sqluhVerifyOneEntry(handle.fileHandle, &r.workArea)); // with names for no buffer
 }
 
 TEST_F(Formats, SectionsAndPlaceholdersByteForByte)
@@ -90,10 +89,8 @@ TEST_F(Formats, SectionsAndPlaceholdersByteForByte)
     b.data.entryNode = 42;
     b.data.entryNumber = 7;
     EXPECT_EQ(commandEntry(0), written(b.build()));
-    b.objectPart = b.secondTimestamp = " 2026"; // a leading blank counts as empty
-    b.firstText = b.lastText = b.idText = " x";
+    b.objectPart = b.secondTimestamp = b.firstText = b.lastText = b.idText = " x"; // as if empty
     EXPECT_EQ(commandEntry(0), written(b.build()));
-    b.build();
     for (textBuffer* text = &b.data.objectPart; text <= &b.data.commandText; text++)
         text->data = nullptr;
     EXPECT_EQ(commandEntry(0), written(&b.entry));
@@ -132,37 +129,20 @@ static void expectText(const std::string& source, size_t width, const textBuffer
     ASSERT_EQ(expected.substr(0, std::max(text.capacity, 1u) - 1), text.data ? text.data : "");
 }
 
-static void expectSame(entryBuilder& w, entryReader& r)
-{
-    static const size_t widths[] = {17, 14, 12, 12, 24, 900, 900, 255, 30, 900};
-    for (size_t i = 0; i < 10; i++)
-        expectText(*w.texts()[i], widths[i], *r.texts()[i]);
-    for (size_t i = 0; i < w.tablespaces.size() && i < r.tablespaceBuffers.size(); i++)
-        expectText(w.tablespaces[i], 900, r.tablespaceBuffers[i]);
-    ASSERT_EQ(0, memcmp(w.data.logPosition, r.data.logPosition, 6));
-    SQLUH_ENTRY expected = w.entry;
-    expected.noteLength = std::min(expected.noteLength, 30u);
-    expected.longTextLength = std::min(expected.longTextLength, 255u);
-    ASSERT_TRUE(sameNumbers(expected, r.entry));
-    ASSERT_EQ("SQLUHINF", std::string(r.data.eyecatcher, 8));
-    sqlca ca = w.ca;
-    if (!w.withSqlca)
-        sqloinca(&ca);
-    ASSERT_EQ(0, memcmp(&ca, &r.ca, sizeof ca));
-}
-
 TEST_F(Formats, EntriesComeBackAsTheyWereWritten)
 {
-    static const size_t lengths[] = {1, 17, 30, 31, 254, 255, 256, 257, 511, 900};
+    static const size_t lengths[] = {1, 17, 30, 31, 254, 255, 256, 257, 511, 900},
+                        widths[] = {17, 14, 12, 12, 24, 900, 900, 255, 30, 900};
     const auto text = [](size_t length, size_t seed) {
         std::string letters;
         while (letters.size() < length)
             letters += static_cast<char>('a' + (letters.size() * letters.size() + seed) % 26);
         return letters;
     };
-    std::vector<entryBuilder> entries(120);
-    for (size_t i = 0; i < entries.size(); i++) {
-        entryBuilder& b = entries[i];
+    sqlca initial;
+    sqloinca(&initial);
+    for (size_t i = 0; i < 120; i++) {
+        entryBuilder b;
         for (size_t t = 0; t < 10; t++) // every combination of the optional sections
             *b.texts()[t] = text((i >> t % 5 & 1) * lengths[(i + t) % 10], t);
         for (size_t name = 0; name < i % 9; name++)
@@ -172,61 +152,56 @@ TEST_F(Formats, EntriesComeBackAsTheyWereWritten)
         b.ca.sqlerrd[1] = i % 2 == 0 ? INT32_MIN : -12345;
         b.ca.sqlerrml = 0x1F;
         memcpy(b.ca.sqlerrmc, text(78, i).data(), 78);
-        memcpy(b.data.logPosition, text(6, i).data(), 6);
         b.data.entryNumber = static_cast<uint32_t>(i << 24);
-        ASSERT_EQ(0, sqluhWriteEntry(handle, b.build()));
-    }
-    for (uint32_t capacity : {4096u, 0u, 1u, 18u, 255u, 256u, 900u}) {
-        entryReader r(capacity, capacity / 64, capacity + 512);
-        long long at = 0;
-        uint32_t largest = r.workArea.size;
-        ASSERT_EQ(0, sqluhRewind(handle->fileHandle, &at));
-        for (entryBuilder& b : entries) {
-            int expected = b.tablespaces.size() > capacity / 64 ? 2165 : 0;
-            ASSERT_EQ(expected, r.read(handle->fileHandle));
-            ASSERT_NO_FATAL_FAILURE(expectSame(b, r));
+        const long long at = positionOf(handle.fileHandle);
+        ASSERT_EQ(0, sqluhWriteEntry(&handle, b.build()));
+        b.entry.noteLength = std::min(b.entry.noteLength, 30u);
+        b.entry.longTextLength = std::min(b.entry.longTextLength, 255u);
+        for (uint32_t capacity : {4096u, 0u, 1u, 18u, 255u, 256u, 900u}) {
+            entryReader r(capacity, capacity / 64, capacity + 512);
+            sqloseek(handle.fileHandle, at, sqloFromStart, nullptr);
+            ASSERT_EQ(i % 9 > capacity / 64 ? 2165 : 0, r.read(handle.fileHandle));
+            ASSERT_EQ(at + b.entry.size, positionOf(handle.fileHandle));
+            ASSERT_EQ(std::max(capacity + 512, b.entry.size), r.workArea.size);
             ASSERT_EQ(b.withSqlca && b.ca.sqlcode != 0 ? 0x40u : 0u, r.flags);
-            ASSERT_EQ(at += b.entry.size, positionOf(handle->fileHandle));
-            ASSERT_EQ(largest = std::max(largest, b.entry.size), r.workArea.size);
+            for (size_t t = 0; t < 10; t++)
+                ASSERT_NO_FATAL_FAILURE(expectText(*b.texts()[t], widths[t], r.texts()[t]));
+            for (size_t name = 0; name < std::min(i % 9, r.tablespaceBuffers.size()); name++)
+                ASSERT_NO_FATAL_FAILURE(
+                    expectText(b.tablespaces[name], 900, r.tablespaceBuffers[name]));
+            ASSERT_TRUE(sameNumbers(b.entry, r.entry));
+            ASSERT_EQ(0, memcmp(b.withSqlca ? &b.ca : &initial, &r.ca, sizeof initial));
         }
-        ASSERT_EQ(END_OF_FILE, r.read(handle->fileHandle));
     }
     EXPECT_EQ("", joined(takeLog()));
 }
 
 TEST_F(Formats, FiltersSetTheirBits)
 {
-    entryBuilder named, bare;
-    named.objectPart = "20260505000000003";
-    named.qualifier = "Q";
-    named.tablespaces = {"AA", "B", "CC"};
-    bare.withSqlca = true;
-    bare.ca.sqlcode = 1;
-    ASSERT_EQ(0, sqluhWriteEntry(handle, named.build()));
-    ASSERT_EQ(0, sqluhWriteEntry(handle, bare.build()));
+    spill(historyPath, newHeader() + fullEntry() + commandEntry(0));
     const struct {
-        bool second;
+        int at;
         const char *timestamp, *qualifier, *name, *tablespace;
         unsigned int flags;
     } rows[] = {
         // clang-format off
-        {false, nullptr, "Q", nullptr, nullptr, 0x01},
-        {false, nullptr, "QQ", "", nullptr, 0x02},
-        {false, nullptr, "", "T", "A", 0},
-        {false, nullptr, nullptr, nullptr, "CC", 0x04}, // behind what the caller has room for
-        {false, "20260505000001", nullptr, nullptr, nullptr, 0x08},
-        {false, "20260505000000999", nullptr, nullptr, nullptr, 0x10},
-        {false, "2026050500000", nullptr, nullptr, nullptr, 0x20},
-        {false, "2027", "Q", "", "AA", 0x0F},
-        {true, "00000101000000", "", "", "", 0x50},
-        {true, "", nullptr, nullptr, nullptr, 0x60},
+        {1024, nullptr, "SCHEMA1", nullptr, nullptr, 0x41},
+        {1024, nullptr, "SCHEMA12", "T1", nullptr, 0x42},
+        {1024, nullptr, "SCHEMA", "", "TS", 0x40},
+        {1024, nullptr, nullptr, nullptr, "TS3", 0x44}, // behind what the caller has room for
+        {1024, "20260102030406", nullptr, nullptr, nullptr, 0x48},
+        {1024, "20260102030405999", nullptr, nullptr, nullptr, 0x50},
+        {1024, "2026010203040", nullptr, nullptr, nullptr, 0x60},
+        {1024, "2027", "SCHEMA1", "T1", "CATALOGROOM", 0x4F},
+        {2811, "00000101000000", "", "", "", 0x10},
+        {2811, "", nullptr, nullptr, nullptr, 0x20},
         // clang-format on
     };
     for (const auto& row : rows) {
         entryReader r(64, 2);
-        sqloseek(handle->fileHandle, row.second ? 1024 + named.entry.size : 1024, 0, nullptr);
-        int rc = r.read(handle->fileHandle, row.timestamp, row.qualifier, row.name, row.tablespace);
-        EXPECT_EQ(row.second ? 0 : 2165, rc);
+        sqloseek(handle.fileHandle, row.at, sqloFromStart, nullptr);
+        int rc = r.read(handle.fileHandle, row.timestamp, row.qualifier, row.name, row.tablespace);
+        EXPECT_EQ(row.at == 1024 ? 2165 : 0, rc);
         EXPECT_EQ(row.flags, r.flags) << &row - rows;
     }
 }
@@ -236,22 +211,23 @@ TEST_F(Formats, RecordsThatDoNotAddUpAreNotWritten)
     const struct {
         int byteCount;
         uint32_t sqlcaLength, qualifierLength;
-        std::string actual, size, dump;
-    } rows[] = {{136, 100, 0, "962", "868", " |  [History File Entry: 868 bytes]"},
-                {136, 195, 0, "962", "963", " |  [History File Entry: 963 bytes]"},
-                {-1, 194, 0, "963", "962", " |  [History File Entry: 962 bytes]"},
-                {-1, 195, 0, "963", "963", " |  [History File Entry: 963 bytes]"},
-                {136, 0, 0xFFFFFFFE, "0", "768", ""}}; // wraps in 32 bits
+        const char *sizes, *dump;
+    } rows[] = {
+        {136, 100, 0, "962   Size field: 868", " |  [History File Entry: 868 bytes]"},
+        {-1, 194, 0, "963   Size field: 962", " |  [History File Entry: 962 bytes]"},
+        {-1, 195, 0, "963   Size field: 963", " |  [History File Entry: 963 bytes]"},
+        {136, 0, 0xFFFFFFFE, "0   Size field: 768", ""}, // wraps in 32 bits
+    };
     for (const auto& row : rows) {
         entryBuilder b;
         b.ca.sqlcabc = row.byteCount;
         b.build()->sqlcaLength = row.sqlcaLength;
         b.entry.qualifierLength = row.qualifierLength;
-        EXPECT_EQ(-2161, sqluhWriteEntry(handle, &b.entry));
-        EXPECT_EQ("Actual entry size: " + row.actual + "   Size field: " + row.size +
-                      ". rc = -2161 (0xFFFFF78F)" + row.dump,
+        EXPECT_EQ(-2161, sqluhWriteEntry(&handle, &b.entry));
+        EXPECT_EQ(std::string("Actual entry size: ") + row.sizes + ". rc = -2161 (0xFFFFF78F)" +
+                      row.dump,
                   joined(takeLog()));
         EXPECT_EQ(newHeader(), slurp(historyPath));
-        EXPECT_EQ(1024, positionOf(handle->fileHandle));
+        EXPECT_EQ(1024, positionOf(handle.fileHandle));
     }
 }

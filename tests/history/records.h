@@ -1,19 +1,7 @@
 // Records put together by hand, from the format alone.
 #pragma once
 
-#include <cstdint>
-#include <string>
-
 #include "support.h"
-
-// The checksum of the format, byte by byte.
-inline uint32_t byteSum(const std::string& bytes)
-{
-    uint32_t sum = 0;
-    for (size_t i = 0; i < bytes.size(); i++)
-        sum ^= uint32_t{static_cast<unsigned char>(bytes[i])} << 8 * (i % 4);
-    return sum;
-}
 
 inline std::string hex8(size_t value)
 {
@@ -25,8 +13,11 @@ inline std::string hex8(size_t value)
 // Puts the checksum of the whole record over its first eight characters.
 inline std::string stamped(std::string record)
 {
+    uint32_t sum = 0;
     record.replace(0, 8, "00000000");
-    return record.replace(0, 8, hex8(byteSum(record)));
+    for (size_t i = 0; i < record.size(); i++)
+        sum ^= uint32_t{static_cast<unsigned char>(record[i])} << 8 * (i % 4);
+    return record.replace(0, 8, hex8(sum));
 }
 
 inline std::string padded(std::string text, size_t width)
@@ -51,17 +42,21 @@ inline std::string entryOf(const std::string& numbers, const std::string& words,
 }
 
 // An entry whose fields are empty but for the letters and the start of an object part, with a
-// command of this length.
-inline std::string commandEntry(size_t commandLength, const std::string& part = "00000101000000")
+// command of this length and these tablespaces.
+inline std::string commandEntry(size_t commandLength, const std::string& part = "00000101000000",
+                                const std::vector<std::string>& tablespaces = {})
 {
-    std::string command;
+    std::string sections;
+    for (const std::string& name : tablespaces)
+        sections += hex8(name.size()) + ":" + name + "\n";
     for (size_t i = 1; i <= commandLength; i++)
-        command += i % 255 == 0 || i == commandLength ? "c\n" : "c";
-    return entryOf("00000000:00000000:00000000:00000000:00000000:00000000:" + hex8(commandLength),
+        sections += i % 255 == 0 || i == commandLength ? "c\n" : "c";
+    return entryOf("00000000:00000000:00000000:00000000:" + hex8(tablespaces.size()) +
+                       ":00000000:" + hex8(commandLength),
                    "B:-:-:" + padded(part, 17) +
                        ":00000101000000:-           :-           :"
                        "000000000000:-                       :-",
-                   "", command);
+                   "", sections);
 }
 
 // An entry with a section of each kind.
@@ -79,13 +74,18 @@ inline std::string fullEntry()
                    "BEEF:DEADBEEF");
 }
 
+// A header that begins with this text.
+inline std::string headerOf(const std::string& text)
+{
+    return line(text) + line("") + line("") + line("");
+}
+
 // The header of a new file.
 inline std::string newHeader()
 {
-    return line("31997D7D:0000000000000000:0000000000000000:0000000000000000:00000000:00000000:"
-                "00000000:00000000:00000000:00000000:00000000:00000000: :09010300:00000001:"
-                "00000101000000:00000000:") +
-           line("") + line("") + line("");
+    return headerOf("31997D7D:0000000000000000:0000000000000000:0000000000000000:00000000:00000000:"
+                    "00000000:00000000:00000000:00000000:00000000:00000000: :09010300:00000001:"
+                    "00000101000000:00000000:");
 }
 
 // Log records as one text.

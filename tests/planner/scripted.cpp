@@ -3,16 +3,17 @@
 //
 //   <operation><object><type><status> <timestamp[sequence]> [name...] [=id] [!sqlcode] ["command]
 //
-// where the sequence number is 001 when it is left out. Other lines:
+// where the sequence number is 001 when it is left out. Other lines, gets being counted from 0:
 //
-//   @open|@close RESULT SQLCODE    outcome of the call
-//   @get N RESULT SQLCODE          outcome of the N-th get, counted from 0
-//   @max N                         maxTablespaces, whatever the entries list
+//   @open|@close|@get<N> RESULT SQLCODE    outcome of a call
+//   @max N                                 maxTablespaces, whatever the entries list
 //
 // Whatever the caller does against the rules of the interface comes out on standard error.
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <map>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -21,17 +22,10 @@
 
 namespace
 {
-struct Entry {
-    std::string letters, objectPart, id, command;
-    int sqlcode = 0;
-    std::vector<std::string> names;
-};
-
 struct Script {
-    std::vector<Entry> entries;
-    int openResult = 0, openCode = 0, closeCode = 0, closeResult = 0;
-    int failingGet = -1, getResult = 0, getCode = 0;
-    size_t maxTablespaces = 0, next = 0;
+    std::vector<std::string> entries;
+    std::map<std::string, std::pair<int, int>> outcomes; // by call: result and SQLCODE
+    size_t maxTablespaces = 0, numGets = 0;
     bool isOpen = false;
 };
 Script script;
@@ -42,50 +36,24 @@ void broken(bool isBroken, const char* rule)
         fprintf(stderr, "scan interface misused: %s\n", rule);
 }
 
-Entry parseEntry(std::istringstream& line, const std::string& letters)
+void readScript(const char* source)
 {
-    Entry entry;
-    entry.letters = letters;
-    line >> entry.objectPart;
-    if (entry.objectPart.size() == 14)
-        entry.objectPart += "001";
-    for (std::string word; line >> std::ws && line.peek() != '"' && line >> word;) {
-        if (word[0] == '=')
-            entry.id = word.substr(1);
-        else if (word[0] == '!')
-            entry.sqlcode = atoi(word.c_str() + 1);
-        else
-            entry.names.push_back(word);
-    }
-    line.get();
-    getline(line, entry.command);
-    return entry;
-}
-
-Script parseScript(const char* source)
-{
-    Script parsed;
-    size_t largest = 0, maxGiven = SIZE_MAX;
+    script = {};
     std::istringstream lines(source);
-    for (std::string text; getline(lines, text);) {
-        std::istringstream line(text);
-        std::string word;
-        line >> word;
-        if (word == "@open")
-            line >> parsed.openResult >> parsed.openCode;
-        else if (word == "@close")
-            line >> parsed.closeResult >> parsed.closeCode;
-        else if (word == "@get")
-            line >> parsed.failingGet >> parsed.getResult >> parsed.getCode;
-        else if (word == "@max")
-            line >> maxGiven;
-        else
-            parsed.entries.push_back(parseEntry(line, word));
+    for (std::string line; getline(lines, line);) {
+        if (line[0] == '@') {
+            std::istringstream words(line);
+            std::string call;
+            words >> call >> script.outcomes[call].first >> script.outcomes[call].second;
+        } else {
+            long blanks = std::count(line.begin(), line.end(), ' '); // one more than names, or more
+            script.maxTablespaces =
+                std::max(script.maxTablespaces, static_cast<size_t>(blanks - 1));
+            script.entries.push_back(line);
+        }
     }
-    for (const Entry& entry : parsed.entries)
-        largest = std::max(largest, entry.names.size());
-    parsed.maxTablespaces = maxGiven != SIZE_MAX ? maxGiven : largest;
-    return parsed;
+    if (script.outcomes.contains("@max"))
+        script.maxTablespaces = static_cast<size_t>(script.outcomes["@max"].first);
 }
 
 // Overwrites the whole buffer first: nobody may rely on what stands behind a terminator.
@@ -96,24 +64,39 @@ void deliver(const textBuffer& buffer, uint32_t capacity, const std::string& tex
     snprintf(buffer.data, capacity, "%s", text.c_str());
 }
 
-void deliverEntry(const Entry& entry, zq3HistoryData* record)
+void deliverEntry(const std::string& line, zq3HistoryData* record)
 {
     static const uint32_t capacities[] = {18, 15, 13, 13, 25, 31, 129, 256, 31, 2097152};
+    size_t quote = std::min(line.find('"'), line.size());
+    std::istringstream words(line.substr(0, quote));
+    std::string letters, objectPart;
+    words >> letters >> objectPart;
     for (size_t i = 0; i < std::size(capacities); i++)
         deliver((&record->objectPart)[i], capacities[i], "unread");
-    deliver(record->objectPart, 18, entry.objectPart);
-    deliver(record->idText, 25, entry.id);
-    deliver(record->commandText, 2097152, entry.command);
+    deliver(record->objectPart, 18, objectPart + (objectPart.size() == 14 ? "001" : ""));
+    deliver(record->commandText, 2097152, line.substr(std::min(quote + 1, line.size())));
     record->commandText.data[2097152] = '\0'; // one byte more is the caller's
-    record->eventSqlca->sqlcode = entry.sqlcode;
     broken(record->maxTablespaces != script.maxTablespaces, "room for names");
-    record->numTablespaces = static_cast<uint32_t>(entry.names.size());
-    for (uint32_t i = 0; i < record->numTablespaces && i < record->maxTablespaces; i++)
-        deliver(record->tablespaceBuffers[i], 19, entry.names[i]);
-    record->operation = entry.letters[0];
-    record->object = entry.letters[1];
-    record->operationType = entry.letters[2];
-    record->status = entry.letters[3];
+    record->eventSqlca->sqlcode = 0;
+    record->numTablespaces = 0;
+    for (std::string word; words >> word;) {
+        if (word[0] == '=')
+            deliver(record->idText, 25, word.substr(1));
+        else if (word[0] == '!')
+            record->eventSqlca->sqlcode = atoi(word.c_str() + 1);
+        else if (record->numTablespaces++ < record->maxTablespaces)
+            deliver(record->tablespaceBuffers[record->numTablespaces - 1], 19, word);
+    }
+    record->operation = letters[0];
+    record->object = letters[1];
+    record->operationType = letters[2];
+    record->status = letters[3];
+}
+
+int end(const std::string& call, sqlca* ca)
+{
+    ca->sqlcode = script.outcomes[call].second;
+    return script.outcomes[call].first;
 }
 
 __attribute__((destructor)) void checkClosed()
@@ -122,34 +105,26 @@ __attribute__((destructor)) void checkClosed()
 }
 } // namespace
 
-extern "C" int zq3HistoryOpenScan(unsigned int version, void* openStruct, sqlca* ca)
+extern "C" int zq3HistoryOpenScan(unsigned int, void* openStruct, sqlca* ca)
 {
     auto scan = static_cast<zq3HistoryOpenStruct*>(openStruct);
-    broken(version != 6010000 || scan->callerAction || scan->timestamp || scan->objectName, "open");
-    script = parseScript(getenv("ZQ3SCRIPT"));
+    readScript(getenv("ZQ3SCRIPT"));
     script.isOpen = true; // to be closed even when the open fails
     scan->numRows = static_cast<uint32_t>(script.entries.size());
     scan->maxTablespaces = static_cast<uint32_t>(script.maxTablespaces);
-    scan->handle = 4711;
-    ca->sqlcode = script.openCode;
-    return script.openResult;
+    return end("@open", ca);
 }
 
-extern "C" int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca* ca)
+extern "C" int zq3HistoryGetEntry(unsigned int, void* fetchStruct, sqlca* ca)
 {
     auto fetch = static_cast<zq3HistoryFetchStruct*>(fetchStruct);
-    broken(version != 6010000 || fetch->callerAction != 2 || fetch->handle != 4711, "get");
-    broken(script.next >= script.entries.size() || script.maxTablespaces == 0, "too many gets");
-    bool fails = script.failingGet == static_cast<int>(script.next);
-    ca->sqlcode = fails ? script.getCode : 0;
-    deliverEntry(script.entries[script.next++], fetch->historyRecord);
-    return fails ? script.getResult : 0;
+    broken(script.numGets >= script.entries.size() || script.maxTablespaces == 0, "too many gets");
+    deliverEntry(script.entries[script.numGets], fetch->historyRecord);
+    return end("@get" + std::to_string(script.numGets++), ca);
 }
 
-extern "C" int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca)
+extern "C" int zq3HistoryCloseScan(unsigned int, void*, sqlca* ca)
 {
-    broken(version != 6010000 || *static_cast<uint16_t*>(handle) != 4711, "close");
-    ca->sqlcode = script.closeCode;
     script.isOpen = false;
-    return script.closeResult;
+    return end("@close", ca);
 }

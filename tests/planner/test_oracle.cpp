@@ -1,5 +1,6 @@
 // The stages against a slow planner written for this test: one walk for each tablespace, renames
 // one by one, over random histories of few names and few days.
+#include <algorithm>
 #include <cstdlib>
 #include <cstring>
 #include <random>
@@ -38,11 +39,12 @@ History randomHistory(std::mt19937& random, const std::string& target)
     static const char operations[] = "BBBBBBRRANNN", types[] = "FDDIIEO";
     auto pick = [&](size_t count) { return random() % count; };
     size_t poolSize = 3 + pick(4), length = 2 + pick(14);
-    bool unique = pick(3) != 0;
+    bool unique = pick(3) != 0, wide = pick(30) == 0;
 
-    History history;
+    History history(length);
     for (size_t i = 0; i < length; i++) {
-        Event event = {operations[pick(12)], types[pick(7)], day(1 + i + pick(2)), "", {}};
+        Event& event = history[i];
+        event = {operations[pick(12)], types[pick(7)], day(1 + i + pick(2)), "", {}};
         if (event.operation == 'R')
             event.id = day(1 + pick(length));
         size_t numNames = event.operation == 'N' ? 1 + pick(7) / 2 : pick(poolSize + 1);
@@ -51,20 +53,22 @@ History randomHistory(std::mt19937& random, const std::string& target)
             if (!unique || !lists(event.names, name))
                 event.names.push_back(name);
         }
-        history.push_back(event);
     }
     history[length - 1 - pick(2)] = {'B', types[pick(7)], target, "", {"A", "C", "B"}};
+    for (Event& event : history) // more columns than are scanned side by side
+        for (size_t i = 10; i < 80 && wide && event.operation == 'B'; i++)
+            event.names.push_back("TABLESPACE_OF_18" + std::to_string(i));
     return history;
 }
 
 std::string asScript(const History& history)
 {
-    std::string text = "@max 9";
+    std::string text;
     for (const Event& event : history) {
-        text += std::string("\n") + event.operation + "D" + event.type + "A " + event.timestamp;
+        text += std::string() + event.operation + "D" + event.type + "A " + event.timestamp;
         for (const std::string& name : event.names)
             text += " " + name;
-        text += event.id.empty() ? "" : " =" + event.id;
+        text += (event.id.empty() ? "" : " =" + event.id) + "\n";
     }
     return text;
 }
@@ -80,12 +84,14 @@ void replaceFirst(Names& names, const std::string& from, const std::string& to)
 
 void renameSlowly(History& history, size_t target)
 {
-    size_t first = 0, oldest = 0;
-    while (first < target && history[first].operation != 'N')
-        first++;
-    while (history[oldest].operation != 'B')
-        oldest++;
-    if (first == target || history[first].timestamp < history[oldest].timestamp)
+    auto firstOf = [&](char operation) {
+        size_t at = 0;
+        while (at < target && history[at].operation != operation)
+            at++;
+        return at;
+    };
+    size_t first = firstOf('N');
+    if (history[first].timestamp < history[firstOf('B')].timestamp)
         return;
     for (size_t i = first; i < target; i++) {
         if (history[i].operation != 'N' || history[i].names.size() < 2)
@@ -101,28 +107,23 @@ void renameSlowly(History& history, size_t target)
 // The cells of one tablespace, the target's first; false when a restored image is missing.
 bool walkBack(const History& history, size_t target, const std::string& name, std::string& cells)
 {
-    bool tracking = true, done = false;
-    std::string awaited;
+    bool done = false;
+    std::string awaited; // timestamp of the image that a restore used; empty: any image counts
     for (size_t i = target + 1; i-- > 0;) {
         const Event& event = history[i];
-        if (event.operation == 'B')
-            cells += 'X';
+        bool isImage = event.operation == 'B';
+        cells += isImage ? "X" : "";
         if (done || !lists(event.names, name))
             continue;
-        if (event.operation == 'B') {
-            if (!tracking && awaited > event.timestamp)
-                return false;
-            if (!tracking && awaited < event.timestamp)
-                continue;
-            tracking = true;
+        if (isImage && awaited > event.timestamp)
+            return false;
+        if (isImage && (awaited.empty() || awaited == event.timestamp)) {
+            awaited.clear();
             cells.back() = strchr("IO", event.type) ? 'I' : strchr("DE", event.type) ? 'D' : 'F';
-            done = cells.back() == 'F';
-        } else if (event.operation == 'R' && tracking) {
-            tracking = false;
-            awaited = event.id;
-        } else if (event.operation == 'A' && tracking) {
-            done = true;
         }
+        done = awaited.empty() && (event.operation == 'A' || cells.back() == 'F');
+        if (awaited.empty() && event.operation == 'R')
+            awaited = event.id;
     }
     return true;
 }
@@ -130,19 +131,12 @@ bool walkBack(const History& history, size_t target, const std::string& name, st
 // Keeps what the target needs; false when no full image starts the chain.
 bool prune(std::string& cells)
 {
-    char wanted = cells[0]; // kind of the needed image met last
-    bool drop = false;
-    for (size_t i = 1; i < cells.size(); i++) {
-        char cell = cells[i];
-        bool starts = cell == 'F' || (cell == 'I' && wanted == 'D');
-        if (wanted == 'F')
-            drop = true;
-        else if (wanted == 'I' || starts)
-            drop = wanted == 'I' && cell != 'F';
-        if (wanted != 'F' && starts)
+    char wanted = 'D'; // the needed image met last; a delta needs whatever is older
+    for (char& cell : cells) {
+        if (wanted == 'F' || (wanted == 'I' && cell != 'F'))
+            cell = 'X';
+        else if (cell == 'F' || cell == 'I')
             wanted = cell;
-        if (drop)
-            cells[i] = 'X';
     }
     return wanted == 'F';
 }
@@ -164,34 +158,31 @@ std::string planSlowly(History history, const std::string& timestamp)
         target++;
     renameSlowly(history, target);
 
-    std::string result;
+    std::string result, filled, pruned, failure;
     for (const Event& event : history)
         result += listed(event.names);
-    Names columns, cells;
-    for (const std::string& name : history[target].names)
-        if (!lists(columns, name))
-            columns.push_back(name);
-    for (const std::string& name : columns) {
-        cells.emplace_back();
-        if (!walkBack(history, target, name, cells.back()))
-            return result + "missing image of " + name + "\n";
+    Names columns;
+    for (const std::string& name : history[target].names) {
+        if (lists(columns, name))
+            continue;
+        columns.push_back(name);
+        std::string cells;
+        if (!walkBack(history, target, name, cells))
+            return result + "missing: " + name;
+        filled += cells + "\n";
+        if (!prune(cells) && failure.empty())
+            failure = "missing: " + name;
+        pruned += cells + "\n";
     }
-    for (const std::string& column : cells)
-        result += column + "\n";
-    for (size_t i = 0; i < cells.size(); i++) {
-        if (!prune(cells[i]))
-            return result + "missing full image of " + columns[i] + "\n";
-        result += cells[i] + "\n";
-    }
-    return result;
+    return result + filled + pruned + failure;
 }
 
 // --- The product's stages, in the same words ---
 
-std::string columnsOf(const restorePlan& plan, int count)
+std::string columnsOf(const restorePlan& plan)
 {
     std::string text;
-    for (int column = 0; column < count; column++) {
+    for (int column = 0; column < plan.numTablespaces; column++) {
         for (int row = plan.numBackups - 1; row >= 0; row--)
             text += plan.matrix[row * plan.numTablespaces + column];
         text += "\n";
@@ -199,13 +190,12 @@ std::string columnsOf(const restorePlan& plan, int count)
     return text;
 }
 
-std::string planByStages(const std::string& timestamp, bool withIndexes)
+std::string planByStages(std::string timestamp, bool withIndexes)
 {
     restorePlan plan = {};
     plan.histData.backupIndex = plan.histData.renameIndex = -1;
     char alias[] = "sample";
-    EXPECT_EQ(0, fetchHistoryEntries(alias, std::string(timestamp).data(), &plan.histData,
-                                     &plan.numBackups));
+    EXPECT_EQ(0, fetchHistoryEntries(alias, timestamp.data(), &plan.histData, &plan.numBackups));
     EXPECT_EQ(listBackupImages(&plan), 0);
 
     failCallocs = !withIndexes;
@@ -220,15 +210,13 @@ std::string planByStages(const std::string& timestamp, bool withIndexes)
     EXPECT_EQ(allocateTimelineMatrix(&plan), 0);
     int failed =
         fillColumns(plan.matrix, &plan.histData, plan.list, plan.numTablespaces, plan.numBackups);
-    if (failed >= 0) {
-        result += "missing image of " + std::string(plan.list[failed].name) + "\n";
-    } else {
-        result += columnsOf(plan, plan.numTablespaces);
+    if (failed < 0) {
+        result += columnsOf(plan);
         failed = scanColumns(plan.matrix, plan.numTablespaces, plan.numBackups);
-        result += columnsOf(plan, failed < 0 ? plan.numTablespaces : failed);
-        if (failed >= 0)
-            result += "missing full image of " + std::string(plan.list[failed].name) + "\n";
+        result += columnsOf(plan);
     }
+    if (failed >= 0)
+        result += std::string("missing: ") + plan.list[failed].name;
     failCallocs = false;
     freePlan(&plan);
     return result;
@@ -238,18 +226,15 @@ std::string planByStages(const std::string& timestamp, bool withIndexes)
 TEST(Oracle, StagesAgreeWithTheSlowPlanner)
 {
     std::mt19937 random(20240104);
-    int plans = 0, noImage = 0, noFull = 0;
+    int plans = 0;
     for (int run = 0; run < 3000; run++) {
         std::string timestamp = day(2 + random() % 16);
         History history = randomHistory(random, timestamp);
-        std::string script = asScript(history);
+        std::string script = asScript(history), expected = planSlowly(history, timestamp);
         setenv("ZQ3SCRIPT", script.c_str(), 1);
-        std::string expected = planSlowly(history, timestamp);
         ASSERT_EQ(planByStages(timestamp, true), expected) << script;
         ASSERT_EQ(planByStages(timestamp, false), expected) << script;
-        noImage += expected.find("missing image") != std::string::npos;
-        noFull += expected.find("missing full") != std::string::npos;
         plans += expected.find("missing") == std::string::npos;
     }
-    EXPECT_GT(std::min({plans, noImage, noFull}), 200); // the histories reach every outcome
+    EXPECT_GT(std::min(plans, 3000 - plans), 500); // the histories reach both outcomes
 }
