@@ -110,11 +110,13 @@ int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned
     return rc;
 }
 
-// What someone who came between the creation of the new file and its lock has put into it goes.
+// What someone who came between the creation of the new file and its lock has put there goes. He
+// may have moved the file itself aside, so the path tells, not the handle.
 static int emptyFile(SQLUH_HANDLE* handle)
 {
-    long long size = 0;
-    int rc = sqloseek(handle->fileHandle, 0, sqloFromEnd, &size);
+    char name[] = SQLUH_HISTORY_NAME;
+    unsigned long long size = 0;
+    int rc = sqluh_history_file_get_size(handle->directory, name, &size);
     if (rc != 0 || size == 0)
         return rc;
     rc = sqloclose(handle->fileHandle);

@@ -3,9 +3,20 @@
 
 #include <atomic>
 #include <csignal>
+#include <dlfcn.h>
 #include <random>
 #include <sys/mman.h>
 #include <sys/wait.h>
+#include <utility>
+
+// Of one path in some thousands of millions the system makes this key, which nobody shares.
+static bool keyIsPrivate;
+
+extern "C" key_t ftok(const char* path, int project) noexcept
+{
+    static const auto real = reinterpret_cast<decltype(&ftok)>(dlsym(RTLD_NEXT, "ftok"));
+    return keyIsPrivate ? IPC_PRIVATE : real(path, project);
+}
 
 class ProcessTest : public DirectoryTest
 {
@@ -95,6 +106,9 @@ TEST_F(LockTest, EveryErrorOfEveryCallEndsAsItShould)
     EXPECT_EQ(0, sqloNLCKInit(historyPath.c_str(), &lock, 0));
     EXPECT_EQ(ftok(historyPath.c_str(), 'n'), lock.key);
     EXPECT_EQ(sqloNLCKKeyFailure, sqloNLCKInit(shadowPath.c_str(), &lock, 0));
+    keyIsPrivate = true;
+    EXPECT_EQ(sqloNLCKKeyFailure, sqloNLCKInit(historyPath.c_str(), &lock, 0));
+    keyIsPrivate = false;
 }
 
 TEST_F(LockTest, ForeignSetsAreLeftAlone)
@@ -257,4 +271,28 @@ TEST_F(ProcessTest, NobodyGetsInWhileTheHolderOfANewFileWorks)
         EXPECT_EQ(4u, writers().size());
         EXPECT_EQ(0, removeSetsLeft());
     }
+}
+
+// Between the creation of the new file and its lock another process may find nothing but damage,
+// and move the new file aside.
+TEST_F(ProcessTest, ARestoreDoesNotFollowAFileThatWasMovedAside)
+{
+    SQLUH_HANDLE* handle = nullptr;
+    store(filesOf(" 10/ 10"));
+    ASSERT_EQ(0, sqluhOpen(&handle, directory.data(), SQLUH_OPEN_UPDATE));
+    spill(shadowPath, "junk");
+    bool entered = false;
+    onCall = [&](const std::string& call, int) {
+        if (call == "semget" && !std::exchange(entered, true)) {
+            EXPECT_EQ(0, waitFor(inChild([&] { return openAndClose() != 2160; })));
+        }
+        return 0;
+    };
+    EXPECT_EQ(0, restore(handle, samples.at(2)));
+    EXPECT_TRUE(entered);
+    onCall = nullptr;
+    EXPECT_EQ(0, sqluhClose(&handle));
+    EXPECT_EQ(samples.at(2), slurp(historyPath));
+    EXPECT_EQ(samples.at(2), slurp(shadowPath));
+    EXPECT_EQ(0, removeSetsLeft());
 }
