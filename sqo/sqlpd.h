@@ -26,8 +26,8 @@ enum : int { pdAdminReadFailed = 8500, pdAdminDiskFull = 8501 };
 
 extern "C" {
 
-// Appends one record: severity, function, then the items in order. A code is shown in decimal and
-// as 32-bit hexadecimal.
+// Appends one record: severity, function, then the items in order, dumps last. A code is shown in
+// decimal and as 32-bit hexadecimal.
 void pdLog(const char* function, int level, const pdItem* items, unsigned int numItems);
 
 // Appends one record with a formatted text.
