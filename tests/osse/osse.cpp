@@ -99,9 +99,10 @@ TEST_F(osse, ReadAheadIsInvisible)
             model.replace(at, bytes.size(), bytes);
             at += bytes.size();
         } else {
-            const size_t from[] = {0, at, model.size()};
+            const long long from[] = {0, static_cast<long long>(at),
+                                      static_cast<long long>(model.size())};
             at = kind < 14 ? random() % (model.size() + 2000) : at / 4096 * 4096;
-            const long long offset = static_cast<long long>(at - from[origin]);
+            const long long offset = static_cast<long long>(at) - from[origin];
             ASSERT_EQ(sqloseek(fh, offset, static_cast<unsigned int>(origin), nullptr), 0);
         }
     }

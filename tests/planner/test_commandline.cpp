@@ -181,7 +181,8 @@ TEST(Fetch, EachAllocationFailingInTurn)
         Case row = {TARGET "-r tablespace -n new", history, plan};
         if (!site.empty())
             row = {row.arguments, history, site == "892" ? begun : "", NO_MEMORY + site + "\n\n", 250};
-        row.program = "ZQ3FAILAT=" + std::to_string(++request) + " " ZQ3CKRST_FAILING;
+        row.program = "ZQ3FAILAT=";
+        row.program += std::to_string(++request) + " " ZQ3CKRST_FAILING;
         runCases({row});
     }
 }
