@@ -12,6 +12,7 @@
 #include <strings.h>
 
 #include "admin/fields.h"
+#include "history/sqluhcol.h"
 
 // Fields are numbered: those of the three tables, then the others.
 enum : unsigned int {
@@ -83,14 +84,6 @@ static int wrongValue(stanzaReader* reader, const char* expected)
 
 // --- Values --------------------------------------------------------------------------------------
 
-static int hexDigit(char c)
-{
-    if (c >= '0' && c <= '9')
-        return c - '0';
-    c = static_cast<char>(c | 0x20);
-    return c >= 'a' && c <= 'f' ? c - 'a' + 10 : -1;
-}
-
 // Takes the escape at *at, behind its backslash. False when there is no such escape.
 static bool takeEscape(const char** at, const char* end, char* c)
 {
@@ -98,9 +91,10 @@ static bool takeEscape(const char** at, const char* end, char* c)
         return false;
     char letter = *(*at)++;
     if (letter == 'x') {
-        if (end - *at < 2 || hexDigit((*at)[0]) < 0 || hexDigit((*at)[1]) < 0)
+        uint32_t byte = 0;
+        if (end - *at < 2 || !hexDigitsAt(*at, 2, &byte))
             return false;
-        *c = static_cast<char>(hexDigit((*at)[0]) << 4 | hexDigit((*at)[1]));
+        *c = static_cast<char>(byte);
         *at += 2;
         return true;
     }
@@ -297,10 +291,10 @@ static int takeLogPosition(stanzaReader* reader)
 {
     uint8_t* position = reader->record->data.logPosition;
     bool valid = reader->valueLength == entryFields[fieldLogPosition].width;
-    for (size_t i = 0; valid && i < reader->valueLength; i++) {
-        int digit = hexDigit(reader->value[i]);
-        valid = digit >= 0;
-        position[i / 2] = static_cast<uint8_t>(position[i / 2] << 4 | (digit & 0x0F));
+    for (size_t i = 0; valid && i < reader->valueLength; i += 2) {
+        uint32_t byte = 0;
+        valid = hexDigitsAt(reader->value + i, 2, &byte);
+        position[i / 2] = static_cast<uint8_t>(byte);
     }
     return valid ? 0 : wrongValue(reader, "12 hexadecimal digits");
 }

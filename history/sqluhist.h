@@ -489,8 +489,8 @@ int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned
 
 // Writes a piece of a backup image, length bytes for offset, over the open history file; the piece
 // at offset 0 comes first and replaces the file. Whatever comes back, sqluhClose then copies the
-// history file over the shadow. Returns 0; the code of the failing close, delete, open, seek or
-// write, unmapped; a short write's transfer code; a lock code, of the new file's lock.
+// history file over the shadow. Returns 0; the code of the failing close, delete, open, file query,
+// seek or write, unmapped; a short write's transfer code; a lock code, of the new file's lock.
 int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned char* buffer,
                                unsigned int length);
 

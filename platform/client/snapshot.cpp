@@ -58,9 +58,7 @@ static bool takeCounts(const char* line, uint32_t* size, uint32_t* numTablespace
     for (unsigned int field : numbers)
         if (!hexColumns(line + entryFields[field].at, &ignored))
             return false;
-    char node[9] = "0000";
-    memcpy(node + 4, line + entryFields[fieldNode].at, entryFields[fieldNode].width);
-    return hexColumns(node, &ignored);
+    return hexDigitsAt(line + entryFields[fieldNode].at, entryFields[fieldNode].width, &ignored);
 }
 
 // A count that the entry's own size cannot hold belongs to a damaged entry, which no get will
