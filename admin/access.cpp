@@ -8,24 +8,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-int takeArguments(int argc, char** argv, const char* form, int least, int most, bool* json)
-{
-    int kept = 1;
-    for (int i = 1; i < argc; i++) {
-        if (json != nullptr && strcmp(argv[i], "--json") == 0)
-            *json = true;
-        else if (argv[i][0] == '-' && argv[i][1] != '\0')
-            return failUsage("%s: unknown option %s", argv[0], argv[i]);
-        else
-            argv[kept++] = argv[i];
-    }
-    for (int i = kept; i < argc; i++)
-        argv[i] = nullptr;
-    if (kept - 1 < least || (most >= 0 && kept - 1 > most))
-        return failUsage("usage: zq3hist %s %s", argv[0], form);
-    return 0;
-}
-
 int takePlace(const char* argument, historyPlace* place)
 {
     struct stat status;

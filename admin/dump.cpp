@@ -36,25 +36,19 @@ static int copyOut(FILE* spool)
     return ferror(spool) ? fail("temporary file", "cannot read what was dumped") : 0;
 }
 
-int dumpMain(int argc, char** argv)
+int dumpMain(commandLine* line)
 {
-    historyPlace place = {};
+    historyPlace* place = &line->place;
     SQLUH_HANDLE* handle = nullptr;
-    bool json = false;
-    int rc = takeArguments(argc, argv, "[--json] DIR", 1, 1, &json);
-    if (rc != 0)
-        return rc;
     // Printed only once the lock is free again: whoever reads the output may take as long as it
     // likes.
     FILE* spool = tmpfile();
     if (spool == nullptr)
         return failWithCode(sqloSystemError | errno, "make a temporary file", "dump");
-    rc = takePlace(argv[1], &place);
-    if (rc == 0)
-        rc = openHistory(&place, SQLUH_OPEN_READ, &handle);
+    int rc = openHistory(place, SQLUH_OPEN_READ, &handle);
     if (rc == 0) {
-        rc = writeEntries(&place, handle, json, spool);
-        int closed = closeHistory(&place, &handle, "close the history");
+        rc = writeEntries(place, handle, line->json, spool);
+        int closed = closeHistory(place, &handle, "close the history");
         if (fflush(spool) != 0 || ferror(spool))
             closed = failWithCode(sqloSystemError | errno, "write a temporary file", "dump");
         int copied = copyOut(spool);

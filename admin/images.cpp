@@ -69,25 +69,18 @@ static void showJsonImage(const historyEntry* image, const imagePlan* plan)
     puts("}");
 }
 
-int imagesMain(int argc, char** argv)
+int imagesMain(commandLine* line)
 {
-    historyPlace place = {};
     imageCatalog catalog = {};
     const planScope scope = {nullptr, 0, false};
-    bool json = false;
-    int rc = takeArguments(argc, argv, "[--json] DIR", 1, 1, &json);
-    if (rc == 0)
-        rc = takePlace(argv[1], &place);
-    if (rc != 0)
-        return rc;
-    rc = readCatalog(&place, &catalog);
+    int rc = readCatalog(&line->place, &catalog);
     for (int i = 0; rc == 0 && i < catalog.history.numEntries; i++) {
         const historyEntry* image = &catalog.history.entries[i];
         imagePlan plan = {};
         if (!isImage(image))
             continue;
         rc = planImage(&catalog, i, &scope, &plan);
-        if (rc == 0 && json)
+        if (rc == 0 && line->json)
             showJsonImage(image, &plan);
         else if (rc == 0)
             showImage(image, &plan);

@@ -143,24 +143,19 @@ static int checkUsable(historyPlace* place)
                : 0;
 }
 
-int loadMain(int argc, char** argv)
+int loadMain(commandLine* line)
 {
-    historyPlace place = {};
+    historyPlace* place = &line->place;
     historyList list = {};
-    int rc = takeArguments(argc, argv, "DIR [FILE]", 1, 2, nullptr);
-    if (rc != 0)
-        return rc;
-    rc = takePlace(argv[1], &place);
+    int rc = parseInput(line->arguments[0], &list);
     if (rc == 0)
-        rc = parseInput(argv[2], &list);
+        rc = createIfMissing(place);
     if (rc == 0)
-        rc = createIfMissing(&place);
+        rc = awaitLock(place, R_OK | W_OK);
     if (rc == 0)
-        rc = awaitLock(&place, R_OK | W_OK);
+        rc = checkUsable(place);
     if (rc == 0)
-        rc = checkUsable(&place);
-    if (rc == 0)
-        rc = runBatch(&place, &list);
+        rc = runBatch(place, &list);
     releaseSignals();
     if (rc == 0)
         printf("%zu entries appended\n", list.count);

@@ -5,8 +5,8 @@
 
 #include "admin/stanza.h"
 
-// The next row, behind the one given as after, to which some tablespace goes straight from row; -1:
-// there is none.
+// The next row, later than the one given as after, to which some tablespace goes straight from row;
+// -1: there is none.
 static int nextNeeder(const imagePlan* plan, int row, int after)
 {
     int next = -1;
@@ -121,38 +121,29 @@ static int failIncomplete(const imagePlan* plan, const char* timestamp)
     return exitFailed;
 }
 
-int planMain(int argc, char** argv)
+int planMain(commandLine* line)
 {
-    historyPlace place = {};
     imageCatalog catalog = {};
     imagePlan plan = {};
-    bool json = false;
-    int rc = takeArguments(argc, argv, "[--json] DIR TIMESTAMP [NAME...]", 2, -1, &json);
-    if (rc == 0)
-        rc = takePlace(argv[1], &place);
-    if (rc != 0)
-        return rc;
-    planScope scope = {argv + 3, 0, true};
-    while (3 + scope.numNames < argc && argv[3 + scope.numNames] != nullptr)
-        scope.numNames++;
-
-    rc = readCatalog(&place, &catalog);
+    const char* timestamp = line->arguments[0];
+    const planScope scope = {line->arguments + 1, line->numArguments - 1, true};
+    int rc = readCatalog(&line->place, &catalog);
     int target = 0;
     while (target < catalog.history.numEntries &&
            (!isImage(&catalog.history.entries[target]) ||
-            strcmp(catalog.history.entries[target].timestamp, argv[2]) != 0))
+            strcmp(catalog.history.entries[target].timestamp, timestamp) != 0))
         target++;
     if (rc == 0 && target == catalog.history.numEntries) {
-        rc = fail(place.directory, "no image has the timestamp %s", argv[2]);
-        hint(&place, "zq3hist images DIR lists all");
+        rc = fail(line->place.directory, "no image has the timestamp %s", timestamp);
+        hint(&line->place, "zq3hist images DIR lists all");
     }
     if (rc == 0)
         rc = planImage(&catalog, target, &scope, &plan);
     // A plan with a hole is no plan; scripts are told of the hole by the object's members.
-    if (rc == 0 && (json || plan.numIncomplete == 0))
-        showPlan(&plan, argv[2], json);
+    if (rc == 0 && (line->json || plan.numIncomplete == 0))
+        showPlan(&plan, timestamp, line->json);
     if (rc == 0 && plan.numIncomplete != 0)
-        rc = failIncomplete(&plan, argv[2]);
+        rc = failIncomplete(&plan, timestamp);
     freeImagePlan(&plan);
     freeCatalog(&catalog);
     return rc;

@@ -13,37 +13,33 @@ static const char* repairedWords(repairKind done)
                  " and " SQLUH_SAVED_SHADOW_NAME ", and an empty history was made.";
 }
 
-int repairMain(int argc, char** argv)
+int repairMain(commandLine* line)
 {
-    historyPlace place = {};
-    int rc = takeArguments(argc, argv, "DIR", 1, 1, nullptr);
-    if (rc == 0)
-        rc = takePlace(argv[1], &place);
-    if (rc == 0)
-        rc = awaitLock(&place, R_OK | W_OK);
+    historyPlace* place = &line->place;
+    int rc = awaitLock(place, R_OK | W_OK);
     if (rc != 0)
         return rc;
 
     // An open does one repair; after one of the history the shadow's mark takes another.
-    repairKind due = repairDueIn(&place);
+    repairKind due = repairDueIn(place);
     if (due == repairNothing)
         puts("Nothing to repair: both files can be used and are in step.");
     bool lost = false;
     for (int round = 0; rc == 0 && due != repairNothing && round < 3; round++) {
         SQLUH_HANDLE* handle = nullptr;
-        rc = sqluhOpen(&handle, place.directory, SQLUH_OPEN_UPDATE);
+        rc = sqluhOpen(&handle, place->directory, SQLUH_OPEN_UPDATE);
         lost = lost || rc == HISTORY_FILE_RECREATED;
         if (rc >= 0)
             puts(repairedWords(rc == HISTORY_FILE_RECREATED ? repairAnew : due));
         int closed = sqluhClose(&handle);
         rc = rc < 0 ? rc : closed;
-        due = repairDueIn(&place);
+        due = repairDueIn(place);
     }
     releaseSignals();
     if (rc != 0)
-        return failOpening(rc, "repair the history", &place);
+        return failOpening(rc, "repair the history", place);
     if (lost)
-        return fail(place.directory,
+        return fail(place->directory,
                     "the history is empty: restore a backup of it, or load it anew");
     return exitDone;
 }

@@ -135,24 +135,19 @@ static void showJson(const historyPlace* place, const directoryReport* report)
         puts("null}");
 }
 
-int statusMain(int argc, char** argv)
+int statusMain(commandLine* line)
 {
-    historyPlace place = {};
+    historyPlace* place = &line->place;
+    bool json = line->json;
     directoryReport report = {};
-    bool json = false;
-    int rc = takeArguments(argc, argv, "[--json] DIR", 1, 1, &json);
-    if (rc == 0)
-        rc = takePlace(argv[1], &place);
-    if (rc != 0)
-        return rc;
-    lookAtFile(place.historyPath, &report.history);
-    lookAtFile(place.shadowPath, &report.shadow);
+    lookAtFile(place->historyPath, &report.history);
+    lookAtFile(place->shadowPath, &report.shadow);
     if (!report.history.present && !report.shadow.present && !json)
-        return failInPlace(HISTORY_FILE_MISSING, "show the history", &place);
+        return failInPlace(HISTORY_FILE_MISSING, "show the history", place);
     report.due = repairDue(&report.history, &report.shadow);
-    report.lockKnown = queryLock(&place, &report.lock, &report.lockState);
+    report.lockKnown = queryLock(place, &report.lock, &report.lockState);
     if (json) {
-        showJson(&place, &report);
+        showJson(place, &report);
     } else {
         showFile("history", SQLUH_HISTORY_NAME, &report.history);
         showFile("shadow", SQLUH_SHADOW_NAME, &report.shadow);

@@ -57,64 +57,56 @@ static int installHistory(historyPlace* place, char* temporary)
     return rc == 0 ? 0 : failOpening(rc, "put the history in place", place);
 }
 
-int restoreMain(int argc, char** argv)
+int restoreMain(commandLine* line)
 {
-    historyPlace place = {};
+    historyPlace* place = &line->place;
+    const char* image = line->arguments[0];
     char temporary[pathCapacity];
-    int rc = takeArguments(argc, argv, "DIR FILE", 2, 2, nullptr);
-    if (rc == 0)
-        rc = takePlace(argv[1], &place);
-    if (rc == 0)
-        rc = formTemporary(place.historyPath, temporary);
+    int rc = formTemporary(place->historyPath, temporary);
     if (rc != 0)
         return rc;
-    if (!isSoundImage(argv[2], argv[2], "restore the history"))
+    if (!isSoundImage(image, image, "restore the history"))
         return exitFailed;
     // The copy is what was verified, whatever happens to the image meanwhile: so it is verified
     // too.
-    int copied = sqlocopy(argv[2], temporary, 0);
+    int copied = sqlocopy(image, temporary, 0);
     if (copied != 0)
-        rc = failWithCode(copied, "copy the backup to the directory", place.directory);
-    if (rc == 0 && !isSoundImage(temporary, argv[2], "restore the history"))
+        rc = failWithCode(copied, "copy the backup to the directory", place->directory);
+    if (rc == 0 && !isSoundImage(temporary, image, "restore the history"))
         rc = exitFailed;
     if (rc == 0)
-        rc = installHistory(&place, temporary);
+        rc = installHistory(place, temporary);
     unlink(temporary);
     if (rc == 0)
         puts("The history was restored.");
     return rc;
 }
 
-int copyMain(int argc, char** argv)
+int copyMain(commandLine* line)
 {
-    historyPlace source = {}, target = {};
+    historyPlace* source = &line->place;
+    historyPlace* target = &line->target;
     SQLUH_HANDLE* handle = nullptr;
     char temporary[pathCapacity];
-    int rc = takeArguments(argc, argv, "SRC DST", 2, 2, nullptr);
-    if (rc == 0)
-        rc = takePlace(argv[1], &source);
-    if (rc == 0)
-        rc = takePlace(argv[2], &target);
-    if (rc == 0)
-        rc = formTemporary(target.historyPath, temporary);
+    int rc = formTemporary(target->historyPath, temporary);
     if (rc != 0)
         return rc;
-    if (isSame(source.directory, target.directory))
-        return fail(target.directory, "source and target are the same directory");
+    if (isSame(source->directory, target->directory))
+        return fail(target->directory, "source and target are the same directory");
 
     // One lock at a time: keys may clash, and the second lock would then wait for the first.
-    rc = openHistory(&source, SQLUH_OPEN_READ, &handle);
+    rc = openHistory(source, SQLUH_OPEN_READ, &handle);
     if (rc == 0) {
-        int copied = sqlocopy(source.historyPath, temporary, 0);
+        int copied = sqlocopy(source->historyPath, temporary, 0);
         if (copied != 0)
-            rc = failWithCode(copied, "copy the history", target.directory);
-        int closed = closeHistory(&source, &handle, "close the history");
+            rc = failWithCode(copied, "copy the history", target->directory);
+        int closed = closeHistory(source, &handle, "close the history");
         rc = rc != 0 ? rc : closed;
     }
-    if (rc == 0 && !isSoundImage(temporary, source.directory, "copy the history"))
+    if (rc == 0 && !isSoundImage(temporary, source->directory, "copy the history"))
         rc = exitFailed;
     if (rc == 0)
-        rc = installHistory(&target, temporary);
+        rc = installHistory(target, temporary);
     unlink(temporary);
     if (rc == 0)
         puts("The history was copied.");
@@ -182,30 +174,27 @@ static int nameBackup(const char* temporary, const char* path)
     return rc;
 }
 
-int backupMain(int argc, char** argv)
+int backupMain(commandLine* line)
 {
-    historyPlace place = {};
+    historyPlace* place = &line->place;
+    const char* path = line->arguments[0];
     SQLUH_HANDLE* handle = nullptr;
     char temporary[pathCapacity];
-    int rc = takeArguments(argc, argv, "DIR FILE", 2, 2, nullptr);
+    int rc = checkBackupName(place, path);
     if (rc == 0)
-        rc = takePlace(argv[1], &place);
+        rc = formTemporary(path, temporary);
     if (rc == 0)
-        rc = checkBackupName(&place, argv[2]);
-    if (rc == 0)
-        rc = formTemporary(argv[2], temporary);
-    if (rc == 0)
-        rc = openHistory(&place, SQLUH_OPEN_READ, &handle);
+        rc = openHistory(place, SQLUH_OPEN_READ, &handle);
     if (rc != 0)
         return rc;
     int stored = writeBackup(handle, temporary);
-    rc = closeHistory(&place, &handle, "close the history");
-    if (rc == 0 && stored == 0 && !isSoundImage(temporary, place.directory, "back up the history"))
+    rc = closeHistory(place, &handle, "close the history");
+    if (rc == 0 && stored == 0 && !isSoundImage(temporary, place->directory, "back up the history"))
         rc = exitFailed; // a damaged history must not take the place of a good backup
     if (rc == 0 && stored == 0)
-        stored = nameBackup(temporary, argv[2]);
+        stored = nameBackup(temporary, path);
     if (rc == 0 && stored != 0)
-        rc = failWithCode(stored, "write the backup", argv[2]);
+        rc = failWithCode(stored, "write the backup", path);
     if (rc != 0)
         unlink(temporary);
     else

@@ -81,31 +81,27 @@ static int verifyBoth(const historyPlace* place)
     return exitFailed;
 }
 
-int verifyMain(int argc, char** argv)
+int verifyMain(commandLine* line)
 {
-    historyPlace place = {};
+    historyPlace* place = &line->place;
     SQLUH_HANDLE* handle = nullptr;
-    int rc = takeArguments(argc, argv, "DIR", 1, 1, nullptr);
-    if (rc == 0)
-        rc = takePlace(argv[1], &place);
-    if (rc == 0)
-        rc = awaitLock(&place, R_OK);
+    int rc = awaitLock(place, R_OK);
     if (rc != 0)
         return rc;
     // Taking the lock makes a history file where there is none, and verifying must not.
-    if (hasHistoryFile(&place)) {
-        rc = sqluhHandleAllocAndInit(place.directory, &handle);
+    if (hasHistoryFile(place)) {
+        rc = sqluhHandleAllocAndInit(place->directory, &handle);
         if (rc == 0)
             rc = sqluhLock(handle);
-        rc = rc == 0 ? 0 : failInPlace(rc, "take the lock", &place);
+        rc = rc == 0 ? 0 : failInPlace(rc, "take the lock", place);
     }
     if (rc == 0)
-        rc = verifyBoth(&place);
+        rc = verifyBoth(place);
     if (handle != nullptr) {
         int unlocked = sqluhUnlock(handle);
         sqluhHandleFree(&handle);
         if (rc == 0 && unlocked != 0)
-            rc = failInPlace(unlocked, "release the lock", &place);
+            rc = failInPlace(unlocked, "release the lock", place);
     }
     releaseSignals();
     return rc;

@@ -14,25 +14,50 @@ enum : int {
     exitUsage = 2,  // the command line is wrong
 };
 
-// Each takes its own name as argv[0] and returns an exit status.
-int loadMain(int argc, char** argv);
-int dumpMain(int argc, char** argv);
-int statusMain(int argc, char** argv);
-int verifyMain(int argc, char** argv);
-int repairMain(int argc, char** argv);
-int copyMain(int argc, char** argv);
-int backupMain(int argc, char** argv);
-int restoreMain(int argc, char** argv);
-int unlockMain(int argc, char** argv);
-int imagesMain(int argc, char** argv);
-int planMain(int argc, char** argv);
-
 // A history directory as the library takes it, and its two files.
 struct historyPlace {
     char directory[pathCapacity]; // ends with the separator
     char historyPath[pathCapacity];
     char shadowPath[pathCapacity];
 };
+
+// A call of a subcommand.
+struct commandLine {
+    historyPlace place;  // the directory; the first of two
+    historyPlace target; // the second
+    char** arguments;    // those after the directories, null after the last
+    int numArguments;
+    bool json;
+};
+
+// What there is to know about a subcommand. run returns an exit status.
+struct subcommand {
+    const char* name;
+    int (*run)(commandLine* line);
+    int numDirectories;
+    int least, most; // arguments after the directories; most -1: any number
+    unsigned int options;
+    const char* form; // all of them as the usage line shows them
+    const char* help;
+};
+enum : unsigned int { optionJson = 1 };
+
+int loadMain(commandLine* line);
+int dumpMain(commandLine* line);
+int imagesMain(commandLine* line);
+int planMain(commandLine* line);
+int statusMain(commandLine* line);
+int verifyMain(commandLine* line);
+int repairMain(commandLine* line);
+int copyMain(commandLine* line);
+int backupMain(commandLine* line);
+int restoreMain(commandLine* line);
+int unlockMain(commandLine* line);
+
+// --- The command line (subcommand.cpp) -----------------------------------------------------------
+
+// Runs the subcommand that argv[1] names and returns its exit status.
+int runProgram(int argc, char** argv);
 
 // --- Messages (message.cpp) ----------------------------------------------------------------------
 
@@ -62,12 +87,6 @@ bool isSystemCode(int code);
 void putEscaped(FILE* out, const char* text, size_t length);
 
 // --- Directories and locks (access.cpp) ----------------------------------------------------------
-
-// Takes the options out of a subcommand's arguments: argv[1] and up are then the others, null
-// behind the last. form: the arguments as the usage line shows them; least, most: how many there
-// may be without the options, -1 for any number; json: set by --json, null where that is no option.
-// Returns 0, or exitUsage after a complaint.
-int takeArguments(int argc, char** argv, const char* form, int least, int most, bool* json);
 
 // Takes a directory from the command line, with or without its last separator. Complains and
 // returns exitFailed when it is too long, no directory, or one that may not be searched, else 0.
@@ -134,8 +153,8 @@ struct entriesReport {
 // Counts one more entry, which begins at report->offset.
 void countEntry(entriesReport* report, const SQLUH_ENTRY* entry);
 
-// Reads all entries of an open file, behind its header. progress: null, or what a progress bar on
-// the terminal is titled with when it takes long.
+// Reads all entries of an open file, those after its header. progress: null, or what a progress bar
+// on the terminal is titled with when it takes long.
 void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* progress,
                     entriesReport* report);
 

@@ -36,14 +36,13 @@ extern "C" int sqlocopy(const char* source, const char* target, unsigned int opt
 class StopTest : public HistoryTest
 {
   protected:
-    int run(int (*subcommand)(int, char**), std::string file, int stopAt)
+    int run(std::string subcommand, std::string file, int stopAt)
     {
         pid_t child = fork();
         if (child == 0) {
-            char name[] = "subcommand";
-            char* argv[] = {name, directory.data(), file.data(), nullptr};
+            char* argv[] = {nullptr, subcommand.data(), directory.data(), file.data(), nullptr};
             stepsLeft = stopAt;
-            _exit(subcommand(3, argv));
+            _exit(runProgram(4, argv));
         }
         int status = 0;
         waitpid(child, &status, 0);
@@ -68,20 +67,20 @@ TEST_F(StopTest, WhatIsLeftIsTheOldHistoryOrTheNewOne)
 {
     spill(root + "old", "Operation: backup\nTimestamp: 20250101000000\nNumber: 1\n");
     spill(root + "new", "Operation: backup\nTimestamp: 20250202000000\nNumber: 1\n");
-    ASSERT_EQ(0, run(loadMain, root + "new", -1));
-    ASSERT_EQ(0, run(backupMain, root + "image", -1));
+    ASSERT_EQ(0, run("load", root + "new", -1));
+    ASSERT_EQ(0, run("backup", root + "image", -1));
     std::string newEntries = entriesAfterOpen();
     std::filesystem::remove(historyPath), std::filesystem::remove(shadowPath);
-    ASSERT_EQ(0, run(loadMain, root + "old", -1));
+    ASSERT_EQ(0, run("load", root + "old", -1));
     std::string oldEntries = entriesAfterOpen(), history = slurp(historyPath),
                 shadow = slurp(shadowPath);
     ASSERT_EQ(oldEntries.size(), newEntries.size());
 
     const struct {
-        int (*subcommand)(int, char**);
+        const char* subcommand;
         const char* file;
         std::string after;
-    } rows[] = {{restoreMain, "image", newEntries}, {loadMain, "new", oldEntries + newEntries}};
+    } rows[] = {{"restore", "image", newEntries}, {"load", "new", oldEntries + newEntries}};
     for (const auto& row : rows) {
         int stops = 0, status = 42, changed = 0;
         for (; status == 42; stops++) {
