@@ -100,7 +100,7 @@ int awaitLock(const historyPlace* place, int rights)
 
 int failOpening(int code, const char* what, const historyPlace* place)
 {
-    if (code != HISTORY_FILE_DAMAGED || repairDueIn(place) == repairAnew)
+    if (code != HISTORY_FILE_DAMAGED || repairDueIn(place) == sqluhRepairAnew)
         return failInPlace(code, what, place);
     return fail(place->directory,
                 "cannot %s: the history needs a repair that failed; the diagnostic log tells why "

@@ -18,23 +18,16 @@ void lookAtFile(const char* path, fileReport* report)
         report->rc = sqluhReadHeader(file, &report->header);
         sqloclose(file);
     }
-    report->usable = report->rc == 0 && (report->header.status == statusConsistent ||
-                                         report->header.status == statusCommitted);
+    report->state = sqluhStateOfFile(report->rc, &report->header);
 }
 
-repairKind repairDue(const fileReport* history, const fileReport* shadow)
+sqluhRepair repairDue(const fileReport* history, const fileReport* shadow)
 {
-    bool rebuilding = shadow->rc == 0 && shadow->header.status == statusPending;
-    if (!history->usable && !shadow->usable && !rebuilding)
-        return repairAnew;
-    if (!history->usable)
-        return repairHistory;
-    bool inStep = history->header.status == statusConsistent && shadow->usable &&
-                  history->size == shadow->size;
-    return inStep ? repairNothing : repairShadow;
+    sqluhRepair due = sqluhDecideRepair(history->state, shadow->state);
+    return due == sqluhRepairNone && history->size != shadow->size ? sqluhRepairShadow : due;
 }
 
-repairKind repairDueIn(const historyPlace* place)
+sqluhRepair repairDueIn(const historyPlace* place)
 {
     fileReport history, shadow;
     lookAtFile(place->historyPath, &history);
@@ -115,29 +108,22 @@ void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* pro
     data.objectPart = {objectPart, sizeof objectPart, 0};
     SQLUH_ENTRY entry = {};
     entry.data = &data;
-    unsigned int flags = 0;
+    SQLUH_ENTRYWALK walk = {file, &entry, workArea, headerLength, false};
     long long end = 0;
     progressBar bar;
     *report = {};
     int rc = sqloseek(file, 0, sqloFromEnd, &end);
     if (rc == 0)
-        rc = sqluhRewind(file, &report->offset);
+        rc = sqluhRewind(file, nullptr);
     startProgress(&bar, progress, end);
-    while (rc == 0) {
-        rc = sqluhReadEntry(file, &entry, workArea, nullptr, nullptr, nullptr, nullptr, &flags);
-        if (rc == TABLESPACE_LIST_TRUNCATED)
-            rc = 0;
-        if (rc != 0)
-            break;
+    while (rc == 0 && (rc = sqluhNextEntry(&walk)) == 0) {
+        report->offset = walk.offset;
         countEntry(report, &entry);
-        rc = sqloseek(file, 0, sqloFromCurrent, &report->offset);
-        moveProgress(&bar, report->offset);
+        moveProgress(&bar, walk.offset);
     }
     endProgress(&bar);
-    // The reader's end of file may also lie between an entry's first lines and the others.
-    if (rc == END_OF_FILE)
-        rc = report->offset >= end ? 0 : static_cast<int>(HISTORY_FILE_DAMAGED);
-    report->rc = rc;
+    report->offset = walk.offset;
+    report->rc = walk.cutShort ? HISTORY_FILE_DAMAGED : rc == END_OF_FILE ? 0 : rc;
 }
 
 static bool isSoundFile(SQLO_FHANDLE file, const char* name, const char* what)

@@ -138,7 +138,7 @@ static int runBatch(historyPlace* place, historyList* list)
 // A history that no file of the pair holds would silently be begun anew by the batch.
 static int checkUsable(historyPlace* place)
 {
-    return repairDueIn(place) == repairAnew
+    return repairDueIn(place) == sqluhRepairAnew
                ? failInPlace(HISTORY_FILE_DAMAGED, "append to the history", place)
                : 0;
 }

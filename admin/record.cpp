@@ -5,7 +5,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "history/sqluhcol.h"
+#include "history/sqluhColumns.h"
 
 static constexpr textBuffer zq3HistoryData::*textMembers[] = {
     &zq3HistoryData::objectPart, &zq3HistoryData::secondTimestamp, &zq3HistoryData::firstText,
@@ -156,7 +156,7 @@ static void takeLetter(char* letter, const char* head, unsigned int field)
 static int takeAsWritten(historyRecord* record, const char* head)
 {
     bool framed = true;
-    for (const sqluhField& field : entryFields)
+    for (const sqluhEntryField& field : entryFields)
         framed &= head[field.at + field.width] == ':';
     if (!framed)
         return 0;
@@ -173,19 +173,12 @@ static int takeAsWritten(historyRecord* record, const char* head)
     return taken ? 0 : sqloSystemError | ENOMEM;
 }
 
-// Whether the file ends at offset; otherwise an end of file met there lies inside an entry.
-static bool isEndOf(SQLO_FHANDLE file, long long offset)
-{
-    long long end = 0;
-    return sqloseek(file, 0, sqloFromEnd, &end) == 0 && end <= offset;
-}
-
 int readRecord(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, historyRecord* record,
                long long* offset)
 {
     char head[entryLongTextAt + lineLength] = {};
     uint32_t headRead = 0;
-    unsigned int flags = 0;
+    SQLUH_ENTRYWALK walk = {file, &record->entry, workArea, 0, false};
     bool fitted = false;
     int rc = sqloseek(file, 0, sqloFromCurrent, offset);
     if (rc == 0)
@@ -195,16 +188,11 @@ int readRecord(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, historyRecord* recor
     for (int round = 0; rc == 0 && !fitted && round < 4; round++) {
         rc = sqloseek(file, *offset, sqloFromStart, nullptr);
         if (rc == 0)
-            rc = sqluhReadEntry(file, &record->entry, workArea, nullptr, nullptr, nullptr, nullptr,
-                                &flags);
-        if (rc == TABLESPACE_LIST_TRUNCATED)
-            rc = 0;
+            rc = sqluhNextEntry(&walk);
         if (rc == 0)
             rc = makeRoom(record, &fitted);
     }
     if (rc == 0)
         rc = takeAsWritten(record, head);
-    if (rc == END_OF_FILE && !isEndOf(file, *offset))
-        rc = HISTORY_FILE_DAMAGED;
-    return rc;
+    return walk.cutShort ? HISTORY_FILE_DAMAGED : rc;
 }

@@ -3,10 +3,10 @@
 
 #include <unistd.h>
 
-static const char* repairedWords(repairKind done)
+static const char* repairedWords(sqluhRepair done)
 {
-    return done == repairShadow ? "The shadow was made anew from the history file."
-           : done == repairHistory
+    return done == sqluhRepairShadow ? "The shadow was made anew from the history file."
+           : done == sqluhRepairHistory
                ? "The history file was made anew from the shadow; a batch that "
                  "was not finished is undone."
                : "Neither file could be used. Both were moved aside, to " SQLUH_SAVED_HISTORY_NAME
@@ -21,16 +21,16 @@ int repairMain(commandLine* line)
         return rc;
 
     // An open does one repair; after one of the history the shadow's mark takes another.
-    repairKind due = repairDueIn(place);
-    if (due == repairNothing)
+    sqluhRepair due = repairDueIn(place);
+    if (due == sqluhRepairNone)
         puts("Nothing to repair: both files can be used and are in step.");
     bool lost = false;
-    for (int round = 0; rc == 0 && due != repairNothing && round < 3; round++) {
+    for (int round = 0; rc == 0 && due != sqluhRepairNone && round < 3; round++) {
         SQLUH_HANDLE* handle = nullptr;
         rc = sqluhOpen(&handle, place->directory, SQLUH_OPEN_UPDATE);
         lost = lost || rc == HISTORY_FILE_RECREATED;
         if (rc >= 0)
-            puts(repairedWords(rc == HISTORY_FILE_RECREATED ? repairAnew : due));
+            puts(repairedWords(rc == HISTORY_FILE_RECREATED ? sqluhRepairAnew : due));
         int closed = sqluhClose(&handle);
         rc = rc < 0 ? rc : closed;
         due = repairDueIn(place);

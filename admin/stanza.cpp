@@ -12,7 +12,7 @@
 #include <strings.h>
 
 #include "admin/fields.h"
-#include "history/sqluhcol.h"
+#include "history/sqluhColumns.h"
 
 // Fields are numbered: those of the three tables, then the others.
 enum : unsigned int {

@@ -7,7 +7,7 @@
 
 struct directoryReport {
     fileReport history, shadow;
-    repairKind due;
+    sqluhRepair due;
     bool lockKnown;
     SQLO_NLCK lock;
     SQLO_NLCKSTATE lockState;
@@ -52,12 +52,12 @@ static bool isUnreadable(const fileReport* file)
 
 static const char* verdict(const directoryReport* report)
 {
-    repairKind due = report->due;
-    if (due == repairAnew && (isUnreadable(&report->history) || isUnreadable(&report->shadow)))
+    sqluhRepair due = report->due;
+    if (due == sqluhRepairAnew && (isUnreadable(&report->history) || isUnreadable(&report->shadow)))
         return "cannot be read";
-    return due == repairNothing   ? "usable; both files are in step"
-           : due == repairShadow  ? "usable; the next open rebuilds the shadow from the history"
-           : due == repairHistory ? "usable; the next open rebuilds the history from the shadow"
+    return due == sqluhRepairNone   ? "usable; both files are in step"
+           : due == sqluhRepairShadow  ? "usable; the next open rebuilds the shadow from the history"
+           : due == sqluhRepairHistory ? "usable; the next open rebuilds the history from the shadow"
                                   : "not usable; the next open would move both files aside";
 }
 
@@ -102,7 +102,7 @@ static void showJsonFile(const char* key, const fileReport* file)
     const SQLUH_HEADER* header = &file->header;
     printf(",\"%s\":{\"present\":%s", key, file->present ? "true" : "false");
     if (file->present)
-        printf(",\"size\":%llu,\"usable\":%s", file->size, file->usable ? "true" : "false");
+        printf(",\"size\":%llu,\"usable\":%s", file->size, file->state.usable ? "true" : "false");
     if (file->rc == 0) {
         fputs(",\"status\":", stdout);
         putJsonText(stdout, &header->status, 1);
@@ -123,7 +123,7 @@ static void showJson(const historyPlace* place, const directoryReport* report)
                                          "held", "holder died", "foreign"};
     fputs("{\"directory\":", stdout);
     putJsonText(stdout, place->directory, strlen(place->directory));
-    printf(",\"usable\":%s,\"repair\":\"%s\"", report->due != repairAnew ? "true" : "false",
+    printf(",\"usable\":%s,\"repair\":\"%s\"", report->due != sqluhRepairAnew ? "true" : "false",
            repairs[report->due]);
     showJsonFile("history", &report->history);
     showJsonFile("shadow", &report->shadow);
@@ -154,5 +154,5 @@ int statusMain(commandLine* line)
         showLock(&report);
         printf("%-10s%s\n", "", verdict(&report));
     }
-    return report.due == repairAnew ? exitFailed : exitDone;
+    return report.due == sqluhRepairAnew ? exitFailed : exitDone;
 }

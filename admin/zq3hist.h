@@ -129,14 +129,13 @@ struct fileReport {
     unsigned long long size;
     int rc;              // of reading the header
     SQLUH_HEADER header; // valid if rc is 0
-    bool usable;
+    SQLUH_FILESTATE state;
 };
 void lookAtFile(const char* path, fileReport* report);
 
-// What the next open will do about the two files.
-enum repairKind { repairNothing, repairShadow, repairHistory, repairAnew };
-repairKind repairDue(const fileReport* history, const fileReport* shadow);
-repairKind repairDueIn(const historyPlace* place); // looks at both files
+// What the next open will do about the two files, their sizes included.
+sqluhRepair repairDue(const fileReport* history, const fileReport* shadow);
+sqluhRepair repairDueIn(const historyPlace* place); // looks at both files
 
 // What reading all entries of a file found.
 struct entriesReport {

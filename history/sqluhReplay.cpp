@@ -1,4 +1,5 @@
 // Recording a batch's writes and repeating them in the shadow, and the checks of a file's position.
+// Stands on the writing of headers and on verification.
 //
 // The shadow is brought up to date only after the history file durably says 'C'. Stopped at any
 // moment of it, the next open finds that letter and copies the whole history file over the shadow,
@@ -6,8 +7,8 @@
 
 #include <cstring>
 
+#include "history/sqluhDiagnostics.h"
 #include "history/sqluhist.h"
-#include "history/sqluhlog.h"
 
 // --- Recording -----------------------------------------------------------------------------------
 
@@ -71,57 +72,63 @@ int sqluhAddReplayEntry(SQLUH_REPLAYAREA* area, long long offset, unsigned int l
 
 // --- Replay --------------------------------------------------------------------------------------
 
-// The file handle is the caller's only way to the history file: closed before the copy, open behind
+static constexpr char replayWork[] = "sqluhReplayWorkInShadow"; // the operation that the log names
+
+// The file handle is the caller's only way to the history file: closed before the copy, open after
 // it.
 static int copyWholeFile(SQLUH_HANDLE* handle)
 {
-    int rc = logged(sqloclose(handle->fileHandle));
+    int rc = logged(sqloclose(handle->fileHandle), replayWork);
     handle->fileHandle = sqloNoFile;
+    // The copy makes the shadow durable before the history file may say that they agree (B4).
     if (rc == 0)
-        rc = logged(sqlocopy(handle->historyPath, handle->shadowPath, 0));
+        rc = logged(sqlocopy(handle->historyPath, handle->shadowPath, 0), replayWork);
     if (rc == 0) {
         rc = logged(
-            sqloopenp(handle->historyPath, sqloOpenUpdate, sqloPermissions, &handle->fileHandle));
+            sqloopenp(handle->historyPath, sqloOpenUpdate, sqloPermissions, &handle->fileHandle),
+            replayWork);
         if (rc != 0)
             handle->fileHandle = sqloNoFile;
     }
     return rc;
 }
 
-static int writeAt(SQLO_FHANDLE shadow, long long offset, const char* bytes, uint32_t length)
+static int writeInShadow(SQLO_FHANDLE shadow, const char* bytes, uint32_t length)
 {
     uint32_t written = 0;
-    int rc = logged(sqloseek(shadow, offset, sqloFromStart, nullptr));
-    if (rc == 0) {
-        rc = sqlowrite(shadow, bytes, length, &written);
-        if (rc == 0 && written != length)
-            rc = transferCode(rc);
-        logged(rc);
-    }
-    return rc;
+    int rc = sqlowrite(shadow, bytes, length, &written);
+    if (rc == 0 && written != length)
+        rc = transferCode(rc);
+    return logged(rc, replayWork);
+}
+
+static int replayFromCopy(SQLO_FHANDLE shadow, const SQLUH_REPLAYENTRY* element)
+{
+    int rc = logged(sqloseek(shadow, element->offset, sqloFromStart, nullptr), replayWork);
+    return rc == 0 ? writeInShadow(shadow, element->copy, element->length) : rc;
 }
 
 static int replayFromFile(SQLUH_HANDLE* handle, SQLO_FHANDLE shadow, char* buffer,
                           const SQLUH_REPLAYENTRY* element)
 {
     uint32_t bytesRead = 0;
-    int rc = logged(sqloseek(handle->fileHandle, element->offset, sqloFromStart, nullptr));
+    int rc =
+        logged(sqloseek(handle->fileHandle, element->offset, sqloFromStart, nullptr), replayWork);
     if (rc == 0)
-        rc = logged(sqloread(handle->fileHandle, buffer, element->length, &bytesRead));
+        rc = logged(sqloseek(shadow, element->offset, sqloFromStart, nullptr), replayWork);
     if (rc == 0)
-        rc = writeAt(shadow, element->offset, buffer, bytesRead);
-    return rc;
+        rc = logged(sqloread(handle->fileHandle, buffer, element->length, &bytesRead), replayWork);
+    return rc == 0 ? writeInShadow(shadow, buffer, bytesRead) : rc;
 }
 
 // The first element from its copy, the others from the history file, in the order of the writes.
 static int replayElements(SQLUH_HANDLE* handle, SQLO_FHANDLE shadow)
 {
     const SQLUH_REPLAYAREA* area = &handle->replayArea;
-    const SQLUH_REPLAYENTRY* first = &area->replayEntries[0];
     void* buffer = nullptr;
-    int rc = writeAt(shadow, first->offset, first->copy, first->length);
+    int rc = replayFromCopy(shadow, &area->replayEntries[0]);
     if (rc == 0 && area->numReplayEntries > 1) {
-        rc = logged(allocateZeroed(area->maxReplayLength, &buffer));
+        rc = logged(allocateZeroed(area->maxReplayLength, &buffer), replayWork);
         for (uint32_t i = 1; rc == 0 && i < area->numReplayEntries; i++)
             rc =
                 replayFromFile(handle, shadow, static_cast<char*>(buffer), &area->replayEntries[i]);
@@ -134,16 +141,17 @@ static int replayElements(SQLUH_HANDLE* handle, SQLO_FHANDLE shadow)
 static int replayIntoShadow(SQLUH_HANDLE* handle)
 {
     SQLO_FHANDLE shadow = sqloNoFile;
-    int rc = logged(sqloopenp(handle->shadowPath, sqloOpenShadow, sqloPermissions, &shadow));
+    int rc =
+        logged(sqloopenp(handle->shadowPath, sqloOpenShadow, sqloPermissions, &shadow), replayWork);
     if (rc != 0)
         return rc;
-    rc = logged(sqluhWriteHeader(shadow, &handle->header));
+    rc = logged(sqluhWriteHeader(shadow, &handle->header), replayWork);
     if (rc == 0)
         rc = replayElements(handle, shadow);
-    // Durable before the history file may say that the shadow agrees with it.
+    // B4: durable before the history file may say that the shadow agrees with it.
     if (rc == 0)
-        rc = logged(sqlosync(shadow));
-    return firstOf(rc, logged(sqloclose(shadow)));
+        rc = logged(sqlosync(shadow), replayWork);
+    return firstOf(rc, logged(sqloclose(shadow), replayWork));
 }
 
 int sqluhReplayWorkInShadow(SQLUH_HANDLE* handle)
@@ -188,8 +196,7 @@ int sqluhVerifySeekOffsetNotPastEOF(SQLO_FHANDLE fileHandle, long long offset)
     if (rc == 0) {
         sqloseek(fileHandle, 0, sqloFromEnd, &end);
         rc = logged(sqloseek(fileHandle, position, sqloFromStart, nullptr));
-        // An offset behind the end is where a read would find nothing: the reader's own code for
-        // it.
+        // An offset past the end is where a read would find nothing: the reader's own code for it.
         if (rc == 0 && end >= 0 && offset > end)
             rc = END_OF_FILE;
     }

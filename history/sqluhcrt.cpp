@@ -1,9 +1,9 @@
-// Creation of a new, empty pair of files.
+// Creation of a new, empty pair of files. Stands on the writing of headers.
 
 #include <cstring>
 
+#include "history/sqluhDiagnostics.h"
 #include "history/sqluhist.h"
-#include "history/sqluhlog.h"
 #include "sqo/sqlzkrcb.h"
 
 static void initialHeader(SQLUH_HEADER* header)
@@ -37,7 +37,8 @@ int sqluhCreate(char* directory)
         rc = logged(sqluhWriteHeader(fh, &header));
         bool written = rc == 0;
         rc = firstOf(rc, logged(sqloclose(fh)));
-        // The shadow comes into being as the copy of a complete history file, never before it.
+        // The shadow comes into being as the copy of a complete history file, never before it. The
+        // open and the copy make the two names durable (D).
         if (written)
             rc = firstOf(rc, logged(sqlocopy(historyPath, shadowPath, 0)));
     }

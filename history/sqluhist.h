@@ -48,7 +48,21 @@ enum : unsigned int {
     maxCreateDirectoryLength = createPathCapacity - sizeof SQLUH_HISTORY_NAME, // 243
 };
 
-enum : uint32_t { currentVersion = 9010300 };
+// Format versions from which a header reads differently; what this library writes is the last.
+enum : uint32_t {
+    versionWithNumber15 = 6010000,
+    versionWithTimestamp = 7020200, // its checksum covers less, until
+    versionWithWholeChecksum = 8010000,
+    currentVersion = 9010300,
+};
+
+// Operation-type letters of backup images; every other letter is a full image.
+enum : char {
+    typeIncremental = 'I',
+    typeIncrementalOther = 'O',
+    typeDelta = 'D',
+    typeDeltaOther = 'E',
+};
 
 // Header status letters. A file is usable when its header reads and its status is blank or 'C'.
 enum : char {
@@ -71,8 +85,8 @@ enum : uint32_t {
     headerTimestampAt = 152,
     headerMaxCommandAt = 167,
     headerMaxCommandAtNoTimestamp = 153, // field 16 shrank to "-"
-    headerMaxCommandAt7020200 = 152,     // versions below 7020200 have no field 16
-    headerMaxCommandAt6010000 = 143,     // versions below 6010000 have no field 15 either
+    headerMaxCommandAt7020200 = 152,     // versions without a timestamp
+    headerMaxCommandAt6010000 = 143,     // versions without number15 either
     headerNumberWidth = 8,
     timestampWidth = 14,
 };
@@ -132,7 +146,7 @@ enum : uint32_t {
     entryMinLength = 768, // the fixed part and the note line
     entryNoteAt = 512,
     entryLongTextAt = 768,
-    tablespaceNameAt = 9,     // the name's place in its line, behind eight digits and a colon
+    tablespaceNameAt = 9,     // the name's place in its line, after eight digits and a colon
     tablespaceLineExtra = 10, // what a line is longer than its name
     sqlcaLineLength = 194,
     commandPieceLength = 255,
@@ -142,12 +156,49 @@ enum : uint32_t {
     workAreaPerTablespace = 28, // line length of a tablespace with an 18-character name
 };
 
-// A field of the entry's fixed part: where it stands, how wide it is.
+enum : uint32_t { entryReserved1At = 106, entryReserved1Length = 149 };
+
+static constexpr char entryFormat[] =
+    "%8.8X:%4.4hX:%8.8X:%8.8X:%8.8u:%c:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%149.149s\n"
+    "%c:%c:%c:%-17.17s:%-14.14s:%-12.12s:%-12.12s:%-12.12s:%-24.24s:%c:%150.150s\n";
+static constexpr char entryScanFormat[] = "%8x:%4hx:%8x:%8x:%8u:%c:%8x:%8x:%8x:%8x:%8x:%8x:%8x:\n"
+                                          "%c:%c:%c:%17s :%14s :%12s :%12s :%12s :%24s :%c:\n";
+static constexpr char logPositionFormat[] = "%2.2X%2.2X%2.2X%2.2X%2.2X%2.2X";
+static constexpr char lineFormat[] = "%-255.255s\n";
+static constexpr char objectNamesFormat[] = "%-*.*s\n%-*.*s\n";
+static constexpr char tablespaceFormat[] = "%8.8X:%-*.*s\n";
+static constexpr char commandPieceFormat[] = "%-*.*s\n";
+static constexpr char sqlcaFormat[] = "%-8.8s%10.10i%+10.10i%4.4hX%-70.70s%-8.8s"
+                                      "%+10.10i%+10.10i%+10.10i%+10.10i%+10.10i%+10.10i"
+                                      "%c%c%c%c%c%c%c%c%c%c%c%-5.5s\n";
+static constexpr char checksumFormat[] = "%8.8X";
+
+// Members of the sqlca line: where each stands, how wide it is.
 struct sqluhField {
     uint16_t at;
     uint16_t width;
 };
-// Fields 1 to 23 in order; a colon stands behind each.
+static constexpr sqluhField sqlcaIdField = {0, 8}, sqlcaBcField = {8, 10},
+                            sqlcaCodeField = {18, 11}, sqlcaErrmlField = {29, 4},
+                            sqlcaErrmcField = {33, 70}, sqlcaErrpField = {103, 8},
+                            sqlcaErrdField = {111, 11}, // six of them
+    sqlcaWarnField = {177, 11}, sqlcaStateField = {188, 5};
+
+// One entry: the numbers of its fixed part, and its contents.
+struct SQLUH_ENTRY {
+    uint32_t checksum;
+    uint32_t size; // of the whole record in bytes
+    uint32_t version;
+    uint32_t noteLength;
+    uint32_t longTextLength;
+    uint32_t qualifierLength;
+    uint32_t nameLength;
+    uint32_t sqlcaLength;   // 0 or 194
+    uint32_t commandLength; // in characters
+    zq3HistoryData* data;   // the caller's
+};
+
+// Fields 1 to 23 of the fixed part in order; a colon stands after each.
 enum : unsigned int {
     fieldChecksum,
     fieldNode,
@@ -174,47 +225,50 @@ enum : unsigned int {
     fieldAuxCode,
     entryFieldCount
 };
-static constexpr sqluhField entryFields[entryFieldCount] = {
-    {0, 8},    {9, 4},    {14, 8},   {23, 8},   {32, 8},   {41, 1},   {43, 8},  {52, 8},
-    {61, 8},   {70, 8},   {79, 8},   {88, 8},   {97, 8},   {256, 1},  {258, 1}, {260, 1},
-    {262, 17}, {280, 14}, {295, 12}, {308, 12}, {321, 12}, {334, 24}, {359, 1},
+enum sqluhFieldKind : uint8_t {
+    kindHex,            // uint32_t
+    kindHex16,          // uint16_t
+    kindDecimal,        // uint32_t
+    kindLetter,         // char
+    kindOptionalLetter, // char; "-" is the absent one
+    kindTimestamp,      // textBuffer, one word; SQLUH_EMPTY_TIMESTAMP is the empty one
+    kindWord,           // textBuffer, one word; SQLUH_EMPTY_WORD is the empty one
+    kindLogPosition,    // bytes, one word of two hexadecimal digits each
 };
-enum : uint32_t { entryReserved1At = 106, entryReserved1Length = 149 };
+enum sqluhFieldOwner : uint8_t { ownerEntry, ownerData }; // SQLUH_ENTRY, zq3HistoryData
 
-static constexpr char entryFormat[] =
-    "%8.8X:%4.4hX:%8.8X:%8.8X:%8.8u:%c:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%8.8X:%149.149s\n"
-    "%c:%c:%c:%-17.17s:%-14.14s:%-12.12s:%-12.12s:%-12.12s:%-24.24s:%c:%150.150s\n";
-static constexpr char entryScanFormat[] = "%8x:%4hx:%8x:%8x:%8u:%c:%8x:%8x:%8x:%8x:%8x:%8x:%8x:\n"
-                                          "%c:%c:%c:%17s :%14s :%12s :%12s :%12s :%24s :%c:\n";
-static constexpr char logPositionFormat[] = "%2.2X%2.2X%2.2X%2.2X%2.2X%2.2X";
-static constexpr char lineFormat[] = "%-255.255s\n";
-static constexpr char objectNamesFormat[] = "%-*.*s\n%-*.*s\n";
-static constexpr char tablespaceFormat[] = "%8.8X:%-*.*s\n";
-static constexpr char commandPieceFormat[] = "%-*.*s\n";
-static constexpr char sqlcaFormat[] = "%-8.8s%10.10i%+10.10i%4.4hX%-70.70s%-8.8s"
-                                      "%+10.10i%+10.10i%+10.10i%+10.10i%+10.10i%+10.10i"
-                                      "%c%c%c%c%c%c%c%c%c%c%c%-5.5s\n";
-static constexpr char checksumFormat[] = "%8.8X";
-
-// Members of the sqlca line: where each stands, how wide it is.
-static constexpr sqluhField sqlcaIdField = {0, 8}, sqlcaBcField = {8, 10},
-                            sqlcaCodeField = {18, 11}, sqlcaErrmlField = {29, 4},
-                            sqlcaErrmcField = {33, 70}, sqlcaErrpField = {103, 8},
-                            sqlcaErrdField = {111, 11}, // six of them
-    sqlcaWarnField = {177, 11}, sqlcaStateField = {188, 5};
-
-// One entry: the numbers of its fixed part, and its contents.
-struct SQLUH_ENTRY {
-    uint32_t checksum;
-    uint32_t size; // of the whole record in bytes
-    uint32_t version;
-    uint32_t noteLength;
-    uint32_t longTextLength;
-    uint32_t qualifierLength;
-    uint32_t nameLength;
-    uint32_t sqlcaLength;   // 0 or 194
-    uint32_t commandLength; // in characters
-    zq3HistoryData* data;   // the caller's
+// Where a field stands, how wide it is, what it is, and the member that holds it.
+struct sqluhEntryField {
+    uint16_t at;
+    uint16_t width;
+    sqluhFieldKind kind;
+    sqluhFieldOwner owner;
+    uint16_t member; // its offset in the owner
+};
+static constexpr sqluhEntryField entryFields[entryFieldCount] = {
+    {0, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, checksum)},
+    {9, 4, kindHex16, ownerData, offsetof(zq3HistoryData, entryNode)},
+    {14, 8, kindHex, ownerData, offsetof(zq3HistoryData, entryNumber)},
+    {23, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, size)},
+    {32, 8, kindDecimal, ownerEntry, offsetof(SQLUH_ENTRY, version)},
+    {41, 1, kindLetter, ownerData, offsetof(zq3HistoryData, status)},
+    {43, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, noteLength)},
+    {52, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, longTextLength)},
+    {61, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, qualifierLength)},
+    {70, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, nameLength)},
+    {79, 8, kindHex, ownerData, offsetof(zq3HistoryData, numTablespaces)},
+    {88, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, sqlcaLength)},
+    {97, 8, kindHex, ownerEntry, offsetof(SQLUH_ENTRY, commandLength)},
+    {256, 1, kindLetter, ownerData, offsetof(zq3HistoryData, operation)},
+    {258, 1, kindOptionalLetter, ownerData, offsetof(zq3HistoryData, object)},
+    {260, 1, kindOptionalLetter, ownerData, offsetof(zq3HistoryData, operationType)},
+    {262, 17, kindTimestamp, ownerData, offsetof(zq3HistoryData, objectPart)},
+    {280, 14, kindTimestamp, ownerData, offsetof(zq3HistoryData, secondTimestamp)},
+    {295, 12, kindWord, ownerData, offsetof(zq3HistoryData, firstText)},
+    {308, 12, kindWord, ownerData, offsetof(zq3HistoryData, lastText)},
+    {321, 12, kindLogPosition, ownerData, offsetof(zq3HistoryData, logPosition)},
+    {334, 24, kindWord, ownerData, offsetof(zq3HistoryData, idText)},
+    {359, 1, kindOptionalLetter, ownerData, offsetof(zq3HistoryData, auxCode)},
 };
 
 // The buffer that entry records are read into. size is always the capacity of buffer.
@@ -239,9 +293,8 @@ enum : unsigned int {
 uint32_t sqluhChecksum(void* buffer, unsigned int length);
 
 // sprintf under the "C" locale: returns the number of characters formatted, the terminator not
-// counted; negative when formatting failed. buffer has room for all of it. Switches LC_CTYPE of the
-// whole process for the duration of the call, unless it is "C"; a locale's name of more than 33
-// characters is not restored.
+// counted; negative when formatting failed. buffer has room for all of it. The locale of the
+// process, and that of the calling thread, are afterwards what they were.
 int sqluhSprintf(char* buffer, const char* format, ...) __attribute__((format(printf, 2, 3)));
 
 // --- Reading and writing records -----------------------------------------------------------------
@@ -254,7 +307,7 @@ int sqluhWriteHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header);
 
 // Reads the header into *header, converting those of older versions, and leaves the file at 1024.
 // The record's checksum is 0 afterwards. Returns 0; END_OF_FILE for a file of 0 bytes, and when the
-// entry that an older header names lies at or behind the end of the file; HISTORY_FILE_DAMAGED; a
+// entry that an older header names lies at or past the end of the file; HISTORY_FILE_DAMAGED; a
 // transfer code; an allocation's or a seek's code. After a failure *header may hold part of a
 // header and must not be used, and the file may stand anywhere.
 int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header);
@@ -276,20 +329,35 @@ int sqluhRewind(SQLO_FHANDLE fh, long long* newOffset);
 // 0, or the allocation's code with the record as it was.
 int sqluhInitWorkArea(SQLUH_WORKAREA* workArea, uint32_t size);
 
-// Reads the entry at the file's position and leaves the file behind it.
+// Reads the entry at the file's position and leaves the file after it.
 //
 // entry: its data member points to the record to fill, whose buffers are the caller's. workArea: at
 // least 512 bytes; grown, and kept so, when an entry is larger. The filters may be null; of
 // timestampFilter 14 characters count. matchFlags receives the bits above. A text is cut to its
 // buffer and terminated; its length member tells the length in the file, a note's at most 30.
 // Returns 0; TABLESPACE_LIST_TRUNCATED, as 0 but names beyond maxTablespaces were not stored;
-// END_OF_FILE when no entry is left, or the file ends right behind a fixed part;
+// END_OF_FILE when no entry is left, or the file ends right after a fixed part;
 // HISTORY_FILE_DAMAGED; a transfer code; a seek's or the allocation's code when the work area could
 // not be grown. After a failure *entry and its data may be filled in part, and the file stands
 // where the last read left it.
 int sqluhReadEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
                    const char* timestampFilter, const char* qualifierFilter, const char* nameFilter,
                    const char* tablespaceFilter, unsigned int* matchFlags);
+
+// A walk over the entries of an open file, from its position on. Starts with entry (its data set
+// up), workArea and file given.
+struct SQLUH_ENTRYWALK {
+    SQLO_FHANDLE file;
+    SQLUH_ENTRY* entry;       // as for sqluhReadEntry
+    SQLUH_WORKAREA* workArea; // as for sqluhReadEntry
+    long long offset;         // where the entry that was read last, or could not be read, begins
+    bool cutShort;            // the file ends inside that entry
+};
+
+// Reads the next entry of the walk without filters. Returns 0, also when names did not fit;
+// END_OF_FILE, with cutShort telling whether the file ends inside an entry after all; or another
+// code of sqluhReadEntry or of a seek.
+int sqluhNextEntry(SQLUH_ENTRYWALK* walk);
 
 // --- The handle ----------------------------------------------------------------------------------
 
@@ -373,6 +441,25 @@ int sqluhCreate(char* directory);
 int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOut, char* directory,
                                                          bool optToRecover);
 
+// What the examination of a file of the pair found.
+struct SQLUH_FILESTATE {
+    bool usable; // the header reads and its status is blank or 'C'
+    char status; // of the header; zero when it could not be read
+};
+
+SQLUH_FILESTATE sqluhStateOfFile(int rc, const SQLUH_HEADER* header); // rc: of reading the header
+
+// Tells the repair that the states of history file and shadow ask for. Files that need none, or
+// that a repair has been made of, must agree in size and both have a readable header, or the shadow
+// is rebuilt.
+enum sqluhRepair {
+    sqluhRepairNone,
+    sqluhRepairShadow,  // the shadow is rebuilt from the history file
+    sqluhRepairHistory, // the history file is rebuilt from the shadow
+    sqluhRepairAnew,    // neither can be used: both are moved aside and an empty pair is made
+};
+sqluhRepair sqluhDecideRepair(SQLUH_FILESTATE history, SQLUH_FILESTATE shadow);
+
 // Tells whether the directory's history can be used; repairs nothing, but takes the lock, for which
 // it creates an empty history file where there is none.
 bool sqluhCheckIfHistoryFilesAreUseable(char* directory);
@@ -402,7 +489,7 @@ int sqluh_history_file_get_size(char* directory, char* fileName, unsigned long l
 
 // Verification reads entries and repairs nothing. workArea: as for sqluhReadEntry.
 //
-// Checks the entry at the file's position and leaves the file behind it. Returns 0 or a failure of
+// Checks the entry at the file's position and leaves the file after it. Returns 0 or a failure of
 // sqluhReadEntry: END_OF_FILE when no entry is left.
 int sqluhVerifyOneEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
 
@@ -420,7 +507,7 @@ int sqluh_verify_history_files(SQLUH_HANDLE* handle);
 // sqluhVerifyOneEntry, but leaves the position as it was. Returns its codes or a seek's.
 int sqluhVerifyCurrentEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea);
 
-// Checks that offset is not behind the end of the file and leaves the position as it was. Returns
+// Checks that offset is not past the end of the file and leaves the position as it was. Returns
 // 0; END_OF_FILE when it is; a seek's code. A file whose end cannot be told passes.
 int sqluhVerifySeekOffsetNotPastEOF(SQLO_FHANDLE fileHandle, long long offset);
 

@@ -1,90 +1,16 @@
-// Reading entries.
+// Reading entries: read and proven first, then taken out. Stands on the primitives and on the fixed
+// part.
+
+#include "history/sqluhred.h"
 
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
-#include "history/sqluhcol.h"
-#include "history/sqluhfix.h"
-#include "history/sqluhist.h"
-#include "history/sqluhlog.h"
+#include "history/sqluhColumns.h"
+#include "history/sqluhDiagnostics.h"
 
-// --- The fixed part ------------------------------------------------------------------------------
-
-// The caller's numbers and letters, which a scan that stops early leaves as they were.
-static void fixedFromEntry(sqluhFixedPart* fixed, const SQLUH_ENTRY* entry)
-{
-    const zq3HistoryData* data = entry->data;
-    fixed->checksum = entry->checksum;
-    fixed->size = entry->size;
-    fixed->version = entry->version;
-    fixed->noteLength = entry->noteLength;
-    fixed->longTextLength = entry->longTextLength;
-    fixed->qualifierLength = entry->qualifierLength;
-    fixed->nameLength = entry->nameLength;
-    fixed->sqlcaLength = entry->sqlcaLength;
-    fixed->commandLength = entry->commandLength;
-    fixed->entryNode = data->entryNode;
-    fixed->entryNumber = data->entryNumber;
-    fixed->numTablespaces = data->numTablespaces;
-    fixed->status = data->status;
-    fixed->operation = data->operation;
-    fixed->object = data->object;
-    fixed->operationType = data->operationType;
-    fixed->auxCode = data->auxCode;
-}
-
-static void entryFromFixed(SQLUH_ENTRY* entry, const sqluhFixedPart* fixed)
-{
-    zq3HistoryData* data = entry->data;
-    entry->checksum = fixed->checksum;
-    entry->size = fixed->size;
-    entry->version = fixed->version;
-    entry->noteLength = fixed->noteLength;
-    entry->longTextLength = fixed->longTextLength;
-    entry->qualifierLength = fixed->qualifierLength;
-    entry->nameLength = fixed->nameLength;
-    entry->sqlcaLength = fixed->sqlcaLength;
-    entry->commandLength = fixed->commandLength;
-    data->entryNode = fixed->entryNode;
-    data->entryNumber = fixed->entryNumber;
-    data->numTablespaces = fixed->numTablespaces;
-    data->status = fixed->status;
-    data->operation = fixed->operation;
-    data->object = fixed->object;
-    data->operationType = fixed->operationType;
-    data->auxCode = fixed->auxCode;
-}
-
-static char blankForEmpty(char letter)
-{
-    return letter == SQLUH_EMPTY_WORD[0] ? ' ' : letter;
-}
-
-static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedPart* fixed)
-{
-    int found = entryFieldCount;
-    if (!sqluhTakeCanonicalFixedPart(text, fixed)) {
-        fixedFromEntry(fixed, entry);
-        found = sqluhScanFixedPart(text, fixed);
-    }
-    entryFromFixed(entry, fixed);
-    if (found < static_cast<int>(entryFieldCount)) {
-        logRecord({textItem(TEXT_ENTRY_FIELDS), numberItem(TEXT_ENTRY_FIELDS_READ, found),
-                   dataItem("", text, entryFixedLength)});
-        return HISTORY_FILE_DAMAGED;
-    }
-    zq3HistoryData* data = entry->data;
-    data->object = blankForEmpty(data->object);
-    data->operationType = blankForEmpty(data->operationType);
-    data->auxCode = blankForEmpty(data->auxCode);
-    if (entry->size < entryMinLength) {
-        logRecord({textItem(TEXT_ENTRY_LENGTHS), numberItem("Size field: ", entry->size),
-                   dataItem("", text, entryFixedLength)});
-        return HISTORY_FILE_DAMAGED;
-    }
-    return 0;
-}
+static constexpr char readEntry[] = "sqluhReadEntry"; // the operation that the log names
 
 // --- The bytes of an entry -----------------------------------------------------------------------
 
@@ -103,10 +29,17 @@ int sqluhInitWorkArea(SQLUH_WORKAREA* workArea, uint32_t size)
     return rc;
 }
 
-static int readFixedPart(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea)
+static char blankForEmpty(char letter)
+{
+    return letter == SQLUH_EMPTY_WORD[0] ? ' ' : letter;
+}
+
+static int readFixedPart(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, bool* begun,
+                         const char* operation)
 {
     uint32_t bytesRead = 0;
     int rc = sqloread(fh, workArea->buffer, entryFixedLength, &bytesRead);
+    *begun = bytesRead != 0;
     if (rc == 0 && bytesRead == entryFixedLength)
         return 0;
     if (rc == END_OF_FILE && (bytesRead == 0 || bytesRead == entryFixedLength))
@@ -114,14 +47,38 @@ static int readFixedPart(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea)
     bool partial = rc == END_OF_FILE || rc == 0;
     logRecord({textItem(partial ? TEXT_ENTRY_PARTIAL : TEXT_ENTRY_READ), codeItem("rc = ", rc),
                numberItem("Bytes read: ", bytesRead),
-               dataItem("", workArea->buffer, entryFixedLength)});
-    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
+               dataItem("", workArea->buffer, entryFixedLength)},
+              operation);
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), operation);
+}
+
+static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* words,
+                          const char* operation)
+{
+    int found = sqluhTakeFixedPart(text, entry, words);
+    if (found < static_cast<int>(entryFieldCount)) {
+        logRecord({textItem(TEXT_ENTRY_FIELDS), numberItem(TEXT_ENTRY_FIELDS_READ, found),
+                   dataItem("", text, entryFixedLength)},
+                  operation);
+        return HISTORY_FILE_DAMAGED;
+    }
+    zq3HistoryData* data = entry->data;
+    data->object = blankForEmpty(data->object);
+    data->operationType = blankForEmpty(data->operationType);
+    data->auxCode = blankForEmpty(data->auxCode);
+    if (entry->size < entryMinLength) {
+        logRecord({textItem(TEXT_ENTRY_LENGTHS), numberItem("Size field: ", entry->size),
+                   dataItem("", text, entryFixedLength)},
+                  operation);
+        return HISTORY_FILE_DAMAGED;
+    }
+    return 0;
 }
 
 // Grows the work area for an entry of size bytes, but to no more than the file still holds: a
 // damaged size must not ask for memory. *readable receives how much of the body can be asked for.
 static int growWorkArea(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size,
-                        uint32_t* readable)
+                        uint32_t* readable, const char* operation)
 {
     long long here = 0;
     long long end = 0;
@@ -131,7 +88,7 @@ static int growWorkArea(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size
     if (rc == 0)
         rc = sqloseek(fh, here, sqloFromStart, nullptr);
     if (rc != 0)
-        return logged(rc);
+        return logged(rc, operation);
 
     uint64_t left = end > here ? static_cast<uint64_t>(end - here) : 0;
     if (left < size - entryFixedLength)
@@ -140,7 +97,8 @@ static int growWorkArea(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size
     if (needed <= workArea->size)
         return 0;
     void* block = workArea->buffer;
-    rc = logged(sqloMemBlockReallocate(&block, needed, sqloZeroFilled, __FILE__, __LINE__));
+    rc = logged(sqloMemBlockReallocate(&block, needed, sqloZeroFilled, __FILE__, __LINE__),
+                operation);
     if (rc == 0) {
         workArea->buffer = static_cast<char*>(block);
         workArea->size = needed;
@@ -148,12 +106,12 @@ static int growWorkArea(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size
     return rc;
 }
 
-static int readBody(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size)
+static int readBody(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size, const char* operation)
 {
     uint32_t wanted = size - entryFixedLength;
     uint32_t readable = wanted;
     if (size > workArea->size) {
-        int rc = growWorkArea(fh, workArea, size, &readable);
+        int rc = growWorkArea(fh, workArea, size, &readable, operation);
         if (rc != 0)
             return rc;
     }
@@ -170,33 +128,35 @@ static int readBody(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, uint32_t size)
     if (partial && (bytesRead == 0 || (rc != 0 && bytesRead == wanted)))
         return END_OF_FILE;
     logRecord({textItem(partial ? TEXT_BODY_PARTIAL : TEXT_BODY_READ), codeItem("rc = ", rc),
-               numberItem("Bytes read: ", bytesRead), dataItem("", body, bytesRead)});
-    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
+               numberItem("Bytes read: ", bytesRead), dataItem("", body, bytesRead)},
+              operation);
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), operation);
 }
 
-static int checkEntryChecksum(SQLUH_WORKAREA* workArea, const SQLUH_ENTRY* entry)
+static int checkEntryChecksum(SQLUH_WORKAREA* workArea, const SQLUH_ENTRY* entry,
+                              const char* operation)
 {
     memset(workArea->buffer, 0, entryFields[fieldChecksum].width);
     uint32_t computed = sqluhChecksum(workArea->buffer, entry->size);
     if (computed == entry->checksum)
         return 0;
     logRecord({codeItem(TEXT_ENTRY_CHECKSUM, static_cast<int>(entry->checksum)),
-               codeItem(TEXT_ENTRY_OBSERVED, static_cast<int>(computed))});
+               codeItem(TEXT_ENTRY_OBSERVED, static_cast<int>(computed))},
+              operation);
     return HISTORY_FILE_DAMAGED;
 }
 
-// --- The sections of an entry --------------------------------------------------------------------
+// --- Proving an entry ----------------------------------------------------------------------------
 
-// Where the sections behind the long text begin and what they take. A matching checksum does not
-// make the lengths true: they are held against size here, in 64 bits, before anything is read by
-// them.
-struct sectionPlan {
-    uint32_t objectNamesAt;
-    uint32_t tablespacesAt;
-    uint32_t tablespacesEnd; // at most: the sqlca line and the command lines still fit behind it
-};
+static int damagedLengths(const SQLUH_ENTRY* entry, const char* operation)
+{
+    logRecord({textItem(TEXT_ENTRY_LENGTHS), numberItem("Size field: ", entry->size)}, operation);
+    return HISTORY_FILE_DAMAGED;
+}
 
-static bool planSections(const SQLUH_ENTRY* entry, sectionPlan* plan)
+// A matching checksum does not make the lengths true: they are held against size here, in 64 bits,
+// before anything is read by them.
+static int planSections(const SQLUH_ENTRY* entry, sqluhProvenEntry* proven, const char* operation)
 {
     uint64_t at = entry->longTextLength != 0 ? entryLongTextAt + lineLength : entryLongTextAt;
     uint64_t objectNames = 0;
@@ -210,12 +170,29 @@ static bool planSections(const SQLUH_ENTRY* entry, sectionPlan* plan)
             uint64_t{entry->commandLength} + (entry->commandLength - 1) / commandPieceLength + 1;
     uint64_t least = uint64_t{entry->data->numTablespaces} * tablespaceLineExtra;
     if (at + objectNames + least + tail > entry->size)
-        return false;
-    plan->objectNamesAt = static_cast<uint32_t>(at);
-    plan->tablespacesAt = static_cast<uint32_t>(at + objectNames);
-    plan->tablespacesEnd = static_cast<uint32_t>(entry->size - tail);
-    return true;
+        return damagedLengths(entry, operation);
+    proven->objectNamesAt = static_cast<uint32_t>(at);
+    proven->tablespacesAt = static_cast<uint32_t>(at + objectNames);
+    proven->tablespacesEnd = static_cast<uint32_t>(entry->size - tail);
+    return 0;
 }
+
+int sqluhProveEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
+                    sqluhProvenEntry* proven, const char* operation)
+{
+    int rc = readFixedPart(fh, workArea, &proven->begun, operation);
+    if (rc == 0)
+        rc = parseFixedPart(workArea->buffer, entry, &proven->words, operation);
+    if (rc == 0)
+        rc = readBody(fh, workArea, entry->size, operation);
+    if (rc == 0)
+        rc = checkEntryChecksum(workArea, entry, operation);
+    if (rc == 0)
+        rc = planSections(entry, proven, operation);
+    return rc;
+}
+
+// --- Taking an entry out -------------------------------------------------------------------------
 
 static void copyText(textBuffer* target, const char* text, size_t length)
 {
@@ -245,7 +222,7 @@ static unsigned int compareTimestamp(const char* filter, const char* timestamp)
     return order < 0 ? matchFilterEarlier : order > 0 ? matchFilterLater : matchFilterEqual;
 }
 
-static void takeLogPosition(const char* text, uint8_t* position)
+static void parseLogPosition(const char* text, uint8_t* position)
 {
     memset(position, 0, sizeof zq3HistoryData::logPosition);
     for (uint32_t group = 0; group < 3; group++) {
@@ -257,14 +234,18 @@ static void takeLogPosition(const char* text, uint8_t* position)
     }
 }
 
-static void takeLine2(zq3HistoryData* data, const sqluhFixedPart* fixed)
+static void takeLine2(zq3HistoryData* data, const sqluhFixedWords* words)
 {
-    copyWord(&data->objectPart, fixed->objectPart, SQLUH_EMPTY_TIMESTAMP);
-    copyWord(&data->secondTimestamp, fixed->secondTimestamp, SQLUH_EMPTY_TIMESTAMP);
-    copyWord(&data->firstText, fixed->firstText, SQLUH_EMPTY_WORD);
-    copyWord(&data->lastText, fixed->lastText, SQLUH_EMPTY_WORD);
-    takeLogPosition(fixed->logPosition, data->logPosition);
-    copyWord(&data->idText, fixed->idText, SQLUH_EMPTY_WORD);
+    for (unsigned int field = fieldObjectPart; field < fieldAuxCode; field++) {
+        const sqluhEntryField& row = entryFields[field];
+        char* member = reinterpret_cast<char*>(data) + row.member;
+        const char* word = wordOfField(words, field);
+        if (row.kind == kindLogPosition)
+            parseLogPosition(word, data->logPosition);
+        else
+            copyWord(reinterpret_cast<textBuffer*>(member), word,
+                     row.kind == kindTimestamp ? SQLUH_EMPTY_TIMESTAMP : SQLUH_EMPTY_WORD);
+    }
 }
 
 static void takeNoteAndLongText(SQLUH_ENTRY* entry, char* record)
@@ -323,28 +304,24 @@ static uint64_t tablespaceLength(const char* line)
     return sscanf(digits, "%8x", &length) == 1 ? length : noTablespaceLength;
 }
 
-// The name of the tablespace line at at, ended where its line feed stood, and its length; null when
-// the line does not fit before end or has no length. Starts with *head 0, which is no number.
+// Tells whether the tablespace line at at has a length and fits before end. Starts with *head 0,
+// which is no number.
 //
 // Neighbouring names often have one length. Comparing the head with the last one lets the processor
 // go on with the next line before this one's number is known.
-static inline char* nextTablespace(char* at, const char* end, uint64_t* head, uint64_t* length)
+static inline bool tablespaceFits(const char* at, const char* end, uint64_t* head, uint64_t* length)
 {
     if (end - at < static_cast<ptrdiff_t>(tablespaceLineExtra))
-        return nullptr;
+        return false;
     uint64_t digits = columnsAt(at);
     if (digits != *head)
         *length = tablespaceLength(at);
     *head = digits;
-    if (static_cast<uint64_t>(end - at) < *length + tablespaceLineExtra)
-        return nullptr;
-    char* name = at + tablespaceNameAt;
-    name[*length] = '\0';
-    return name;
+    return static_cast<uint64_t>(end - at) >= *length + tablespaceLineExtra;
 }
 
 // Takes count tablespace lines from at to at most end, storing the first of them in buffers.
-// Returns the place behind them, or null when a line is damaged.
+// Returns the place after them, or null when a line is damaged.
 static char* takeTablespaces(char* at, const char* end, uint32_t count, textBuffer* buffers,
                              uint32_t stored, const char* filter, unsigned int* flags)
 {
@@ -353,9 +330,10 @@ static char* takeTablespaces(char* at, const char* end, uint32_t count, textBuff
     uint64_t head = 0;
     uint64_t length = noTablespaceLength;
     for (uint32_t i = 0; i < count; i++) {
-        char* name = nextTablespace(at, end, &head, &length);
-        if (name == nullptr)
+        if (!tablespaceFits(at, end, &head, &length))
             return nullptr;
+        char* name = at + tablespaceNameAt;
+        name[length] = '\0';
         if (i < stored)
             copyText(&buffers[i], name, zeroFree ? static_cast<size_t>(length) : strlen(name));
         if (filter != nullptr && strcmp(name, filter) == 0)
@@ -365,19 +343,23 @@ static char* takeTablespaces(char* at, const char* end, uint32_t count, textBuff
     return at;
 }
 
-// The same when nobody wants a name: the lines still have to be sound.
-static char* passTablespaces(char* at, const char* end, uint32_t count)
+int sqluhPassTablespaces(const SQLUH_ENTRY* entry, const SQLUH_WORKAREA* workArea,
+                         sqluhProvenEntry* proven, const char* operation)
 {
+    const char* at = workArea->buffer + proven->tablespacesAt;
+    const char* end = workArea->buffer + proven->tablespacesEnd;
     uint64_t head = 0;
     uint64_t length = noTablespaceLength;
-    for (uint32_t i = 0; i < count && at != nullptr; i++) {
-        char* name = nextTablespace(at, end, &head, &length);
-        at = name != nullptr ? name + length + 1 : nullptr;
+    for (uint32_t i = 0; i < entry->data->numTablespaces; i++) {
+        if (!tablespaceFits(at, end, &head, &length))
+            return damagedLengths(entry, operation);
+        at += length + tablespaceLineExtra;
     }
-    return at;
+    proven->tailAt = static_cast<uint32_t>(at - workArea->buffer);
+    return 0;
 }
 
-// A number of the sqlca line. width: 10 or 11. Straight digits behind an optional sign are what the
+// A number of the sqlca line. width: 10 or 11. Straight digits after an optional sign are what the
 // writer writes.
 static int32_t signedNumberAt(const char* text, uint32_t width)
 {
@@ -449,34 +431,25 @@ struct entryFilters {
     const char* tablespace;
 };
 
-// Takes everything behind the fixed part, in the record's order.
-static int takeSections(SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea, const sqluhFixedPart* fixed,
+// Takes everything after the fixed part out of a proven entry, in the record's order.
+static int takeSections(SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea, sqluhProvenEntry* proven,
                         const entryFilters* filters, uint32_t maxTablespaces, unsigned int* flags)
 {
     zq3HistoryData* data = entry->data;
     char* record = workArea->buffer;
-    sectionPlan plan = {};
-    char* at = nullptr;
-    if (planSections(entry, &plan)) {
-        if (filters->timestamp != nullptr)
-            *flags |= compareTimestamp(filters->timestamp, fixed->objectPart);
-        takeNoteAndLongText(entry, record);
-        takeLine2(data, fixed);
+    const char* end = record + proven->tablespacesEnd;
+    uint32_t stored = data->tablespaceBuffers != nullptr ? maxTablespaces : 0;
+    if (filters->timestamp != nullptr)
         *flags |=
-            takeObjectNames(entry, record + plan.objectNamesAt, filters->qualifier, filters->name);
-        uint32_t stored = data->tablespaceBuffers != nullptr ? maxTablespaces : 0;
-        at = record + plan.tablespacesAt;
-        const char* end = record + plan.tablespacesEnd;
-        if (stored == 0 && filters->tablespace == nullptr)
-            at = passTablespaces(at, end, data->numTablespaces);
-        else
-            at = takeTablespaces(at, end, data->numTablespaces, data->tablespaceBuffers, stored,
-                                 filters->tablespace, flags);
-    }
-    if (at == nullptr) {
-        logRecord({textItem(TEXT_ENTRY_LENGTHS), numberItem("Size field: ", entry->size)});
-        return HISTORY_FILE_DAMAGED;
-    }
+            compareTimestamp(filters->timestamp, wordOfField(&proven->words, fieldObjectPart));
+    takeNoteAndLongText(entry, record);
+    takeLine2(data, &proven->words);
+    *flags |=
+        takeObjectNames(entry, record + proven->objectNamesAt, filters->qualifier, filters->name);
+    char* at = takeTablespaces(record + proven->tablespacesAt, end, data->numTablespaces,
+                               data->tablespaceBuffers, stored, filters->tablespace, flags);
+    if (at == nullptr)
+        return damagedLengths(entry, readEntry);
     if (entry->sqlcaLength != 0) {
         *flags |= takeSqlca(data->eventSqlca, at);
         at += sqlcaLineLength;
@@ -489,12 +462,48 @@ static int takeSections(SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea, const sqlu
 }
 
 // What is said about every entry that could not be read, whatever was found wrong with it.
-static void logUnreadableEntry(long long offset, const SQLUH_WORKAREA* workArea)
+static void logUnreadable(int rc, long long offset, const SQLUH_WORKAREA* workArea)
 {
-    pdLogPrintf("sqluhReadEntry", pdLevelError, TEXT_ENTRY_OFFSET, offset);
-    sqlt_logadmin("sqluhReadEntry", pdAdminReadFailed);
+    if (rc >= 0 || rc == END_OF_FILE)
+        return;
+    pdLogPrintf(readEntry, pdLevelError, TEXT_ENTRY_OFFSET, offset);
+    sqlt_logadmin(readEntry, pdAdminReadFailed);
     if (workArea->buffer != nullptr)
-        sqlt_logerr_data("sqluhReadEntry", TEXT_ENTRY_DUMP, workArea->buffer, workArea->size);
+        sqlt_logerr_data(readEntry, TEXT_ENTRY_DUMP, workArea->buffer, workArea->size);
+}
+
+int sqluhCheckEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea)
+{
+    sqluhProvenEntry proven;
+    long long offset = 0;
+    sqloseek(fh, 0, sqloFromCurrent, &offset);
+    int rc = sqluhProveEntry(fh, entry, workArea, &proven, readEntry);
+    if (rc == 0)
+        rc = sqluhPassTablespaces(entry, workArea, &proven, readEntry);
+    logUnreadable(rc, offset, workArea);
+    return rc;
+}
+
+// Reads the entry at the file's position in full. *offset receives where it begins, *begun whether
+// the file holds anything there.
+static int readWholeEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
+                          const entryFilters* filters, unsigned int* flags, long long* offset,
+                          bool* begun)
+{
+    uint32_t maxTablespaces = entry->data->maxTablespaces;
+    sqluhProvenEntry proven;
+    *flags = 0;
+    // For the message: a file that cannot tell its position fails the read that follows.
+    sqloseek(fh, 0, sqloFromCurrent, offset);
+
+    int rc = sqluhProveEntry(fh, entry, workArea, &proven, readEntry);
+    if (rc == 0)
+        rc = takeSections(entry, workArea, &proven, filters, maxTablespaces, flags);
+    if (rc == 0 && entry->data->numTablespaces > maxTablespaces)
+        rc = TABLESPACE_LIST_TRUNCATED;
+    logUnreadable(rc, *offset, workArea);
+    *begun = proven.begun;
+    return rc;
 }
 
 int sqluhReadEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
@@ -504,26 +513,26 @@ int sqluhReadEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea
     pdtEntry();
 
     const entryFilters filters = {timestampFilter, qualifierFilter, nameFilter, tablespaceFilter};
-    uint32_t maxTablespaces = entry->data->maxTablespaces;
-    sqluhFixedPart fixed;
     long long offset = 0;
-    *matchFlags = 0;
-    // For the message only: a file that cannot tell its position fails the read that follows.
-    sqloseek(fh, 0, sqloFromCurrent, &offset);
+    bool begun = false;
+    int rc = readWholeEntry(fh, entry, workArea, &filters, matchFlags, &offset, &begun);
 
-    int rc = readFixedPart(fh, workArea);
-    if (rc == 0)
-        rc = parseFixedPart(workArea->buffer, entry, &fixed);
-    if (rc == 0)
-        rc = readBody(fh, workArea, entry->size);
-    if (rc == 0)
-        rc = checkEntryChecksum(workArea, entry);
-    if (rc == 0)
-        rc = takeSections(entry, workArea, &fixed, &filters, maxTablespaces, matchFlags);
-    if (rc == 0 && entry->data->numTablespaces > maxTablespaces)
-        rc = TABLESPACE_LIST_TRUNCATED;
-    if (rc < 0 && rc != END_OF_FILE)
-        logUnreadableEntry(offset, workArea);
+    pdtExit(rc);
+    return rc;
+}
+
+int sqluhNextEntry(SQLUH_ENTRYWALK* walk)
+{
+    pdtEntry();
+
+    static constexpr entryFilters noFilters = {nullptr, nullptr, nullptr, nullptr};
+    unsigned int flags = 0;
+    int rc = readWholeEntry(walk->file, walk->entry, walk->workArea, &noFilters, &flags,
+                            &walk->offset, &walk->cutShort);
+    // The reader's end of the file may also lie between an entry's fixed part and its body.
+    walk->cutShort = walk->cutShort && rc == END_OF_FILE;
+    if (rc == TABLESPACE_LIST_TRUNCATED)
+        rc = 0;
 
     pdtExit(rc);
     return rc;

@@ -1,21 +1,16 @@
-// Verification: reads entries and repairs nothing.
+// Verification: reads entries and repairs nothing. Stands on the readers of header and entries.
 
-#include "history/sqluhist.h"
-#include "history/sqluhlog.h"
+#include "history/sqluhDiagnostics.h"
+#include "history/sqluhred.h"
 
 int sqluhVerifyOneEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea)
 {
     pdtEntry();
 
-    // No buffers and no room for names: the entry is checked, nothing of it is stored.
     zq3HistoryData data = {};
     SQLUH_ENTRY entry = {};
     entry.data = &data;
-    unsigned int flags = 0;
-    int rc =
-        sqluhReadEntry(fileHandle, &entry, workArea, nullptr, nullptr, nullptr, nullptr, &flags);
-    if (rc == TABLESPACE_LIST_TRUNCATED)
-        rc = 0;
+    int rc = sqluhCheckEntry(fileHandle, &entry, workArea);
     if (rc != END_OF_FILE)
         loggedPlain(rc);
 

@@ -1,65 +1,12 @@
-// Writing: the header and the entries.
+// Writing entries. Stands on the primitives and on the recording of a batch's writes.
 
 #include <cstdio>
 #include <cstring>
 
+#include "history/sqluhDiagnostics.h"
 #include "history/sqluhist.h"
-#include "history/sqluhlog.h"
 
-// --- The header ----------------------------------------------------------------------------------
-
-static int formatHeader(char* buffer, const SQLUH_HEADER* header)
-{
-    return sqluhSprintf(
-        buffer, headerFormat, header->checksum, static_cast<unsigned long long>(header->offset1),
-        static_cast<unsigned long long>(header->offset2),
-        static_cast<unsigned long long>(header->offset3), header->entryCount, header->number6,
-        header->number7, header->number8, header->number9, header->number10, header->number11,
-        header->nodeNumber, header->status, header->version, header->number15, header->timestamp,
-        header->maxCommandLength, " ", " ", " ", " ");
-}
-
-static int writeHeaderText(SQLO_FHANDLE fh, const char* buffer)
-{
-    uint32_t written = 0;
-    int rc = logged(sqlowrite(fh, buffer, headerLength, &written));
-    if (rc == 0 && written == headerLength)
-        return 0;
-    if (rc == DISK_FULL)
-        sqlt_logadmin("sqluhWriteHeader", pdAdminDiskFull);
-    // A header cut short with no code for it is a damaged header.
-    return rc != 0 ? transferCode(rc) : logged(HISTORY_FILE_DAMAGED);
-}
-
-int sqluhWriteHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
-{
-    pdtEntry();
-
-    void* block = nullptr;
-    int rc = logged(allocateZeroed(headerLength + 1, &block));
-    if (rc == 0) {
-        char* buffer = static_cast<char*>(block);
-        header->version = currentVersion;
-        header->checksum = 0;
-        header->checksum = sqluhChecksum(header, headerImageLength);
-        rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr));
-        if (rc == 0) {
-            int length = formatHeader(buffer, header);
-            if (length != static_cast<int>(headerLength)) {
-                rc = HISTORY_FILE_DAMAGED;
-                logRecord({codeItem("rc = ", rc), numberItem("Length: ", length)});
-            }
-        }
-        if (rc == 0)
-            rc = writeHeaderText(fh, buffer);
-        sqlofmblkEx(block);
-    }
-
-    pdtExit(rc);
-    return rc;
-}
-
-// --- The entry -----------------------------------------------------------------------------------
+static constexpr char writeEntry[] = "sqluhWriteEntry"; // the operation that the log names
 
 // The record being formatted. length counts what the sections come to, also where they no longer
 // fit, so that the mismatch with size can be told in full; nothing is formatted past text[size].
@@ -196,7 +143,7 @@ static void formatSqlca(entryText* record, const sqlca* event)
         memcpy(at, line, static_cast<uint32_t>(length));
 }
 
-// A text that is shorter than its length is padded; nothing behind its end is read.
+// A text that is shorter than its length is padded; nothing after its end is read.
 static void formatCommand(entryText* record, const SQLUH_ENTRY* entry)
 {
     const char* text = textOf(&entry->data->commandText);
@@ -230,9 +177,10 @@ static int refuseSizeMismatch(const entryText* record)
     char message[81] = {};
     sqluhSprintf(message, TEXT_ENTRY_SIZE, static_cast<int>(record->length),
                  static_cast<int>(record->size));
-    logRecord({textItem(message), codeItem("rc = ", HISTORY_FILE_DAMAGED)});
+    logRecord({textItem(message), codeItem("rc = ", HISTORY_FILE_DAMAGED)}, writeEntry);
+    sqltError(writeEntry, HISTORY_FILE_DAMAGED);
     if (record->text != nullptr)
-        sqlt_logerr_data("sqluhWriteEntry", TEXT_ENTRY_DUMP, record->text, record->size);
+        sqlt_logerr_data(writeEntry, TEXT_ENTRY_DUMP, record->text, record->size);
     return HISTORY_FILE_DAMAGED;
 }
 
@@ -249,12 +197,14 @@ static int writeEntryText(SQLUH_HANDLE* handle, const entryText* record)
 {
     long long offset = 0;
     uint32_t written = 0;
-    int rc = logged(sqloseek(handle->fileHandle, 0, sqloFromCurrent, &offset));
+    int rc = logged(sqloseek(handle->fileHandle, 0, sqloFromCurrent, &offset), writeEntry);
     if (rc != 0)
         return rc;
-    rc = logged(sqlowrite(handle->fileHandle, record->text, record->size, &written));
+    rc = logged(sqlowrite(handle->fileHandle, record->text, record->size, &written), writeEntry);
     if (rc == DISK_FULL)
-        sqlt_logadmin("sqluhWriteEntry", pdAdminDiskFull);
+        sqlt_logadmin(writeEntry, pdAdminDiskFull);
+    if (rc == 0 && written != record->size)
+        sqltError(writeEntry, transferCode(rc)); // not logged: the caller is told
     if (rc != 0 || written != record->size)
         return transferCode(rc);
 
@@ -263,7 +213,7 @@ static int writeEntryText(SQLUH_HANDLE* handle, const entryText* record)
     if (recorded != 0) {
         // The record is in the file; the end of the batch copies the whole file instead.
         handle->replayArea.replayDisabled = 1;
-        sqltError("sqluhWriteEntry", recorded);
+        sqltError(writeEntry, recorded);
     }
     return 0;
 }

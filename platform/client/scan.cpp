@@ -13,7 +13,7 @@
 
 // SQLCODEs of this library's own.
 enum : int {
-    scanNoMoreEntries = 100, // a get behind the last entry
+    scanNoMoreEntries = 100, // a get after the last entry
     scanNoDatabase = HISTORY_FILE_MISSING,
     scanWrongVersion = -2040,  // the version is not zq3Version
     scanWrongArgument = -2041, // a null record, or a member that has no such value
@@ -32,7 +32,7 @@ struct historyScan {
     historySnapshot snapshot;
     SQLUH_WORKAREA workArea;
     uint32_t rowsLeft;
-    int failure;                      // the code of a get that failed: nothing can be got behind it
+    int failure;                      // the code of a get that failed: nothing can be got after it
     const zq3HistoryData* lastRecord; // the record of the last get
     uint32_t filledSlots;             // name slots that the last get filled in it
 };
@@ -44,7 +44,7 @@ static historyScan* scans[maxScans];
 static uint16_t lastUse[maxScans];
 static pthread_mutex_t scansMutex = PTHREAD_MUTEX_INITIALIZER;
 
-static int fail(sqlca* ca, int sqlcode)
+static int failCall(sqlca* ca, int sqlcode)
 {
     if (ca != nullptr) {
         sqloinca(ca);
@@ -69,7 +69,7 @@ static bool isAliasCharacter(char c)
 }
 
 // The alias in upper case; false when it is no plain name and must not become part of a path.
-static bool takeAlias(const char* alias, char* name)
+static bool nameOfAlias(const char* alias, char* name)
 {
     size_t length = strnlen(alias, maxAliasLength + 1);
     if (length == 0 || length > maxAliasLength)
@@ -89,7 +89,7 @@ static bool takeAlias(const char* alias, char* name)
 static int findDirectory(const char* alias, char* directory)
 {
     char name[maxAliasLength + 1];
-    if (!takeAlias(alias, name))
+    if (!nameOfAlias(alias, name))
         return scanNoDatabase;
     const char* folder = getenv("ZQ3DBPATH");
     const char* separator = "/";
@@ -174,13 +174,13 @@ static int openScan(char* directory, historyScan** scanOut)
 ZQ3_EXPORT int zq3HistoryOpenScan(unsigned int version, void* openStruct, sqlca* ca)
 {
     if (version != zq3Version)
-        return fail(ca, scanWrongVersion);
+        return failCall(ca, scanWrongVersion);
     zq3HistoryOpenStruct* request = static_cast<zq3HistoryOpenStruct*>(openStruct);
     // Nothing selects entries here: whoever asks for some must not be given all of them.
     if (ca == nullptr || request == nullptr || request->databaseAlias == nullptr ||
         request->timestamp != nullptr || request->objectName != nullptr ||
         request->callerAction != 0)
-        return fail(ca, scanWrongArgument);
+        return failCall(ca, scanWrongArgument);
 
     char directory[pathCapacity];
     historyScan* scan = nullptr;
@@ -272,28 +272,28 @@ static int readNext(historyScan* scan, zq3HistoryData* record)
 ZQ3_EXPORT int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca* ca)
 {
     if (version != zq3Version)
-        return fail(ca, scanWrongVersion);
+        return failCall(ca, scanWrongVersion);
     zq3HistoryFetchStruct* request = static_cast<zq3HistoryFetchStruct*>(fetchStruct);
     if (ca == nullptr || request == nullptr || request->historyRecord == nullptr ||
         request->callerAction != 2)
-        return fail(ca, scanWrongArgument);
+        return failCall(ca, scanWrongArgument);
     historyScan* scan = findScan(request->handle, false);
     if (scan == nullptr)
-        return fail(ca, scanUnknownHandle);
+        return failCall(ca, scanUnknownHandle);
     return outcome(ca, readNext(scan, request->historyRecord));
 }
 
 ZQ3_EXPORT int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca)
 {
     if (version != zq3Version)
-        return fail(ca, scanWrongVersion);
+        return failCall(ca, scanWrongVersion);
     if (ca == nullptr || handle == nullptr)
-        return fail(ca, scanWrongArgument);
+        return failCall(ca, scanWrongArgument);
     uint16_t number;
     memcpy(&number, handle, sizeof number);
     historyScan* scan = findScan(number, true);
     if (scan == nullptr)
-        return fail(ca, scanUnknownHandle);
+        return failCall(ca, scanUnknownHandle);
     int rc = sqloclose(scan->snapshot.file);
     freeScan(scan);
     return outcome(ca, rc);

@@ -2,13 +2,10 @@
 //
 // A scan needs the number of its entries, and the largest number of names, before the first entry
 // is delivered, and the lock must not be held while the caller thinks. Two passes over the live
-// file would do without a copy: hopping over 100,000 entries of 2 KB takes 60 ms of processor time,
-// the copy 135 ms with its second reading and its removal, where reading the file once takes 65 ms.
-// The copy is taken all the same: a batch undone, a restore or a repair between two gets would turn
-// the rest of the scan into another history's entries, or into damage. It goes to a nameless file
-// among the temporary ones: in memory (memfd_create) the same takes 235 ms, and holds on to as much
-// memory as the file is long, where pages of a file can be written out. Counted while the copy is
-// made, the entries cost nothing more.
+// file would do without a copy; but a batch undone, a restore or a repair between two gets would
+// turn the rest of the scan into another history's entries, or into damage. The copy goes to a
+// nameless file among the temporary ones, whose pages can be written out. Counted while it is made,
+// the entries cost nothing more.
 #include "platform/client/snapshot.h"
 
 #include <cerrno>
@@ -20,7 +17,7 @@
 #include <sys/mman.h>
 #include <unistd.h>
 
-#include "history/sqluhcol.h"
+#include "history/sqluhColumns.h"
 
 static constexpr size_t copyLength = 256 * 1024;
 
@@ -35,7 +32,7 @@ struct entryCount {
     uint32_t rows;           // entries that begin before next
     uint32_t maxTablespaces; // names of one of them
     bool reader;             // the entry at next takes the library's reader
-    bool damaged;            // the last row counted cannot be whole: no entry is found behind it
+    bool damaged;            // the last row counted cannot be whole: no entry is found after it
 };
 
 // Reads an entry's size and number of names by column, when all columns up to there stand as the
@@ -63,7 +60,7 @@ static bool takeCounts(const char* line, uint32_t* size, uint32_t* numTablespace
 
 // A count that the entry's own size cannot hold belongs to a damaged entry, which no get will
 // deliver: the caller must not make room for it.
-static void countEntry(entryCount* count, uint32_t size, uint32_t numTablespaces)
+static void countRow(entryCount* count, uint32_t size, uint32_t numTablespaces)
 {
     count->rows++;
     count->damaged = size < entryMinLength || size > count->size - count->next;
@@ -80,7 +77,7 @@ static void countPiece(entryCount* count, const char* buffer, long long start, l
         uint32_t size = 0;
         uint32_t numTablespaces = 0;
         if (takeCounts(buffer + (count->next - start), &size, &numTablespaces))
-            countEntry(count, size, numTablespaces);
+            countRow(count, size, numTablespaces);
         else
             count->reader = true;
     }
@@ -128,20 +125,18 @@ static int copyAndCount(SQLO_FHANDLE from, int descriptor, char* buffer, entryCo
     return done == count->size ? 0 : HISTORY_FILE_DAMAGED;
 }
 
-// Counts on from an entry that is not written as the writer writes it. Behind the first one that
+// Counts on from an entry that is not written as the writer writes it. After the first one that
 // cannot be read nothing is found any more.
 static int countByReader(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, entryCount* count)
 {
+    zq3HistoryData data = {};
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    SQLUH_ENTRYWALK walk = {file, &entry, workArea, 0, false};
     int rc = sqloseek(file, count->next, sqloFromStart, nullptr);
     while (rc == 0 && count->next < count->size && !count->damaged) {
-        zq3HistoryData data = {};
-        SQLUH_ENTRY entry = {};
-        unsigned int flags = 0;
-        entry.data = &data;
-        int read =
-            sqluhReadEntry(file, &entry, workArea, nullptr, nullptr, nullptr, nullptr, &flags);
-        bool whole = read == 0 || read == TABLESPACE_LIST_TRUNCATED;
-        countEntry(count, whole ? entry.size : 0, data.numTablespaces);
+        bool whole = sqluhNextEntry(&walk) == 0;
+        countRow(count, whole ? entry.size : 0, data.numTablespaces);
     }
     return rc;
 }
@@ -221,10 +216,9 @@ static int settleSnapshot(SQLUH_WORKAREA* workArea, entryCount* count, historySn
     // What is left of an entry's first line: an entry all the same, or the scan would seem
     // complete.
     if (rc == 0 && count->next < count->size)
-        countEntry(count, 0, 0);
+        countRow(count, 0, 0);
     if (rc == 0)
         rc = sqloseek(snapshot->file, headerLength, sqloFromStart, nullptr);
-    snapshot->size = count->size;
     snapshot->numRows = count->rows;
     snapshot->maxTablespaces = count->maxTablespaces;
     return rc;

@@ -5,7 +5,6 @@
 
 struct historySnapshot {
     SQLO_FHANDLE file;       // the copy, at its first entry; no name leads to it
-    long long size;          // bytes
     uint32_t numRows;        // entries, with the damaged one that ends them, if any
     uint32_t maxTablespaces; // largest number of names that one entry lists
 };

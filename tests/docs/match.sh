@@ -69,7 +69,7 @@ same "fields of an entry in zq3rhist(5)" \
     grep -oP '\{\K\d+, \d+' | tr -d ,)" \
   "$(sed -n '/^\.Ss Entry/,/^\.El/p' man/zq3rhist.5 | grep -oP '^\.It \K\d+ Ta \d+ Ta \w+' |
     sed 's/ Ta / /;s/ Ta .*//')"
-mapfile -t texts < <(tr '\n' ' ' <history/sqluhlog.h |
+mapfile -t texts < <(tr '\n' ' ' <history/sqluhDiagnostics.h |
   grep -oP '#define TEXT_\w+[ \\]+"\K[^"%\\]*' | sed 's/ *$//; s/  / /g')
 holds docs/troubleshooting.md "${texts[@]}"
 

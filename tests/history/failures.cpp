@@ -138,7 +138,7 @@ TEST_F(Failures, EachIsReportedOnceAndLeavesWhatItShould)
             {{{osSeek, 2}, {osAllocate, 2}}, -2161, f + " | " + damaged + header, "at 1024"},
             {{{osSeek, 6}, {osAllocate, 3}}, failed, f + header, "at 1024"},
             {{{osRead, 5, END_OF_FILE}}, END_OF_FILE, end, "at 1024"},
-            {{{osSeek, 11}}, failed, f + header, "at 1792"}}},
+            {{{osSeek, 8}}, failed, f + header, "at 1792"}}},
         {[&] { uint32_t longest = 77; int rc = sqluhFindMaxCommandLen(fh, &longest);
                left << "longest " << longest << " "; return rc; }, {
             {{{osSeek}, {osAllocate}}, failed, f, "longest 0 at 1024"},

@@ -1,5 +1,8 @@
 // What every source of the library needs: the texts and records of the diagnostic log, and the
 // handling of codes.
+//
+// A record carries the name of the public operation that failed, wherever in it that was found: a
+// helper is handed the name. A null name logs nothing.
 #pragma once
 
 #include "history/sqluhist.h"
@@ -51,29 +54,30 @@ static inline pdItem dataItem(const char* label, const void* data, size_t size)
 
 template <unsigned int count>
 static inline void logRecord(const pdItem (&items)[count],
-                             const char* function = __builtin_FUNCTION())
+                             const char* operation = __builtin_FUNCTION())
 {
-    pdLog(function, pdLevelError, items, count);
+    if (operation != nullptr)
+        pdLog(operation, pdLevelError, items, count);
 }
 
-// Logs a code that is not 0 with the label of a failed call, and hands it back.
-static inline int logged(int rc, const char* function = __builtin_FUNCTION())
+// Logs a code that is not 0 under a label, and hands it back.
+static inline int loggedAs(const char* label, int rc, const char* operation)
 {
-    if (rc != 0) {
-        logRecord({codeItem("rc = ", rc)}, function);
-        sqltError(function, rc);
+    if (rc != 0 && operation != nullptr) {
+        logRecord({codeItem(label, rc)}, operation);
+        sqltError(operation, rc);
     }
     return rc;
 }
 
-// Logs a code that is not 0 without a label, and hands it back.
-static inline int loggedPlain(int rc, const char* function = __builtin_FUNCTION())
+// Logs a code that is not 0 with the label of a failed call, or without one, and hands it back.
+static inline int logged(int rc, const char* operation = __builtin_FUNCTION())
 {
-    if (rc != 0) {
-        logRecord({codeItem("", rc)}, function);
-        sqltError(function, rc);
-    }
-    return rc;
+    return loggedAs("rc = ", rc, operation);
+}
+static inline int loggedPlain(int rc, const char* operation = __builtin_FUNCTION())
+{
+    return loggedAs("", rc, operation);
 }
 
 // The first failure wins: a later code counts only when nothing failed before.

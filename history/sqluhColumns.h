@@ -7,17 +7,19 @@
 #pragma once
 
 #include <bit>
+#include <cstddef>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+
+// The file's words, and the header's image, are little-endian.
+static_assert(std::endian::native == std::endian::little);
 
 // The eight characters at text, the first in the lowest byte.
 static inline uint64_t columnsAt(const char* text)
 {
     uint64_t word;
     memcpy(&word, text, sizeof word);
-    if constexpr (std::endian::native == std::endian::big)
-        word = __builtin_bswap64(word);
     return word;
 }
 
@@ -114,8 +116,8 @@ static inline uint32_t wordColumns(const char* text, uint32_t count, uint64_t* s
     return static_cast<uint32_t>(flags * 0x0102040810204080 >> 56); // flag i moves to bit i
 }
 
-// The length of a field's text when it is one word of printable ASCII with blanks behind it up to
-// width (at most 24) and 7 more readable characters behind them; 0 when it is anything else.
+// The length of a field's text when it is one word of printable ASCII with blanks after it up to
+// width (at most 24), and 7 more characters may be read there; 0 when it is anything else.
 // Whatever a locale calls white space, the scanning format takes such a field the same way.
 template <uint32_t width> static inline uint32_t wordLength(const char* text)
 {
@@ -143,4 +145,37 @@ static inline void copyShort(char* target, const char* from, size_t length)
     } else {
         memcpy(target, from, length);
     }
+}
+
+// The place and the width that a format text gives to one of its conversions.
+struct formatPlace {
+    uint32_t at;
+    uint32_t width;
+};
+
+// Finds the conversion with this number, counted from 0, in a printing or scanning format whose
+// conversions all have their width, or are %c; past the last one, the length of the whole text.
+static constexpr formatPlace placeInFormat(const char* format, unsigned int number)
+{
+    formatPlace place = {0, 0};
+    for (; *format != '\0'; format++) {
+        place.at += place.width;
+        place.width = 1; // a character that stands for itself, or %c
+        if (*format != '%')
+            continue;
+        uint32_t digits = 0;
+        for (format++; *format == '-' || *format == '+'; format++)
+            continue;
+        for (; *format >= '0' && *format <= '9'; format++)
+            digits = digits * 10 + static_cast<uint32_t>(*format - '0');
+        for (; *format == '.' || (*format >= '0' && *format <= '9') || *format == 'h' ||
+               *format == 'l';
+             format++)
+            continue;
+        if (*format != 'c')
+            place.width = digits;
+        if (number-- == 0)
+            return place;
+    }
+    return {place.at + place.width, 0};
 }

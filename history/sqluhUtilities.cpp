@@ -1,10 +1,11 @@
-// Utilities: scan records, pieces of backup images, copies, warnings.
+// Utilities: scan records, pieces of backup images, copies, warnings. Stands on open and close.
 
 #include <cstring>
 
+#include "history/sqluhDiagnostics.h"
+#include "history/sqluhHandle.h"
 #include "history/sqluhfun.h"
 #include "history/sqluhist.h"
-#include "history/sqluhlog.h"
 
 enum : size_t { tablespaceSlot = 19 };
 
@@ -30,7 +31,7 @@ static constexpr size_t lengthOfTextSlots(void)
 }
 
 // The records come first and every one of them is a multiple of its own alignment, so that the
-// array behind the sqlca is aligned and the bytes at the end need no gaps.
+// array after the sqlca is aligned and the bytes at the end need no gaps.
 static_assert(sizeof(sqlca) % alignof(textBuffer) == 0);
 static_assert(sizeof(zq3HistoryData) % alignof(sqlca) == 0);
 
@@ -128,7 +129,7 @@ static int emptyFile(SQLUH_HANDLE* handle)
 }
 
 // Puts an empty file in the place of the history file.
-static int replaceHistoryFile(SQLUH_HANDLE* handle)
+static int replaceHistoryFile(SQLUH_HANDLE* handle, const char* operation)
 {
     int rc = sqloclose(handle->fileHandle);
     handle->fileHandle = sqloNoFile;
@@ -137,8 +138,8 @@ static int replaceHistoryFile(SQLUH_HANDLE* handle)
     if (rc == 0)
         rc = createdCode(sqloopenp(handle->historyPath, sqloOpenReplacement, sqloPermissions,
                                    &handle->fileHandle));
-    if (rc == 0 && handle->isLocked)
-        rc = sqluhLockFileAtPath(handle);
+    if (rc == 0)
+        rc = sqluhFollowLock(handle, operation);
     if (rc == 0)
         rc = emptyFile(handle);
     return rc;
@@ -153,7 +154,7 @@ int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsign
     int rc = 0;
     handle->restoredFromImage = true;
     if (offset == 0)
-        rc = replaceHistoryFile(handle);
+        rc = replaceHistoryFile(handle, __func__);
     if (rc == 0)
         rc = sqlochgfileptr(handle->fileHandle, offset, sqloFromStart, nullptr);
     if (rc == 0) {

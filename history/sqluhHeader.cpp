@@ -1,11 +1,24 @@
-// Reading the header, with the conversion of older versions.
+// The header: reading it, with the conversion of older versions, and writing it. Stands on the
+// primitives and on the reader of entries, which older headers send it to.
 
 #include <cstdio>
 #include <cstring>
 
-#include "history/sqluhcol.h"
+#include "history/sqluhColumns.h"
+#include "history/sqluhDiagnostics.h"
 #include "history/sqluhist.h"
-#include "history/sqluhlog.h"
+
+static_assert(placeInFormat(headerFormat, 13).at == headerVersionAt);
+static_assert(placeInFormat(headerFormat, 14).at == headerNumber15At);
+static_assert(placeInFormat(headerFormat, 15).at == headerTimestampAt);
+static_assert(placeInFormat(headerFormat, 16).at == headerMaxCommandAt);
+static_assert(placeInFormat(headerFormat, 21).at == headerLength);
+
+// The operations that the log names.
+static constexpr char readHeader[] = "sqluhReadHeader";
+static constexpr char writeHeader[] = "sqluhWriteHeader";
+
+// --- Reading -------------------------------------------------------------------------------------
 
 bool sqluhCheckHeaderChecksum(SQLUH_HEADER* header)
 {
@@ -13,7 +26,8 @@ bool sqluhCheckHeaderChecksum(SQLUH_HEADER* header)
 
     uint32_t stored = header->checksum;
     header->checksum = 0;
-    bool shortImage = header->version >= 7020200 && header->version < 8010000;
+    bool shortImage =
+        header->version >= versionWithTimestamp && header->version < versionWithWholeChecksum;
     uint32_t computed =
         sqluhChecksum(header, shortImage ? headerImageLength7020200 : headerImageLength);
     bool matches = computed == stored || sqluhChecksum(header, headerImageLengthShort) == stored;
@@ -34,22 +48,19 @@ int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength)
     SQLUH_ENTRY entry = {};
     entry.data = &data;
     SQLUH_WORKAREA workArea = {};
-    unsigned int flags = 0;
-    long long offset = 0;
+    SQLUH_ENTRYWALK walk = {fh, &entry, &workArea, 0, false};
     uint32_t longest = 0;
 
-    int rc = logged(sqluhRewind(fh, &offset));
+    int rc = logged(sqluhRewind(fh, nullptr));
     if (rc == 0)
         rc = logged(sqluhInitWorkArea(&workArea, defaultWorkAreaSize));
     if (rc == 0) {
-        do {
-            rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
-            if ((rc == 0 || rc == TABLESPACE_LIST_TRUNCATED) && entry.commandLength > longest)
+        while ((rc = sqluhNextEntry(&walk)) == 0)
+            if (entry.commandLength > longest)
                 longest = entry.commandLength;
-        } while (rc == 0 || rc == TABLESPACE_LIST_TRUNCATED);
         if (rc == END_OF_FILE)
             rc = 0;
-        rc = firstOf(rc, logged(sqluhRewind(fh, &offset)));
+        rc = firstOf(rc, logged(sqluhRewind(fh, nullptr)));
         sqlofmblkEx(workArea.buffer);
     }
     *maxLength = longest;
@@ -62,7 +73,7 @@ int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength)
 static int readHeaderText(SQLO_FHANDLE fh, char* buffer)
 {
     uint32_t bytesRead = 0;
-    int rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr));
+    int rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr), readHeader);
     if (rc != 0)
         return rc;
 
@@ -73,8 +84,9 @@ static int readHeaderText(SQLO_FHANDLE fh, char* buffer)
         return rc;
     bool partial = rc == END_OF_FILE || rc == 0;
     logRecord({textItem(partial ? TEXT_HEADER_PARTIAL : TEXT_HEADER_READ), codeItem("rc = ", rc),
-               numberItem("Bytes read: ", bytesRead), dataItem("", buffer, headerLength)});
-    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc));
+               numberItem("Bytes read: ", bytesRead), dataItem("", buffer, headerLength)},
+              readHeader);
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), readHeader);
 }
 
 // Fields 1 to 13. What a damaged text leaves out stays zero: the checksum tells.
@@ -104,15 +116,15 @@ static void scanHeaderFields(const char* text, SQLUH_HEADER* header)
     header->status = status;
 }
 
-// The fields behind the status letter, which stand at places that depend on the version. Returns
+// The fields after the status letter, which stand at places that depend on the version. Returns
 // the place of field 17.
 static uint32_t takeVersionedFields(const char* text, SQLUH_HEADER* header)
 {
     header->version = numberAt(text + headerVersionAt, headerNumberWidth, 10);
-    if (header->version < 6010000)
+    if (header->version < versionWithNumber15)
         return headerMaxCommandAt6010000;
     header->number15 = numberAt(text + headerNumber15At, headerNumberWidth, 16);
-    if (header->version < 7020200)
+    if (header->version < versionWithTimestamp)
         return headerMaxCommandAt7020200;
     if (text[headerTimestampAt] == SQLUH_EMPTY_WORD[0]) {
         memset(header->timestamp, ' ', timestampWidth);
@@ -136,24 +148,7 @@ static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header)
     uint32_t longest = 0;
     int rc = sqluhFindMaxCommandLen(fh, &longest);
     header->maxCommandLength = longest;
-    return rc == 0 ? 0 : loggedPlain(HISTORY_FILE_DAMAGED);
-}
-
-// The work area for the entry that an old header names. Its tablespace count is believed only as
-// far as the file is long: a damaged count must not ask for memory that no entry can need.
-static uint32_t oldEntryAreaSize(SQLO_FHANDLE fh, const SQLUH_HEADER* header)
-{
-    uint64_t extra = uint64_t{workAreaPerTablespace} * header->number8;
-    long long here = 0;
-    long long end = 0;
-    if (sqloseek(fh, 0, sqloFromCurrent, &here) != 0 || sqloseek(fh, 0, sqloFromEnd, &end) != 0 ||
-        sqloseek(fh, here, sqloFromStart, nullptr) != 0)
-        return defaultWorkAreaSize;
-    if (extra > static_cast<uint64_t>(end))
-        extra = static_cast<uint64_t>(end);
-    if (extra > UINT32_MAX - defaultWorkAreaSize)
-        extra = UINT32_MAX - defaultWorkAreaSize;
-    return defaultWorkAreaSize + static_cast<uint32_t>(extra);
+    return rc == 0 ? 0 : loggedPlain(HISTORY_FILE_DAMAGED, readHeader);
 }
 
 // Takes the header's timestamp from the entry at offset3.
@@ -166,18 +161,16 @@ static int takeTimestampFromEntry(SQLO_FHANDLE fh, SQLUH_HEADER* header)
     SQLUH_ENTRY entry = {};
     entry.data = &data;
     SQLUH_WORKAREA workArea = {};
-    unsigned int flags = 0;
-    long long offset = 0;
+    SQLUH_ENTRYWALK walk = {fh, &entry, &workArea, 0, false};
 
-    int rc = logged(sqloseek(fh, static_cast<long long>(header->offset3), sqloFromStart, nullptr));
+    int rc = logged(sqloseek(fh, static_cast<long long>(header->offset3), sqloFromStart, nullptr),
+                    readHeader);
+    // The reader grows the area for a larger entry, and only as far as the file is long.
     if (rc == 0)
-        rc = logged(sqluhInitWorkArea(&workArea, oldEntryAreaSize(fh, header)));
+        rc = logged(sqluhInitWorkArea(&workArea, defaultWorkAreaSize), readHeader);
     if (rc == 0) {
-        rc = sqluhReadEntry(fh, &entry, &workArea, nullptr, nullptr, nullptr, nullptr, &flags);
-        if (rc == TABLESPACE_LIST_TRUNCATED)
-            rc = 0;
+        rc = logged(sqluhNextEntry(&walk), readHeader);
         sqlofmblkEx(workArea.buffer);
-        logged(rc);
     }
     if (rc != 0)
         return rc;
@@ -188,7 +181,7 @@ static int takeTimestampFromEntry(SQLO_FHANDLE fh, SQLUH_HEADER* header)
         header->timestamp[i] = objectPart[i] != '\0' ? objectPart[i] : ' ';
     if (objectPart[0] == SQLUH_EMPTY_WORD[0])
         memset(header->timestamp, ' ', timestampWidth);
-    return logged(sqluhRewind(fh, &offset));
+    return logged(sqluhRewind(fh, nullptr), readHeader);
 }
 
 // Brings a header of a version below 7020200 into the current form, in memory.
@@ -201,7 +194,7 @@ static int convertOldHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
     } else {
         memcpy(header->timestamp, SQLUH_EMPTY_TIMESTAMP, timestampWidth);
     }
-    if (header->version < 6010000)
+    if (header->version < versionWithNumber15)
         header->number15 = header->number7;
     header->version = currentVersion;
     return 0;
@@ -219,7 +212,7 @@ int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
         if (rc == 0) {
             int scanned = parseHeader(fh, text, header);
             rc = sqluhCheckHeaderChecksum(header) ? 0 : logged(HISTORY_FILE_DAMAGED);
-            if (rc == 0 && header->version < 7020200)
+            if (rc == 0 && header->version < versionWithTimestamp)
                 rc = convertOldHeader(fh, header);
             rc = firstOf(rc, scanned);
         }
@@ -228,6 +221,59 @@ int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
     if (rc < 0 && rc != END_OF_FILE) {
         sqlt_logadmin(__func__, pdAdminReadFailed);
         logRecord({textItem(TEXT_HEADER_FAILED)});
+    }
+
+    pdtExit(rc);
+    return rc;
+}
+
+// --- Writing -------------------------------------------------------------------------------------
+
+static int formatHeader(char* buffer, const SQLUH_HEADER* header)
+{
+    return sqluhSprintf(
+        buffer, headerFormat, header->checksum, static_cast<unsigned long long>(header->offset1),
+        static_cast<unsigned long long>(header->offset2),
+        static_cast<unsigned long long>(header->offset3), header->entryCount, header->number6,
+        header->number7, header->number8, header->number9, header->number10, header->number11,
+        header->nodeNumber, header->status, header->version, header->number15, header->timestamp,
+        header->maxCommandLength, " ", " ", " ", " ");
+}
+
+static int writeHeaderText(SQLO_FHANDLE fh, const char* buffer)
+{
+    uint32_t written = 0;
+    int rc = logged(sqlowrite(fh, buffer, headerLength, &written), writeHeader);
+    if (rc == 0 && written == headerLength)
+        return 0;
+    if (rc == DISK_FULL)
+        sqlt_logadmin(writeHeader, pdAdminDiskFull);
+    // A header cut short with no code for it is a damaged header.
+    return rc != 0 ? transferCode(rc) : logged(HISTORY_FILE_DAMAGED, writeHeader);
+}
+
+int sqluhWriteHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    pdtEntry();
+
+    void* block = nullptr;
+    int rc = logged(allocateZeroed(headerLength + 1, &block));
+    if (rc == 0) {
+        char* buffer = static_cast<char*>(block);
+        header->version = currentVersion;
+        header->checksum = 0;
+        header->checksum = sqluhChecksum(header, headerImageLength);
+        rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr));
+        if (rc == 0) {
+            int length = formatHeader(buffer, header);
+            if (length != static_cast<int>(headerLength)) {
+                rc = HISTORY_FILE_DAMAGED;
+                logRecord({codeItem("rc = ", rc), numberItem("Length: ", length)});
+            }
+        }
+        if (rc == 0)
+            rc = writeHeaderText(fh, buffer);
+        sqlofmblkEx(block);
     }
 
     pdtExit(rc);

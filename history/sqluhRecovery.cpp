@@ -1,4 +1,5 @@
-// Recovery: the examination of the two files and the repairs.
+// Recovery: the examination of the two files and the repairs. Stands on handle and lock, header and
+// creation.
 //
 // What the two status letters tell an open, and what it does (the first row that applies):
 //
@@ -10,7 +11,7 @@
 //
 // Afterwards the sizes must agree and both headers must read, or the shadow is copied once more.
 //
-// Each repair leaves letters behind from which the next open goes on if the process stops in it:
+// Each repair leaves letters from which the next open goes on if the process stops in it:
 //
 //   stopped                                   history              shadow
 //   history from shadow, shadow marked        as before            'P'      again from the shadow
@@ -22,15 +23,10 @@
 
 #include <cstring>
 
+#include "history/sqluhDiagnostics.h"
+#include "history/sqluhHandle.h"
 #include "history/sqluhfun.h"
 #include "history/sqluhist.h"
-#include "history/sqluhlog.h"
-
-// What the examination of one file found.
-struct fileState {
-    bool usable;
-    char status; // zero when the header could not be read
-};
 
 int sqluhUpdateHeaderStatus(char* path, char status)
 {
@@ -57,7 +53,8 @@ int sqluhRecoverHistoryFromShadow(SQLUH_HANDLE* handle)
     pdtEntry();
 
     // Marked first: a history file torn by this copy must be rebuilt from this shadow again, not
-    // moved aside. The copy makes the mark durable before it touches the history file.
+    // moved aside. The copy makes its source, and so the mark, durable before it touches the
+    // history file (R0), and the history file before it returns (R4).
     int rc = logged(sqluhUpdateHeaderStatus(handle->shadowPath, statusPending));
     if (rc == 0)
         rc = logged(sqlocopy(handle->shadowPath, handle->historyPath, 0));
@@ -100,7 +97,7 @@ int sqluh_history_file_get_size(char* directory, char* fileName, unsigned long l
     return rc;
 }
 
-static bool sizesAgree(SQLUH_HANDLE* handle)
+static bool sizesAgree(SQLUH_HANDLE* handle, const char* operation)
 {
     char historyName[] = SQLUH_HISTORY_NAME;
     char shadowName[] = SQLUH_SHADOW_NAME;
@@ -113,18 +110,20 @@ static bool sizesAgree(SQLUH_HANDLE* handle)
         return true;
     logRecord({textItem(TEXT_FILE_SIZE), codeItem("", rc),
                numberItem("", static_cast<int64_t>(historySize)),
-               numberItem("", static_cast<int64_t>(shadowSize))});
+               numberItem("", static_cast<int64_t>(shadowSize))},
+              operation);
     return false;
 }
 
-// Opens the file through the handle, reads its header into the handle's and closes it. The reader's
-// code; a failed close counts only behind a good read.
-static int readHeaderOf(SQLUH_HANDLE* handle, const char* path)
+// Opens the file through the handle, reads its header into the handle's and closes it. Returns the
+// reader's code; *closed receives the close's.
+static int readHeaderOf(SQLUH_HANDLE* handle, const char* path, int* closed)
 {
+    *closed = 0;
     int rc = sqloopenp(path, sqloOpenRead, sqloPermissions, &handle->fileHandle);
     if (rc == 0) {
         rc = sqluhReadHeader(handle->fileHandle, &handle->header);
-        rc = firstOf(rc, sqloclose(handle->fileHandle));
+        *closed = sqloclose(handle->fileHandle);
     }
     handle->fileHandle = sqloNoFile;
     return rc;
@@ -134,11 +133,12 @@ bool sqluhVerifyHistFilesAreIndentical(SQLUH_HANDLE* handle)
 {
     pdtEntry();
 
-    bool identical = sizesAgree(handle);
+    bool identical = sizesAgree(handle, __func__);
     if (identical) {
-        int rc = readHeaderOf(handle, handle->historyPath);
+        int closed = 0;
+        int rc = firstOf(readHeaderOf(handle, handle->historyPath, &closed), closed);
         if (rc == 0)
-            rc = readHeaderOf(handle, handle->shadowPath);
+            rc = firstOf(readHeaderOf(handle, handle->shadowPath, &closed), closed);
         identical = rc == 0;
         if (!identical)
             logRecord({textItem(TEXT_FILE_CHECKSUM), codeItem("", rc), numberItem("", 0),
@@ -149,24 +149,38 @@ bool sqluhVerifyHistFilesAreIndentical(SQLUH_HANDLE* handle)
     return identical;
 }
 
-static fileState examineFile(SQLUH_HANDLE* handle, const char* path)
+// A file that cannot be opened or read is not usable; what closing it says does not count.
+static SQLUH_FILESTATE examineFile(SQLUH_HANDLE* handle, const char* path)
 {
-    fileState state = {};
-    if (sqloopenp(path, sqloOpenRead, sqloPermissions, &handle->fileHandle) == 0) {
-        if (sqluhReadHeader(handle->fileHandle, &handle->header) == 0) {
-            state.status = handle->header.status;
-            state.usable = state.status == statusConsistent || state.status == statusCommitted;
-        }
-        sqloclose(handle->fileHandle);
+    int closed = 0;
+    int rc = readHeaderOf(handle, path, &closed);
+    return sqluhStateOfFile(rc, &handle->header);
+}
+
+SQLUH_FILESTATE sqluhStateOfFile(int rc, const SQLUH_HEADER* header)
+{
+    SQLUH_FILESTATE state = {false, '\0'};
+    if (rc == 0) {
+        state.status = header->status;
+        state.usable = state.status == statusConsistent || state.status == statusCommitted;
     }
-    handle->fileHandle = sqloNoFile;
     return state;
 }
 
-static void traceFailure(int rc)
+sqluhRepair sqluhDecideRepair(SQLUH_FILESTATE history, SQLUH_FILESTATE shadow)
+{
+    if (!history.usable && !shadow.usable && shadow.status != statusPending)
+        return sqluhRepairAnew;
+    if (!history.usable)
+        return sqluhRepairHistory;
+    return history.status == statusConsistent && shadow.usable ? sqluhRepairNone
+                                                               : sqluhRepairShadow;
+}
+
+static void traceFailure(int rc, const char* operation)
 {
     if (rc != 0)
-        sqltError("sqluhRecoverFromFatalError", rc);
+        sqltError(operation, rc);
 }
 
 int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
@@ -181,13 +195,17 @@ int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
         sqluhJoinPath(savedHistory, sizeof savedHistory, handle->directory,
                       SQLUH_SAVED_HISTORY_NAME);
         sqluhJoinPath(savedShadow, sizeof savedShadow, handle->directory, SQLUH_SAVED_SHADOW_NAME);
-        traceFailure(sqlomove(handle->historyPath, savedHistory));
-        traceFailure(sqlomove(handle->shadowPath, savedShadow));
+        int moved = sqlomove(handle->historyPath, savedHistory);
+        traceFailure(moved, __func__);
+        traceFailure(sqlomove(handle->shadowPath, savedShadow), __func__);
         // Locked before there is anything in it. Someone else may have been first, and then has
-        // made the pair.
-        if (handle->isLocked)
-            rc = logged(sqluhLockFileAtPath(handle));
-        if (rc == 0 && !(handle->isLocked && examineFile(handle, handle->historyPath).usable))
+        // made the pair; while the old file is in its place its lock keeps everybody out.
+        bool made = false;
+        if (moved == 0 && handle->isLocked) {
+            rc = logged(sqluhFollowLock(handle, __func__));
+            made = rc == 0 && examineFile(handle, handle->historyPath).usable;
+        }
+        if (rc == 0 && !made)
             rc = sqluhCreate(handle->directory);
     }
 
@@ -195,32 +213,33 @@ int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
     return rc;
 }
 
-static int repair(SQLUH_HANDLE* handle, fileState history, fileState shadow)
+static int repair(SQLUH_HANDLE* handle, sqluhRepair due, const char* operation)
 {
     int rc = 0;
-    if (!history.usable)
-        rc = logged(sqluhRecoverHistoryFromShadow(handle));
-    else if (history.status != statusConsistent || !shadow.usable)
-        rc = logged(sqluhRecoverShadowFromHistory(handle));
+    if (due == sqluhRepairHistory)
+        rc = logged(sqluhRecoverHistoryFromShadow(handle), operation);
+    else if (due == sqluhRepairShadow)
+        rc = logged(sqluhRecoverShadowFromHistory(handle), operation);
 
     if (rc == 0 && !sqluhVerifyHistFilesAreIndentical(handle)) {
-        pdLogPrintf(__func__, pdLevelWarning, "%s", TEXT_NOT_IDENTICAL);
-        rc = logged(sqluhRecoverShadowFromHistory(handle));
+        pdLogPrintf(operation, pdLevelWarning, "%s", TEXT_NOT_IDENTICAL);
+        rc = logged(sqluhRecoverShadowFromHistory(handle), operation);
     }
     return rc == 0 ? 0 : HISTORY_FILE_DAMAGED;
 }
 
-static int examineAndRepair(SQLUH_HANDLE* handle, bool optToRecover)
+static int examineAndRepair(SQLUH_HANDLE* handle, bool optToRecover, const char* operation)
 {
-    fileState history = examineFile(handle, handle->historyPath);
-    fileState shadow = examineFile(handle, handle->shadowPath);
-    if (!history.usable && !shadow.usable && shadow.status != statusPending) {
-        if (!optToRecover)
-            return HISTORY_FILE_DAMAGED;
+    SQLUH_FILESTATE history = examineFile(handle, handle->historyPath);
+    SQLUH_FILESTATE shadow = examineFile(handle, handle->shadowPath);
+    sqluhRepair due = sqluhDecideRepair(history, shadow);
+    if (!optToRecover)
+        return due == sqluhRepairAnew ? HISTORY_FILE_DAMAGED : 0;
+    if (due == sqluhRepairAnew) {
         int rc = sqluhRecoverFromFatalError(handle);
         return rc == 0 ? HISTORY_FILE_RECREATED : rc;
     }
-    return optToRecover ? repair(handle, history, shadow) : 0;
+    return repair(handle, due, operation);
 }
 
 int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOut, char* directory,
@@ -232,7 +251,7 @@ int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOu
     if (rc == 0)
         rc = logged(sqluhLock(*handleOut));
     if (rc == 0)
-        rc = examineAndRepair(*handleOut, optToRecover);
+        rc = examineAndRepair(*handleOut, optToRecover, __func__);
 
     pdtExit(rc);
     return rc;

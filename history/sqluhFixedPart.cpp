@@ -1,0 +1,155 @@
+// Taking the fixed part of an entry apart, by column or with the scanning format: both ways go by
+// the table of fields and write into the members that it names. Stands on nothing in the library.
+
+#include "history/sqluhFixedPart.h"
+
+#include <cstdio>
+#include <cstring>
+#include <type_traits>
+#include <utility>
+
+#include "history/sqluhColumns.h"
+
+// Tells whether the table, the printing and the scanning format give every field the same columns.
+static constexpr bool formatsAgree(void)
+{
+    unsigned int printed = 0; // conversions, the reserved blanks among them
+    for (unsigned int field = 0; field < entryFieldCount; field++) {
+        if (placeInFormat(entryFormat, printed).width == entryReserved1Length)
+            printed++;
+        formatPlace place = placeInFormat(entryFormat, printed++);
+        if (place.at != entryFields[field].at || place.width != entryFields[field].width ||
+            placeInFormat(entryScanFormat, field).width != entryFields[field].width)
+            return false;
+    }
+    return placeInFormat(entryFormat, printed + 1).at == entryFixedLength;
+}
+static_assert(formatsAgree());
+
+static constexpr bool isNumber(sqluhFieldKind kind)
+{
+    return kind == kindHex || kind == kindHex16 || kind == kindDecimal;
+}
+
+static constexpr bool isLetter(sqluhFieldKind kind)
+{
+    return kind == kindLetter || kind == kindOptionalLetter;
+}
+
+// Where the value of a field goes: the member, or for a word its place in words.
+template <unsigned int field>
+static inline auto targetOf(SQLUH_ENTRY* entry, sqluhFixedWords* words)
+{
+    constexpr sqluhEntryField row = entryFields[field];
+    char* owner = row.owner == ownerEntry ? reinterpret_cast<char*>(entry)
+                                          : reinterpret_cast<char*>(entry->data);
+    if constexpr (row.kind == kindHex16)
+        return reinterpret_cast<uint16_t*>(owner + row.member);
+    else if constexpr (isNumber(row.kind))
+        return reinterpret_cast<uint32_t*>(owner + row.member);
+    else if constexpr (isLetter(row.kind))
+        return owner + row.member;
+    else
+        return static_cast<char*>(words->text[field - fieldObjectPart]);
+}
+
+// --- By column -----------------------------------------------------------------------------------
+
+// What stands between the fields of a canonical fixed part: colons, the blanks that end line 1, its
+// line feed. What is after field 23 is not looked at, here or by the scanning format.
+struct entryFrame {
+    char mask[entryFixedLength]; // 0xFF where text counts
+    char text[entryFixedLength];
+};
+
+static constexpr entryFrame makeEntryFrame(void)
+{
+    entryFrame frame = {};
+    for (const sqluhEntryField& field : entryFields)
+        frame.text[field.at + field.width] = ':';
+    for (uint32_t i = 0; i < entryReserved1Length; i++)
+        frame.text[entryReserved1At + i] = ' ';
+    frame.text[lineLength - 1] = '\n';
+    for (uint32_t i = 0; i < entryFixedLength; i++)
+        frame.mask[i] = frame.text[i] != '\0' ? '\xFF' : '\0';
+    return frame;
+}
+static constexpr entryFrame canonicalFrame = makeEntryFrame();
+
+static bool hasCanonicalFrame(const char* text)
+{
+    unsigned char different = 0;
+    for (uint32_t i = 0; i < entryFixedLength; i++)
+        different |=
+            static_cast<unsigned char>((text[i] ^ canonicalFrame.text[i]) & canonicalFrame.mask[i]);
+    char operation = text[entryFields[fieldOperation].at];
+    return different == 0 && operation > 0x20 && operation < 0x7F;
+}
+
+// Takes a number aside, or a word; tells whether the field stands as the writer writes it.
+template <unsigned int field>
+static inline bool takeColumn(const char* text, uint32_t* numbers, sqluhFixedWords* words)
+{
+    constexpr sqluhEntryField row = entryFields[field];
+    const char* from = text + row.at;
+    if constexpr (row.kind == kindHex) {
+        return hexColumns(from, &numbers[field]);
+    } else if constexpr (row.kind == kindHex16) {
+        return hexDigitsAt(from, row.width, &numbers[field]);
+    } else if constexpr (row.kind == kindDecimal) {
+        return decimalColumns(from, &numbers[field]);
+    } else if constexpr (isLetter(row.kind)) {
+        return *from != '\0'; // which ends the text for the scanning format
+    } else {
+        char* word = words->text[field - fieldObjectPart];
+        uint32_t length = wordLength<row.width>(from);
+        memcpy(word, from, row.width);
+        word[length] = '\0';
+        return length != 0;
+    }
+}
+
+template <unsigned int field>
+static inline void storeColumn(const char* text, const uint32_t* numbers, SQLUH_ENTRY* entry)
+{
+    constexpr sqluhEntryField row = entryFields[field];
+    if constexpr (isNumber(row.kind)) {
+        auto target = targetOf<field>(entry, nullptr);
+        *target = static_cast<std::remove_pointer_t<decltype(target)>>(numbers[field]);
+    } else if constexpr (isLetter(row.kind)) {
+        *targetOf<field>(entry, nullptr) = text[row.at];
+    }
+}
+
+template <unsigned int... fields>
+static bool takeCanonical(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* words,
+                          std::integer_sequence<unsigned int, fields...>)
+{
+    uint32_t numbers[entryFieldCount];
+    if (!hasCanonicalFrame(text) || !(takeColumn<fields>(text, numbers, words) && ...))
+        return false;
+    (storeColumn<fields>(text, numbers, entry), ...);
+    return true;
+}
+
+// --- With the scanning format --------------------------------------------------------------------
+
+template <unsigned int... fields>
+static int scanFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* words,
+                         std::integer_sequence<unsigned int, fields...>)
+{
+    char line[entryFixedLength + 1];
+    memcpy(line, text, entryFixedLength);
+    line[entryFixedLength] = '\0';
+    *words = {};
+    int found = sscanf(line, entryScanFormat, targetOf<fields>(entry, words)...);
+    return found < 0 ? 0 : found;
+}
+
+int sqluhTakeFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* words)
+{
+    using allFields = std::make_integer_sequence<unsigned int, entryFieldCount>;
+    if (takeCanonical(text, entry, words, allFields()))
+        return entryFieldCount;
+    return scanFixedPart(text, entry, words, allFields());
+}
