@@ -25,7 +25,7 @@ install(TARGETS sqluhist zq3 zq3osse EXPORT sqluhistTargets)
 # The #include lines of the headers hold in the installed layout, too.
 install(FILES include/zq3.h DESTINATION ${headerDir})
 install(FILES history/sqluhist.h DESTINATION ${headerDir}/history)
-install(FILES sqo/sqlo.h sqo/sqlonlck.h sqo/sqlpd.h sqo/sqlzkrcb.h DESTINATION ${headerDir}/sqo)
+install(FILES sqo/sqlca.h sqo/sqlo.h sqo/sqlonlck.h sqo/sqlpd.h sqo/sqlzkrcb.h DESTINATION ${headerDir}/sqo)
 
 install(EXPORT sqluhistTargets NAMESPACE zq3:: DESTINATION ${packageDir})
 file(WRITE ${PROJECT_BINARY_DIR}/sqluhistConfig.cmake

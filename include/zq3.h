@@ -1,4 +1,4 @@
-// The client library's interface: the communication area and the history scan.
+// The client library's interface: the history scan.
 //
 // libzq3.so.1 provides the three calls. The same zq3HistoryData record carries one entry of the
 // recovery history through the whole system: a scan fills it, the planner reads it, the
@@ -8,21 +8,10 @@
 #include <cstddef>
 #include <cstdint>
 
+#include "sqo/sqlca.h"
+
 // The interface version that every scan call passes as its first argument.
 enum : unsigned int { zq3Version = 6010000 };
-
-// The SQL communication area: the outcome of a call, or of the operation that an entry records.
-struct sqlca {
-    char sqlcaid[8];    // identifier, no terminator
-    int32_t sqlcabc;    // length of this record in bytes
-    int32_t sqlcode;    // 0 success, negative failure, positive warning
-    int16_t sqlerrml;   // length of the tokens in sqlerrmc
-    char sqlerrmc[70];  // message tokens, no terminator
-    char sqlerrp[8];    // product field, no terminator
-    int32_t sqlerrd[6]; // diagnostic values
-    char sqlwarn[11];   // warning letters
-    char sqlstate[5];   // state, no terminator
-};
 
 // A text in a buffer of the caller's.
 struct textBuffer {
@@ -78,7 +67,6 @@ struct zq3HistoryFetchStruct {
     uint16_t callerAction;         // 2: the next entry
 };
 
-static_assert(sizeof(sqlca) == 136 && offsetof(sqlca, sqlcode) == 12);
 static_assert(offsetof(zq3HistoryData, commandText) == 8 + 9 * sizeof(textBuffer));
 static_assert(offsetof(zq3HistoryData, logPosition) == 8 + 10 * sizeof(textBuffer));
 static_assert(offsetof(zq3HistoryData, eventSqlca) == 8 + 10 * sizeof(textBuffer) + 16);

@@ -8,7 +8,7 @@
 #include <cstddef>
 #include <cstdint>
 
-#include "zq3.h"
+#include "sqo/sqlca.h"
 
 enum : int {
     END_OF_FILE = static_cast<int>(0x870F0009),     // a read met the end of the file
@@ -66,17 +66,17 @@ int sqloopenp(const char* path, unsigned int options, unsigned int permissions, 
 // Closes a file. Its handle is of no use afterwards, whatever comes back.
 int sqloclose(SQLO_FHANDLE fh);
 
-// Reads count bytes at the current position and moves it behind them. Returns 0 when all were
+// Reads count bytes at the current position and moves it past them. Returns 0 when all were
 // delivered, END_OF_FILE when the file ended first, or sqloSystemError; *bytesRead holds the number
 // delivered in every case.
 int sqloread(SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* bytesRead);
 
-// Writes count bytes at the current position and moves it behind them. Returns 0 only when all were
+// Writes count bytes at the current position and moves it past them. Returns 0 only when all were
 // written, DISK_FULL when there was no space, or sqloSystemError; *bytesWritten holds the number
 // written in every case.
 int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* bytesWritten);
 
-// Move the position to offset from origin (start, current, end), also behind the end of the file;
+// Move the position to offset from origin (start, current, end), also past the end of the file;
 // *newOffset, unless null, receives the new position. On failure the position stays as it was.
 int sqloseek(SQLO_FHANDLE fh, long long offset, unsigned int origin, long long* newOffset);
 int sqlochgfileptr(SQLO_FHANDLE fh, long long offset, unsigned int origin, long long* newOffset);
@@ -86,10 +86,10 @@ int sqlochgfileptr(SQLO_FHANDLE fh, long long offset, unsigned int origin, long 
 int sqlosync(SQLO_FHANDLE fh);
 
 // Makes target a durable copy of source, keeping target's inode if it exists. The source is made
-// durable first; the target's first 1024 bytes are written last, so that a copy that stopped
-// part-way has no readable header. A copy of a file onto itself is refused. options: 0. Returns 0,
-// DISK_FULL or sqloSystemError; the target then is as it was or has no readable header, or is whole
-// when only its closing failed.
+// durable first; the target's first 8 bytes, by which it is recognised, are written last, so that
+// nobody takes a copy that stopped part-way for a whole one. A copy of a file onto itself is
+// refused. options: 0. Returns 0, DISK_FULL or sqloSystemError; the target then is as it was or
+// empty, or is whole when only its closing failed.
 int sqlocopy(const char* source, const char* target, unsigned int options);
 
 // Renames source to target, durably. A target that holds anything is first kept under its own name

@@ -46,11 +46,12 @@ void sqlt_logerr_data(const char* function, const char* title, const void* data,
 // Nonzero while tracing is on.
 int sqltGetCompTraceFlag(void);
 
-// Trace records; with tracing off each costs a test of a flag.
+// Trace records; with tracing off each costs a test of a flag. Data is shown as hexadecimal digits:
+// of 1, 2, 4 or 8 bytes as one number, else byte by byte. The data of an entry is a text.
 void sqltError(const char* function, int code);
 void sqltData(const char* function, const char* label, const void* data, size_t size);
 void pdtEntry(const char* function = __builtin_FUNCTION());
-void pdtEntry1(const void* data, size_t size, const char* function = __builtin_FUNCTION());
+void pdtEntry1(const void* text, size_t size, const char* function = __builtin_FUNCTION());
 void pdtExit(int rc, const char* function = __builtin_FUNCTION());
 void pdtExit1(int rc, const void* data, size_t size, const char* function = __builtin_FUNCTION());
 

@@ -185,9 +185,10 @@ struct adminRow {
 };
 static const adminRow adminMessages[] = {
     {pdAdminReadFailed,
-     "A record of the recovery history could not be read. Keep copies of zq3rhist.asc and\n"
-     "zq3rhist.bak, then look at the directory with zq3hist verify; when both files are damaged,\n"
-     "restore the history from a backup image."},
+     "A record of the recovery history could not be read. Keep copies of the history\n"
+     "file and of its shadow, then have every entry of both verified; when both are damaged, "
+     "restore\n"
+     "the history from a backup image."},
     {pdAdminDiskFull, "The file system that holds the recovery history is full. Free space on it,\n"
                       "then repeat the operation that was being recorded."},
 };

@@ -1,4 +1,11 @@
 // Whole files: copy, move, delete. Each is durable when it returns.
+//
+// The barriers of a copy, each before what relies on it:
+//
+//   R0  the source                     before the target is emptied
+//   D   the target's name              before there is anything under it
+//   CH  the target's body              before the mark that vouches for it
+//   R4  the target's mark, and so all  before the copy returns
 #include "osse.h"
 
 #include <climits>
@@ -9,8 +16,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-// A copied file is recognised by its first bytes, its header; they are written last.
-static constexpr size_t headLength = 1024;
+// A file's mark, its first bytes, is what a reader recognises it by; it is written last. Short, so
+// that what a device writes at once holds all of it, whatever the size of its sectors.
+static constexpr size_t markLength = 8;
 static constexpr size_t copyLength = size_t{256} * 1024;
 
 // Reads the whole source once and keeps nothing: a source that cannot be read to its end must not
@@ -26,13 +34,13 @@ static int checkReadable(int source, unsigned char* buffer)
     }
 }
 
-// Copies what lies behind the head; *length is the number of bytes.
+// Copies what follows the mark; *length is the number of bytes.
 static int copyBody(int source, int target, unsigned char* buffer, off_t* length)
 {
     *length = 0;
     for (;;) {
         size_t got, put;
-        const off_t offset = static_cast<off_t>(headLength) + *length;
+        const off_t offset = static_cast<off_t>(markLength) + *length;
         int rc = osseReadAt(source, buffer, copyLength, offset, &got);
         if (rc == 0)
             rc = osseWriteAt(target, buffer, got, offset, &put);
@@ -43,26 +51,26 @@ static int copyBody(int source, int target, unsigned char* buffer, off_t* length
 }
 
 // Replaces what the target holds. The order is what makes a stop harmless: with the target empty
-// and its body durable before the head exists, no header ever stands before another file's body.
+// and its body durable before the mark exists, no mark ever stands before another file's body.
 static int replaceContents(int source, int target, off_t targetSize, unsigned char* buffer)
 {
-    unsigned char head[headLength];
-    size_t headRead;
-    int rc = osseReadAt(source, head, headLength, 0, &headRead);
+    unsigned char mark[markLength];
+    size_t markRead;
+    int rc = osseReadAt(source, mark, markLength, 0, &markRead);
     if (rc != 0)
         return rc;
     if (ftruncate(target, 0) != 0)
         return storeFailure(errno);
 
     off_t bodyLength;
-    size_t headWritten;
+    size_t markWritten;
     rc = copyBody(source, target, buffer, &bodyLength);
     if (rc == 0 && (bodyLength != 0 || targetSize != 0))
-        rc = osseSync(target);
+        rc = osseSync(target); // CH
     if (rc == 0)
-        rc = osseWriteAt(target, head, headRead, 0, &headWritten);
+        rc = osseWriteAt(target, mark, markRead, 0, &markWritten);
     if (rc == 0)
-        rc = osseSync(target);
+        rc = osseSync(target); // R4
 
     // A copy that failed must not look like one that was done; it also gives back the space.
     if (rc != 0) {
@@ -84,8 +92,8 @@ static int copyToTarget(int source, const char* targetPath, unsigned char* buffe
         rc = systemFailure(errno);
     else if (from.st_dev == to.st_dev && from.st_ino == to.st_ino)
         rc = systemFailure(EINVAL);
-    // Its name is durable before it holds anything, also when it was there: whoever made it may
-    // have stopped before this. A target with a header then never loses its name.
+    // D, also for a target that was there: whoever made it may have stopped before this. A target
+    // with a mark then never loses its name.
     if (rc == 0)
         rc = osseSyncDirectoryOf(targetPath);
     if (rc == 0)
@@ -104,8 +112,7 @@ OSSE_EXPORT int sqlocopy(const char* sourcePath, const char* targetPath, unsigne
     if (rc != 0)
         return rc;
 
-    // What the copy relies on must be on the disk before the other file is emptied.
-    rc = osseSync(source);
+    rc = osseSync(source); // R0
     unsigned char* buffer = static_cast<unsigned char*>(malloc(copyLength));
     if (rc == 0 && buffer == nullptr)
         rc = systemFailure(ENOMEM);

@@ -101,7 +101,7 @@ OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int p
 
     int descriptor;
     int rc = osseOpenRegular(path, flags, permissions, &descriptor);
-    // Also for a file that was there: whoever made it may have stopped before this.
+    // D, also for a file that was there: whoever made it may have stopped before this.
     if (rc == 0 && (flags & O_CREAT) != 0)
         rc = osseSyncDirectoryOf(path);
     if (rc == 0)

@@ -173,7 +173,7 @@ extern "C" int fsync(int)
     return fails("sync directory") ? -1 : 0;
 }
 
-TEST_F(osse, CopyWritesTheHeadLastAndAFailedOneLeavesNone)
+TEST_F(osse, CopyWritesTheMarkLastAndAFailedOneLeavesNone)
 {
 #define BEGUN "sync; sync directory; truncate; "
     const struct {
@@ -182,14 +182,14 @@ TEST_F(osse, CopyWritesTheHeadLastAndAFailedOneLeavesNone)
         const char* calls;
     } rows[] = {
         {4000, 4000, -1, 0, 0,
-         BEGUN "write 2976 at 1024; write 976 at 3024; sync; write 1024 at 0; sync; "},
-        {1024, 1024, -1, 0, 0, BEGUN "sync; write 1024 at 0; sync; "},
+         BEGUN "write 3992 at 8; write 1992 at 2008; sync; write 8 at 0; sync; "},
+        {8, 8, -1, 0, 0, BEGUN "sync; write 8 at 0; sync; "},
         {2000, 5000, 0, EIO, failed | EIO, "sync; "},
         {2000, 5000, 1, EIO, failed | EIO, "sync; sync directory; "},
         {2000, 2000, 3, EINTR, 0,
-         BEGUN "write 976 at 1024; write 976 at 1024; sync; write 1024 at 0; sync; "},
-        {2000, 0, 3, ENOSPC, DISK_FULL, BEGUN "write 976 at 1024; truncate; "},
-        {2000, 0, 4, EIO, failed | EIO, BEGUN "write 976 at 1024; sync; truncate; "},
+         BEGUN "write 1992 at 8; write 1992 at 8; sync; write 8 at 0; sync; "},
+        {2000, 0, 3, ENOSPC, DISK_FULL, BEGUN "write 1992 at 8; truncate; "},
+        {2000, 0, 4, EIO, failed | EIO, BEGUN "write 1992 at 8; sync; truncate; "},
     };
     const std::string link = directory + "link";
     spill(file, "");
@@ -273,7 +273,10 @@ TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
 {
     if (getenv("ZQ3TRACE") != nullptr) {
         pdtEntry1("a\tb\n", 4, "f");
-        sqltData("f", "path", std::string(200, 'x').data(), 200);
+        pdtEntry1((std::string(127, 'x') + "\u00E9" + std::string(71, 'x')).data(), 200, "f");
+        sqltData("f", "checksum", "\xEF\xBE\xAD\x42", 4);
+        sqltData("f", "bytes", std::string(200, '\xA9').data(), 200);
+        sqltData("f", "removed", nullptr, 0);
         pdtExit(-2161, "f");
         std::filesystem::remove_all(directory); // _exit runs no destructor
         _exit(sqltGetCompTraceFlag() != 0 ? sqlz_krcbp->nodeNumber : 99);
@@ -282,8 +285,14 @@ TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
                                 std::filesystem::read_symlink("/proc/self/exe").string() +
                                 " --gtest_filter=osse.Trace*";
     EXPECT_EQ(WEXITSTATUS(system(command.c_str())), 7);
-    EXPECT_EQ(stable(directory + "trace"), "* f entry \"a\\x09b\\x0A\"\n* f path \"" +
-                                               std::string(128, 'x') +
-                                               "\" (128 of 200 bytes shown)\n"
+    std::string digits;
+    for (int i = 0; i < 128; i++)
+        digits += "A9";
+    EXPECT_EQ(stable(directory + "trace"), "* f entry \"a\\x09b\\x0A\"\n* f entry \"" +
+                                               std::string(127, 'x') +
+                                               "\" (127 of 200 bytes shown)\n"
+                                               "* f checksum 0x42ADBEEF\n* f bytes " +
+                                               digits +
+                                               " (128 of 200 bytes shown)\n* f removed\n"
                                                "* f exit -2161 (0xFFFFF78F)\n");
 }
