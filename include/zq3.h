@@ -20,6 +20,36 @@ struct textBuffer {
     uint32_t length;   // length of the text; may exceed what the buffer could take
 };
 
+// Room that holds every text of an entry, terminators included.
+enum : uint32_t {
+    zq3ObjectPartCapacity = 18,
+    zq3SecondTimestampCapacity = 15,
+    zq3LogNameCapacity = 13, // firstText, lastText
+    zq3IdTextCapacity = 25,
+    zq3QualifierTextCapacity = 31,
+    zq3NameTextCapacity = 129,
+    zq3LongTextCapacity = 256,
+    zq3NoteTextCapacity = 31,
+    zq3TablespaceNameCapacity = 19,
+};
+
+// Letters of an entry; others occur, and mean nothing to this system.
+enum : char {
+    zq3OperationBackup = 'B',
+    zq3OperationRestore = 'R',
+    zq3OperationCreate = 'A', // of a tablespace
+    zq3OperationRename = 'N', // of a tablespace
+    zq3OperationOther = 'O',
+
+    zq3ObjectDatabase = 'D',
+    zq3ObjectTablespace = 'P', // one or more tablespaces
+
+    zq3StatusActive = 'A',
+    zq3StatusActiveLower = 'a',
+    zq3StatusInactive = 'I',
+    zq3StatusInactiveLower = 'i',
+};
+
 // One entry of the recovery history. Every buffer it points to belongs to whoever set it up.
 struct zq3HistoryData {
     char eyecatcher[8];

@@ -71,7 +71,7 @@ static void getHelp()
 // Each option's function takes the option's value at argv[*at + 1] and leaves *at at the last
 // argument that it used.
 
-static int takeAlias(planOptions* options, int argc, char** argv, int* at)
+static int takeAliasOption(planOptions* options, int argc, char** argv, int* at)
 {
     if (++*at >= argc || strlen(argv[*at]) > aliasLength)
         return reportError(msgAlias);
@@ -80,7 +80,7 @@ static int takeAlias(planOptions* options, int argc, char** argv, int* at)
     return 0;
 }
 
-static int takeTimestamp(planOptions* options, int argc, char** argv, int* at)
+static int takeTimestampOption(planOptions* options, int argc, char** argv, int* at)
 {
     if (++*at >= argc || strlen(argv[*at]) != timestampLength)
         return reportError(msgTimestamp);
@@ -120,9 +120,9 @@ static int takeOption(planOptions* options, int argc, char** argv, int* at)
 {
     switch (argv[*at][1]) {
     case 'd':
-        return takeAlias(options, argc, argv, at);
+        return takeAliasOption(options, argc, argv, at);
     case 't':
-        return takeTimestamp(options, argc, argv, at);
+        return takeTimestampOption(options, argc, argv, at);
     case 'r':
         return takeRestoreType(options, argc, argv, at);
     case 'n':
