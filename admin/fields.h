@@ -1,61 +1,68 @@
-// The fields of an entry: what they are called in stanzas and in JSON, and where a record holds
-// them. The stanza reader, the stanza writer and the JSON writer go by these tables.
+// The fields of an entry: a row for each says what it is called in stanzas and in JSON, where a
+// record holds it in which form, how a value is taken, and what leaving it out stands for. The
+// reader and both writers go by the rows.
 #pragma once
 
+#include "admin/json.h"
 #include "admin/record.h"
 
-// A letter, and the words for some of its values, ended by a null word.
+// A value of a stanza, and what its field wants where it refuses it.
+struct fieldValue {
+    const char* text; // without escapes, terminated; may hold any bytes
+    size_t length;
+    bool isPlain; // no escape was in it
+    char expected[192];
+};
+enum : int { valueRefused = 1 };
+
+// How a record holds a field.
+enum fieldForm : uint8_t {
+    formLetter,
+    formBuffer,  // a textBuffer
+    formString,  // characters and a terminator
+    formColumns, // characters, blanks after them
+    formNumbers,
+    formBytes, // shown as hexadecimal digits
+    formNames, // of tablespaces
+};
+
+// What a text must be beyond one without zero bytes.
+enum textRule : uint8_t { anyText, oneWord, oneTimestamp, anyBytes };
+
 struct letterWord {
     const char* word;
     char letter;
 };
-struct letterField {
+
+struct recordField {
     const char* name;
-    const char* key;
-    char zq3HistoryData::*letter;
-    const letterWord* words;
+    const char* key; // null: not in JSON
+    fieldForm form;
+    textRule rule;
+    uint16_t count;        // of the numbers
+    size_t at;             // of the member in historyRecord
+    uint32_t size;         // most characters or bytes of it; bytes of each number
+    long long least, most; // of a number
+    // Takes a value into the record. Returns 0; valueRefused with value->expected filled; or
+    // sqloSystemError with ENOMEM.
+    int (*take)(const recordField* field, historyRecord* record, fieldValue* value);
+    // Sets the member to what it is when a stanza leaves the field out, with the codes of take;
+    // null: a stanza always has it, or a record begins so.
+    int (*settle)(const recordField* field, historyRecord* record, fieldValue* value);
+    const letterWord* words;       // for values of a letter, ended by a null word
+    uint32_t SQLUH_ENTRY::*length; // that the entry states for a text; null: none
 };
 
-struct textField {
-    const char* name;
-    const char* key;
-    textBuffer zq3HistoryData::*text;
-    uint32_t SQLUH_ENTRY::*length; // the length that the entry states; null: none
-    uint32_t limit;                // characters
-    bool isWord;                   // no white space inside
-};
+// The operation stands first: what others stand for when left out follows from it. The members of
+// the sqlca stand last.
+enum : unsigned int { numRecordFields = 31 };
+extern const recordField recordFields[numRecordFields];
 
-// A member of the event's sqlca. count: characters, or numbers of 32 bits.
-struct sqlcaField {
-    const char* name;
-    const char* key;
-    size_t at;
-    uint32_t count;
-    bool isText;
-};
+bool isWhite(char c); // in the "C" locale
+bool isInSqlca(const recordField* field);
 
-enum : unsigned int { numLetterFields = 5, numTextFields = 9, numSqlcaFields = 8 };
-extern const letterField letterFields[numLetterFields];
-extern const textField textFields[numTextFields];
-extern const sqlcaField sqlcaFields[numSqlcaFields]; // the SQLCODE first
+// Prints the line of a stanza, unless leaving it out says the same.
+void putField(const recordField* field, const historyRecord* record, FILE* out);
 
-// Fields that stand in no table.
-#define FIELD_TIMESTAMP "Timestamp" // first 14 characters of objectPart
-#define FIELD_SEQUENCE "Sequence"   // the rest of it
-#define FIELD_TABLESPACE "Tablespace"
-#define FIELD_NODE "Node"
-#define FIELD_NUMBER "Number"
-#define FIELD_LOG_POSITION "Log position"
-#define FIELD_NOTE_LENGTH "Note length"
-#define FIELD_LONG_TEXT_LENGTH "Long text length"
-#define FIELD_TOKENS_LENGTH "SQLCA tokens length"
-#define DEFAULT_SEQUENCE "001"
-
-// The letter that a field left out stands for, given the operation. '-' is the absent letter.
-char defaultLetter(const letterField* field, char operation);
-
-// The word for a letter of the field; null when it has none.
-const char* wordForLetter(const letterField* field, char letter);
-
-// Whether a file holds the same for the field of two events.
-bool isSameInFile(const sqlcaField* field, const sqlca* a, const sqlca* b);
+// Puts the member of an object.
+void putJsonField(const recordField* field, const historyRecord* record, jsonWriter* json);

@@ -83,7 +83,7 @@ static void endProgress(const progressBar* bar)
 
 // --- Entries -------------------------------------------------------------------------------------
 
-void countEntry(entriesReport* report, const SQLUH_ENTRY* entry)
+void addToReport(entriesReport* report, const SQLUH_ENTRY* entry)
 {
     const zq3HistoryData* data = entry->data;
     const char* timestamp = data->objectPart.data;
@@ -118,7 +118,7 @@ void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* pro
     startProgress(&bar, progress, end);
     while (rc == 0 && (rc = sqluhNextEntry(&walk)) == 0) {
         report->offset = walk.offset;
-        countEntry(report, &entry);
+        addToReport(report, &entry);
         moveProgress(&bar, walk.offset);
     }
     endProgress(&bar);

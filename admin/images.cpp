@@ -3,7 +3,7 @@
 
 #include <cstring>
 
-#include "admin/stanza.h"
+#include "admin/json.h"
 
 static void showMissing(const imagePlan* plan)
 {

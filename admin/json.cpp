@@ -1,10 +1,8 @@
-// Writing JSON.
+#include "admin/json.h"
+
 #include <cstring>
 
-#include "admin/fields.h"
-#include "admin/stanza.h"
-
-void putJsonText(FILE* out, const char* text, size_t length)
+static void putQuoted(FILE* out, const char* text, size_t length)
 {
     putc('"', out);
     for (size_t i = 0; i < length; i++) {
@@ -19,72 +17,63 @@ void putJsonText(FILE* out, const char* text, size_t length)
     putc('"', out);
 }
 
-static void putKey(FILE* out, const char* key)
+void putJsonText(FILE* out, const char* text, size_t length)
 {
-    fprintf(out, ",\"%s\":", key);
+    putQuoted(out, text, length);
 }
 
-static void putBuffer(FILE* out, const textBuffer* text)
+static void putPlace(jsonWriter* json, const char* key)
 {
-    putJsonText(out, text->data, text->length < text->capacity ? text->length : 0);
+    if (json->comma)
+        putc(',', json->out);
+    if (key != nullptr)
+        fprintf(json->out, "\"%s\":", key);
+    json->comma = true;
 }
 
-static void putSqlca(FILE* out, const sqlca* event)
+void beginJson(jsonWriter* json, const char* key, char bracket)
 {
-    putc('{', out);
-    for (const sqlcaField& field : sqlcaFields) {
-        const char* member = reinterpret_cast<const char*>(event) + field.at;
-        fprintf(out, "%s\"%s\":", &field == &sqlcaFields[0] ? "" : ",", field.key);
-        if (field.isText) {
-            putJsonText(out, member, field.count);
-            continue;
-        }
-        fputs(field.count > 1 ? "[" : "", out);
-        for (uint32_t i = 0; i < field.count; i++) {
-            int32_t number;
-            memcpy(&number, member + i * sizeof number, sizeof number);
-            fprintf(out, "%s%d", i == 0 ? "" : ",", number);
-        }
-        fputs(field.count > 1 ? "]" : "", out);
-    }
-    fprintf(out, ",\"tokensLength\":%d}", event->sqlerrml);
+    putPlace(json, key);
+    putc(bracket, json->out);
+    json->comma = false;
 }
 
-void writeJson(FILE* out, const historyRecord* record)
+void endJson(jsonWriter* json, char bracket)
 {
-    const zq3HistoryData* data = &record->data;
-    const textBuffer* objectPart = &data->objectPart;
-    uint32_t timestampLength =
-        objectPart->length < timestampWidth ? objectPart->length : uint32_t{timestampWidth};
-    fprintf(out, "{\"number\":%u,\"node\":%u", data->entryNumber, data->entryNode);
-    for (const letterField& field : letterFields) {
-        putKey(out, field.key);
-        putJsonText(out, &(data->*field.letter), 1);
+    putc(bracket, json->out);
+    json->comma = true;
+}
+
+void endJsonLine(jsonWriter* json)
+{
+    fputs("}\n", json->out);
+    json->comma = false;
+}
+
+void putJsonBytes(jsonWriter* json, const char* key, const char* text, size_t length)
+{
+    putPlace(json, key);
+    putQuoted(json->out, text, length);
+}
+
+void putJsonText(jsonWriter* json, const char* key, const char* text)
+{
+    if (text != nullptr) {
+        putJsonBytes(json, key, text, strlen(text));
+    } else {
+        putPlace(json, key);
+        fputs("null", json->out);
     }
-    putKey(out, "timestamp");
-    putJsonText(out, objectPart->data, timestampLength);
-    putKey(out, "sequence");
-    putJsonText(out, objectPart->data + timestampLength, objectPart->length - timestampLength);
-    for (const textField& field : textFields) {
-        putKey(out, field.key);
-        putBuffer(out, &(data->*field.text));
-    }
-    putKey(out, "logPosition");
-    putc('"', out);
-    for (uint8_t byte : data->logPosition)
-        fprintf(out, "%02X", byte);
-    putc('"', out);
-    putKey(out, "tablespaces");
-    putc('[', out);
-    for (uint32_t i = 0; i < data->numTablespaces; i++) {
-        fputs(i == 0 ? "" : ",", out);
-        putBuffer(out, &data->tablespaceBuffers[i]);
-    }
-    putc(']', out);
-    putKey(out, "sqlca");
-    if (record->entry.sqlcaLength != 0)
-        putSqlca(out, &record->event);
-    else
-        fputs("null", out);
-    fputs("}\n", out);
+}
+
+void putJsonNumber(jsonWriter* json, const char* key, long long number)
+{
+    putPlace(json, key);
+    fprintf(json->out, "%lld", number);
+}
+
+void putJsonBool(jsonWriter* json, const char* key, bool value)
+{
+    putPlace(json, key);
+    fputs(value ? "true" : "false", json->out);
 }

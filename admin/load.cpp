@@ -74,7 +74,7 @@ static int parseInput(const char* path, historyList* list)
     return rc == 0 ? 0 : failWithCode(rc, "read the entries", name);
 }
 
-// Writes the records behind the entries that are there, and brings the header up to date. What the
+// Writes the records after the entries that are there, and brings the header up to date. What the
 // header says of the old entries is counted anew: it may come from a writer that did not keep it.
 static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport* totals)
 {
@@ -86,7 +86,7 @@ static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport*
         if (record->numberByPlace)
             record->data.entryNumber = totals->count + 1;
         rc = sqluhWriteEntry(handle, &record->entry);
-        countEntry(totals, &record->entry);
+        addToReport(totals, &record->entry);
         header->entryCount = totals->count;
         totals->offset += record->entry.size;
     }

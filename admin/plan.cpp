@@ -3,7 +3,7 @@
 
 #include <cstring>
 
-#include "admin/stanza.h"
+#include "admin/json.h"
 
 // The next row, later than the one given as after, to which some tablespace goes straight from row;
 // -1: there is none.

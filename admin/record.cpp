@@ -2,6 +2,7 @@
 #include "admin/record.h"
 
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
@@ -87,6 +88,24 @@ bool addTablespace(historyRecord* record, const char* bytes, size_t length)
     return true;
 }
 
+void splitObjectPart(historyRecord* record)
+{
+    const textBuffer* text = &record->data.objectPart;
+    const char* whole = text->length != 0 ? text->data : "";
+    size_t length = strnlen(whole, timestampWidth);
+    snprintf(record->timestamp, sizeof record->timestamp, "%.*s", static_cast<int>(length), whole);
+    snprintf(record->sequence, sizeof record->sequence, "%s", whole + length);
+}
+
+bool joinObjectPart(historyRecord* record)
+{
+    char whole[sizeof record->timestamp + sizeof record->sequence];
+    if (record->timestamp[0] == '\0')
+        return true;
+    snprintf(whole, sizeof whole, "%s%s", record->timestamp, record->sequence);
+    return setText(&record->data.objectPart, whole, strlen(whole));
+}
+
 bool addRecord(historyList* list, historyRecord* record)
 {
     if (list->count == list->capacity) {
@@ -132,7 +151,7 @@ static int makeRoom(historyRecord* record, bool* fitted)
 
 // Takes a line whole where the reader stops at the length that the entry states: the writer puts
 // down text and length as they are given to it.
-static bool takeLine(textBuffer* text, uint32_t* length, const char* line, const char* column)
+static bool takeLineWhole(textBuffer* text, uint32_t* length, const char* line, const char* column)
 {
     uint32_t stated;
     if (!hexColumns(column, &stated))
@@ -146,7 +165,7 @@ static bool takeLine(textBuffer* text, uint32_t* length, const char* line, const
 }
 
 // The reader gives a blank for a letter that the file holds as "-".
-static void takeLetter(char* letter, const char* head, unsigned int field)
+static void takeDash(char* letter, const char* head, unsigned int field)
 {
     if (head[entryFields[field].at] == SQLUH_EMPTY_WORD[0])
         *letter = SQLUH_EMPTY_WORD[0];
@@ -162,14 +181,14 @@ static int takeAsWritten(historyRecord* record, const char* head)
         return 0;
     zq3HistoryData* data = &record->data;
     SQLUH_ENTRY* entry = &record->entry;
-    takeLetter(&data->object, head, fieldObject);
-    takeLetter(&data->operationType, head, fieldOperationType);
-    takeLetter(&data->auxCode, head, fieldAuxCode);
-    bool taken = takeLine(&data->noteText, &entry->noteLength, head + entryNoteAt,
-                          head + entryFields[fieldNoteLength].at);
+    takeDash(&data->object, head, fieldObject);
+    takeDash(&data->operationType, head, fieldOperationType);
+    takeDash(&data->auxCode, head, fieldAuxCode);
+    bool taken = takeLineWhole(&data->noteText, &entry->noteLength, head + entryNoteAt,
+                               head + entryFields[fieldNoteLength].at);
     if (taken && entry->longTextLength != 0)
-        taken = takeLine(&data->longText, &entry->longTextLength, head + entryLongTextAt,
-                         head + entryFields[fieldLongTextLength].at);
+        taken = takeLineWhole(&data->longText, &entry->longTextLength, head + entryLongTextAt,
+                              head + entryFields[fieldLongTextLength].at);
     return taken ? 0 : sqloSystemError | ENOMEM;
 }
 
@@ -194,5 +213,7 @@ int readRecord(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, historyRecord* recor
     }
     if (rc == 0)
         rc = takeAsWritten(record, head);
+    if (rc == 0)
+        splitObjectPart(record);
     return walk.cutShort ? HISTORY_FILE_DAMAGED : rc;
 }

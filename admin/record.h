@@ -8,6 +8,10 @@ struct historyRecord {
     zq3HistoryData data; // owns its texts; each is terminated and length tells its true length
     sqlca event;        // what data.eventSqlca points at; counts only if entry.sqlcaLength is not 0
     bool numberByPlace; // the entry's number is that of its place in the history
+
+    // The two parts of data.objectPart, terminated.
+    char timestamp[timestampWidth + 1];
+    char sequence[4];
 };
 
 struct historyList {
@@ -23,6 +27,11 @@ void freeRecord(historyRecord* record);
 // Replaces a text of a record, or appends a tablespace name. False without memory.
 bool setText(textBuffer* text, const char* bytes, size_t length);
 bool addTablespace(historyRecord* record, const char* bytes, size_t length);
+
+// Bring the two parts of data.objectPart and the whole into step. joinObjectPart: false without
+// memory.
+void splitObjectPart(historyRecord* record);
+bool joinObjectPart(historyRecord* record);
 
 // Appends a record, which is the list's from then on. False without memory.
 bool addRecord(historyList* list, historyRecord* record);

@@ -20,10 +20,8 @@ enum : int { stanzaMistaken = 1 };
 int readStanzas(const char* text, size_t length, uint16_t node, historyList* list,
                 stanzaMistake* mistake);
 
-// Prints a record as a stanza, with an empty line behind it. Reading it gives the record again.
+// Prints a record as a stanza, with an empty line after it. Reading it gives the record again.
 void writeStanza(FILE* out, const historyRecord* record);
 
-// Prints a record as one JSON object on one line. A byte of a text is the character with its number
-// (json.cpp), so that any bytes make valid JSON and can be had back.
+// Prints a record as one JSON object on one line.
 void writeJson(FILE* out, const historyRecord* record);
-void putJsonText(FILE* out, const char* text, size_t length);

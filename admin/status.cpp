@@ -3,7 +3,7 @@
 
 #include <cstring>
 
-#include "admin/stanza.h"
+#include "admin/json.h"
 
 struct directoryReport {
     fileReport history, shadow;
@@ -55,10 +55,11 @@ static const char* verdict(const directoryReport* report)
     sqluhRepair due = report->due;
     if (due == sqluhRepairAnew && (isUnreadable(&report->history) || isUnreadable(&report->shadow)))
         return "cannot be read";
-    return due == sqluhRepairNone   ? "usable; both files are in step"
-           : due == sqluhRepairShadow  ? "usable; the next open rebuilds the shadow from the history"
-           : due == sqluhRepairHistory ? "usable; the next open rebuilds the history from the shadow"
-                                  : "not usable; the next open would move both files aside";
+    return due == sqluhRepairNone     ? "usable; both files are in step"
+           : due == sqluhRepairShadow ? "usable; the next open rebuilds the shadow from the history"
+           : due == sqluhRepairHistory
+               ? "usable; the next open rebuilds the history from the shadow"
+               : "not usable; the next open would move both files aside";
 }
 
 static void showFile(const char* title, const char* name, const fileReport* file)
@@ -97,23 +98,25 @@ static void showLock(const directoryReport* report)
     puts(")");
 }
 
-static void showJsonFile(const char* key, const fileReport* file)
+static void putJsonFile(jsonWriter* json, const char* key, const fileReport* file)
 {
     const SQLUH_HEADER* header = &file->header;
-    printf(",\"%s\":{\"present\":%s", key, file->present ? "true" : "false");
-    if (file->present)
-        printf(",\"size\":%llu,\"usable\":%s", file->size, file->state.usable ? "true" : "false");
-    if (file->rc == 0) {
-        fputs(",\"status\":", stdout);
-        putJsonText(stdout, &header->status, 1);
-        fputs(",\"timestamp\":", stdout);
-        putJsonText(stdout, header->timestamp, timestampWidth);
-        printf(",\"entries\":%u,\"newestAt\":%llu,\"maxTablespaces\":%u,\"maxCommandLength\":%u"
-               ",\"node\":%u",
-               header->entryCount, static_cast<unsigned long long>(header->offset3),
-               header->number8, header->maxCommandLength, header->nodeNumber);
+    beginJson(json, key, '{');
+    putJsonBool(json, "present", file->present);
+    if (file->present) {
+        putJsonNumber(json, "size", static_cast<long long>(file->size));
+        putJsonBool(json, "usable", file->state.usable);
     }
-    putchar('}');
+    if (file->rc == 0) {
+        putJsonBytes(json, "status", &header->status, 1);
+        putJsonBytes(json, "timestamp", header->timestamp, timestampWidth);
+        putJsonNumber(json, "entries", header->entryCount);
+        putJsonNumber(json, "newestAt", static_cast<long long>(header->offset3));
+        putJsonNumber(json, "maxTablespaces", header->number8);
+        putJsonNumber(json, "maxCommandLength", header->maxCommandLength);
+        putJsonNumber(json, "node", header->nodeNumber);
+    }
+    endJson(json, '}');
 }
 
 static void showJson(const historyPlace* place, const directoryReport* report)
@@ -121,18 +124,23 @@ static void showJson(const historyPlace* place, const directoryReport* report)
     static const char* const repairs[] = {"none", "shadow", "history", "anew"};
     static const char* const states[] = {"free", "being taken", "setup died",
                                          "held", "holder died", "foreign"};
-    fputs("{\"directory\":", stdout);
-    putJsonText(stdout, place->directory, strlen(place->directory));
-    printf(",\"usable\":%s,\"repair\":\"%s\"", report->due != sqluhRepairAnew ? "true" : "false",
-           repairs[report->due]);
-    showJsonFile("history", &report->history);
-    showJsonFile("shadow", &report->shadow);
-    fputs(",\"lock\":", stdout);
-    if (report->lockKnown)
-        printf("{\"state\":\"%s\",\"key\":%u,\"process\":%d}}\n", states[report->lockState.state],
-               static_cast<unsigned int>(report->lock.key), report->lockState.pid);
-    else
-        puts("null}");
+    jsonWriter json = {stdout, false};
+    beginJson(&json, nullptr, '{');
+    putJsonText(&json, "directory", place->directory);
+    putJsonBool(&json, "usable", report->due != sqluhRepairAnew);
+    putJsonText(&json, "repair", repairs[report->due]);
+    putJsonFile(&json, "history", &report->history);
+    putJsonFile(&json, "shadow", &report->shadow);
+    if (report->lockKnown) {
+        beginJson(&json, "lock", '{');
+        putJsonText(&json, "state", states[report->lockState.state]);
+        putJsonNumber(&json, "key", static_cast<unsigned int>(report->lock.key));
+        putJsonNumber(&json, "process", report->lockState.pid);
+        endJson(&json, '}');
+    } else {
+        putJsonText(&json, "lock", nullptr);
+    }
+    endJsonLine(&json);
 }
 
 int statusMain(commandLine* line)

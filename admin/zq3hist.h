@@ -150,7 +150,7 @@ struct entriesReport {
 };
 
 // Counts one more entry, which begins at report->offset.
-void countEntry(entriesReport* report, const SQLUH_ENTRY* entry);
+void addToReport(entriesReport* report, const SQLUH_ENTRY* entry);
 
 // Reads all entries of an open file, those after its header. progress: null, or what a progress bar
 // on the terminal is titled with when it takes long.

@@ -168,7 +168,7 @@ TEST_F(ProgramTest, PlansTellWhatIsMissing)
 TEST_F(ProgramTest, AMistakeNamesItsLineAndChangesNothing)
 {
     const struct {
-        const char* stanza; // behind a sound entry of three lines
+        const char* stanza; // after a sound entry of three lines
         std::string report;
         int line;
     } rows[] = {
@@ -265,11 +265,12 @@ TEST_F(ProgramTest, JsonIsValidForAnyBytes)
     run("load h/", "Operation: rename tablespace\nTimestamp: 20250101000000\nNote: "
                    "\"\\\\\\n\nTablespace: \\x7F\\xFF\nTablespace: B\n"
                    "SQLCA warnings: \\x01\n");
-    EXPECT_EQ("{\"number\":1,\"node\":0,\"operation\":\"N\",\"object\":\"P\",\"type\":\"-\","
+    EXPECT_EQ("{\"operation\":\"N\",\"object\":\"P\",\"type\":\"-\","
               "\"status\":\"A\",\"auxCode\":\"-\",\"timestamp\":\"20250101000000\",\"sequence\":"
               "\"001\",\"secondTimestamp\":\"\",\"firstText\":\"\",\"lastText\":\"\",\"id\":\"\","
               "\"qualifier\":\"\",\"name\":\"\",\"longText\":\"\",\"note\":\"\\\"\\\\\\u000A\","
-              "\"command\":\"\",\"logPosition\":\"000000000000\",\"tablespaces\":["
+              "\"command\":\"\",\"logPosition\":\"000000000000\",\"node\":0,\"number\":1,"
+              "\"tablespaces\":["
               "\"\\u007F\\u00FF\",\"B\"],"
               "\"sqlca\":{\"sqlcode\":0,\"sqlstate\":\"     \",\"id\":\"SQLCA   \",\"length\":136,"
               "\"tokens\":\"-" +
