@@ -11,15 +11,17 @@
 
 #define DEFAULT_SEQUENCE "001"
 
-static constexpr letterWord operationWords[] = {{"backup", 'B'},
-                                                {"restore", 'R'},
-                                                {"create tablespace", 'A'},
-                                                {"rename tablespace", 'N'},
+static constexpr letterWord operationWords[] = {{"backup", zq3OperationBackup},
+                                                {"restore", zq3OperationRestore},
+                                                {"create tablespace", zq3OperationCreate},
+                                                {"rename tablespace", zq3OperationRename},
                                                 {nullptr, 0}};
-static constexpr letterWord objectWords[] = {{"database", 'D'}, {"tablespace", 'P'}, {nullptr, 0}};
+static constexpr letterWord objectWords[] = {
+    {"database", zq3ObjectDatabase}, {"tablespace", zq3ObjectTablespace}, {nullptr, 0}};
 static constexpr letterWord typeWords[] = {
     {"full", 'F'}, {"incremental", 'I'}, {"delta", 'D'}, {nullptr, 0}};
-static constexpr letterWord statusWords[] = {{"active", 'A'}, {"inactive", 'I'}, {nullptr, 0}};
+static constexpr letterWord statusWords[] = {
+    {"active", zq3StatusActive}, {"inactive", zq3StatusInactive}, {nullptr, 0}};
 static constexpr letterWord noWords[] = {{nullptr, SQLUH_EMPTY_WORD[0]}};
 
 static char* memberOf(const recordField* field, historyRecord* record)
@@ -172,15 +174,14 @@ static int settleLetter(const recordField* field, historyRecord* record, fieldVa
 static int settleObject(const recordField* field, historyRecord* record, fieldValue*)
 {
     char operation = record->data.operation;
-    bool ofTablespace =
-        operation == operationWords[2].letter || operation == operationWords[3].letter;
+    bool ofTablespace = operation == zq3OperationCreate || operation == zq3OperationRename;
     *memberOf(field, record) = field->words[ofTablespace].letter;
     return 0;
 }
 
 static int settleType(const recordField* field, historyRecord* record, fieldValue*)
 {
-    bool isBackup = record->data.operation == operationWords[0].letter;
+    bool isBackup = record->data.operation == zq3OperationBackup;
     *memberOf(field, record) = isBackup ? field->words[0].letter : SQLUH_EMPTY_WORD[0];
     return 0;
 }
@@ -326,7 +327,7 @@ static void putWord(const recordField* field, const char* letter, FILE* out)
         putValue(field, letter, 1, out);
 }
 
-static void putNumbers(const recordField* field, const historyRecord* record, FILE* out)
+static void putStanzaNumbers(const recordField* field, const historyRecord* record, FILE* out)
 {
     fprintf(out, "%s:", field->name);
     for (uint32_t i = 0; i < field->count; i++)
@@ -334,26 +335,35 @@ static void putNumbers(const recordField* field, const historyRecord* record, FI
     putc('\n', out);
 }
 
+static void putJsonNumbers(const recordField* field, const historyRecord* record, jsonWriter* json)
+{
+    bool isList = field->count > 1;
+    if (isList)
+        beginJson(json, field->key, '[');
+    for (uint32_t i = 0; i < field->count; i++)
+        putJsonNumber(json, isList ? nullptr : field->key, numberIn(field, record, i));
+    if (isList)
+        endJson(json, ']');
+}
+
 void putField(const recordField* field, const historyRecord* record, FILE* out)
 {
     char digits[32];
     size_t length;
-    const zq3HistoryData* data = &record->data;
     if (isImplied(field, record))
         return;
     if (field->form == formLetter) {
         putWord(field, memberOf(field, record), out);
     } else if (field->form == formNumbers) {
-        putNumbers(field, record, out);
+        putStanzaNumbers(field, record, out);
     } else if (field->form == formNames) {
-        for (uint32_t i = 0; i < data->numTablespaces; i++)
-            putValue(field, data->tablespaceBuffers[i].data, data->tablespaceBuffers[i].length,
-                     out);
+        for (uint32_t i = 0; i < record->data.numTablespaces; i++)
+            putValue(field, record->data.tablespaceBuffers[i].data,
+                     record->data.tablespaceBuffers[i].length, out);
     } else {
         const char* text = textIn(field, record, digits, &length);
-        if (field->form == formColumns)
-            length = lengthWithoutBlanks(text, length);
-        putValue(field, text, length, out);
+        bool isPadded = field->form == formColumns;
+        putValue(field, text, isPadded ? lengthWithoutBlanks(text, length) : length, out);
     }
 }
 
@@ -361,20 +371,14 @@ void putJsonField(const recordField* field, const historyRecord* record, jsonWri
 {
     char digits[32];
     size_t length;
-    const zq3HistoryData* data = &record->data;
-    if (field->form == formNames) {
+    if (field->form == formNumbers) {
+        putJsonNumbers(field, record, json);
+    } else if (field->form == formNames) {
         beginJson(json, field->key, '[');
-        for (uint32_t i = 0; i < data->numTablespaces; i++)
-            putJsonBytes(json, nullptr, data->tablespaceBuffers[i].data,
-                         data->tablespaceBuffers[i].length);
+        for (uint32_t i = 0; i < record->data.numTablespaces; i++)
+            putJsonBytes(json, nullptr, record->data.tablespaceBuffers[i].data,
+                         record->data.tablespaceBuffers[i].length);
         endJson(json, ']');
-    } else if (field->form == formNumbers && field->count > 1) {
-        beginJson(json, field->key, '[');
-        for (uint32_t i = 0; i < field->count; i++)
-            putJsonNumber(json, nullptr, numberIn(field, record, i));
-        endJson(json, ']');
-    } else if (field->form == formNumbers) {
-        putJsonNumber(json, field->key, numberIn(field, record, 0));
     } else {
         const char* text = textIn(field, record, digits, &length);
         putJsonBytes(json, field->key, text, length);
