@@ -24,8 +24,9 @@ struct diskOp {
     ino_t inode = 0;
     size_t at = 0;            // offset of a write, length after a truncation
     std::string bytes = {};   // of a write
-    std::string name = {};    // of a file created, deleted or renamed; of a sync: which barrier
+    std::string name = {};    // of the file
     std::string newName = {}; // of a renamed file
+    std::string barrier = {}; // of a sync; docs/architecture.md says what each is for
 };
 
 // At which call of the log, and how many bytes of a write still happen; of another call: nothing
@@ -35,7 +36,21 @@ struct stopPoint {
     size_t cut = 0;
 };
 
-// While watching, such calls are logged. Behind the stop the disk refuses every change: it keeps
+// The moment after the first calls of a log, in words.
+inline std::string momentOf(const std::vector<diskOp>& log, size_t calls)
+{
+    const char* kinds[] = {"write", "truncation", "creation", "deletion", "renaming", "sync", "D"};
+    const auto isBarrier = [](const diskOp& op) { return op.kind >= diskSync; };
+    const auto here = log.begin() + static_cast<ptrdiff_t>(calls);
+    const auto next = std::find_if(here, log.end(), isBarrier);
+    std::string moment = "before all";
+    if (calls != 0)
+        moment = std::string("after the ") + kinds[here[-1].kind] + " of " + here[-1].name +
+                 " at " + std::to_string(here[-1].at);
+    return moment + ", " + (next == log.end() ? "no barrier to come" : "before " + next->barrier);
+}
+
+// While watching, such calls are logged. After the stop the disk refuses every change: it keeps
 // what a process that ends there leaves.
 struct diskControl {
     bool watching;
@@ -162,7 +177,7 @@ class DirectoryTest : public HistoryTest
     }
 
     // The image without what settles by itself: its status letter, and the checksum with it. Only
-    // blanks stand behind a header's fields; a copy stopped in the head leaves zeros there.
+    // blanks stand after a header's fields; a copy stopped in the head leaves zeros there.
     static std::string settledForm(std::string image)
     {
         constexpr size_t fieldsEnd = 176;

@@ -66,13 +66,16 @@ extern "C" int semctl(int id, int number, int command, ...) noexcept
 
 // --- System calls under the files ----------------------------------------------------------------
 
-static ino_t inodeOf(int fd)
+// What a call on an open file is to be logged as.
+static diskOp opOn(int fd, diskKind kind)
 {
     struct stat status;
-    return fstat(fd, &status) == 0 ? status.st_ino : 0;
+    std::error_code ignored;
+    const auto path = std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd), ignored);
+    return {kind, fstat(fd, &status) == 0 ? status.st_ino : 0, 0, "", path.string()};
 }
 
-// Lets a call happen as far as it may, logs it, and stops behind it where it shall.
+// Lets a call happen as far as it may, logs it, and stops after it where it shall.
 template <typename call> static auto perform(diskOp op, call happen) -> decltype(happen(0))
 {
     const size_t size = op.kind == diskWrite ? op.bytes.size() : 1;
@@ -98,16 +101,18 @@ template <typename call> static auto perform(diskOp op, call happen) -> decltype
 extern "C" ssize_t pwrite(int fd, const void* buffer, size_t count, off_t offset)
 {
     static const auto real = next(&pwrite, "pwrite64");
-    const std::string bytes(static_cast<const char*>(buffer), count);
-    return perform({diskWrite, inodeOf(fd), static_cast<size_t>(offset), bytes},
-                   [&](size_t part) { return real(fd, buffer, part, offset); });
+    diskOp op = opOn(fd, diskWrite);
+    op.at = static_cast<size_t>(offset);
+    op.bytes.assign(static_cast<const char*>(buffer), count);
+    return perform(op, [&](size_t part) { return real(fd, buffer, part, offset); });
 }
 
 extern "C" int ftruncate(int fd, off_t length) noexcept
 {
     static const auto real = next(&ftruncate, "ftruncate64");
-    return perform({diskTruncate, inodeOf(fd), static_cast<size_t>(length)},
-                   [&](size_t) { return real(fd, length); });
+    diskOp op = opOn(fd, diskTruncate);
+    op.at = static_cast<size_t>(length);
+    return perform(op, [&](size_t) { return real(fd, length); });
 }
 
 // Of all opens only one that creates or empties a file changes anything.
@@ -125,7 +130,7 @@ extern "C" int open(const char* path, int flags, ...)
     const int result = perform({exists ? diskTruncate : diskCreate, 0, 0, "", path},
                                [&](size_t) { return fd = real(path, flags, mode); });
     if (fd >= 0)
-        disk.log.back().inode = inodeOf(fd);
+        disk.log.back().inode = opOn(fd, diskCreate).inode;
     if (fd >= 0 && result < 0)
         close(fd);
     return result;
@@ -147,7 +152,7 @@ extern "C" int rename(const char* path, const char* newPath) noexcept
 // Of a batch B1 to B4; of a copy that of the source, of the target's head, or of its body.
 static std::string barrierName(int fd)
 {
-    const auto ofBatch = [](const diskOp& op) { return op.name.starts_with('B'); };
+    const auto ofBatch = [](const diskOp& op) { return op.barrier.starts_with('B'); };
     if (service == "sqlosync")
         return std::string("B") + char('1' + std::ranges::count_if(disk.log, ofBatch));
     if (disk.log.empty() || (fcntl(fd, F_GETFL) & O_ACCMODE) == O_RDONLY)
@@ -158,10 +163,12 @@ static std::string barrierName(int fd)
 // Nothing waits for a real disk here: what a sync does is in the log.
 extern "C" int fdatasync(int fd)
 {
-    return perform({diskSync, inodeOf(fd), 0, "", barrierName(fd)}, [](size_t) { return 0; });
+    diskOp op = opOn(fd, diskSync);
+    op.barrier = barrierName(fd);
+    return perform(op, [](size_t) { return 0; });
 }
 
 extern "C" int fsync(int)
 {
-    return perform({diskNames, 0, 0, "", "D"}, [](size_t) { return 0; });
+    return perform({diskNames, 0, 0, "", "", "", "D"}, [](size_t) { return 0; });
 }

@@ -3,7 +3,7 @@
 //
 // The model: what a sync covered is kept. Of the rest, each 512-byte sector may hold any of its
 // later contents or none of them, in any combination; length changes of one file, and changes of
-// names, reach the disk in their order, as far as they get; a write behind a length change that is
+// names, reach the disk in their order, as far as they get; a write past a length change that is
 // lost is not seen.
 #include "directory/fixture.h"
 
@@ -30,25 +30,52 @@ static void applyName(std::map<std::string, ino_t>* names, const diskOp& op)
         names->erase(op.name);
 }
 
-// The file with its first `lengths` pending length changes, and of each written sector what `kept`
-// says, which is asked once for each sector of each write.
-template <typename choice>
-static std::string contentOf(const diskModel& model, ino_t inode, size_t lengths, choice kept)
+// What reaches the disk: all sectors or none, but for one; or each with some chance.
+struct choice {
+    bool most = true;
+    size_t lone = SIZE_MAX; // number of the sector that is the exception
+    unsigned int share = 0; // chance in percent; 0: not at random
+    std::mt19937* random = nullptr;
+    size_t asked = 0;
+    std::string exception = {};
+
+    bool keeps(const std::string& file, size_t at)
+    {
+        if (asked++ == lone)
+            exception = ", but for sector " + std::to_string(at / sector) + " of " + file;
+        return share == 0 ? (asked - 1 == lone) != most : (*random)() % 100 < share;
+    }
+    std::string told() const
+    {
+        return share != 0 ? "sectors kept at random" : (most ? "all kept" : "all lost") + exception;
+    }
+};
+
+// Of the sectors that a write of the range touched, copies to the disk those that are kept.
+static void keepSectors(const std::string& name, const std::string& cache, size_t at, size_t end,
+                        choice* kept, std::string* content)
+{
+    for (at = at / sector * sector; at < end; at += sector)
+        if (kept->keeps(name, at) && at < content->size())
+            content->replace(at, sector, cache, at, std::min(sector, content->size() - at));
+}
+
+// The file with its first `lengths` pending length changes and the sectors that are kept.
+static std::string contentOf(const diskModel& model, const std::string& name, ino_t inode,
+                             size_t lengths, choice* kept)
 {
     std::string cache = model.durable.at(inode), content = cache;
     for (const diskOp& op : model.pending.at(inode)) {
         const size_t end = op.at + op.bytes.size();
-        const bool truncates = op.kind == diskTruncate, resizes = truncates || end > cache.size();
-        const bool reaches = !resizes || lengths > 0;
-        if (truncates && !reaches)
-            break;
-        lengths -= resizes && reaches;
-        cache.resize(resizes ? end : cache.size());
-        content.resize(resizes && reaches ? end : content.size());
+        if (op.kind == diskTruncate || end > cache.size()) {
+            if (op.kind == diskTruncate && lengths == 0)
+                break;
+            cache.resize(end);
+            content.resize(lengths > 0 ? end : content.size());
+            lengths -= lengths > 0;
+        }
         cache.replace(op.at, op.bytes.size(), op.bytes);
-        for (size_t at = op.at / sector * sector; at < end; at += sector)
-            if (kept() && at < content.size())
-                content.replace(at, sector, cache, at, std::min(sector, content.size() - at));
+        keepSectors(name, cache, op.at, end, kept, &content);
     }
     return content;
 }
@@ -60,7 +87,9 @@ class PowerLossTest : public DirectoryTest
     std::set<size_t> opened;
     size_t tried = 0, secondTried = 0;
     bool isSecond = false;
-    std::string ignored, running, bad; // the barrier taken out; the run; its first bad state
+    std::string ignored; // the barrier taken out
+    std::string running; // the scenario and the moment
+    std::string bad;     // the first bad state, in words
 
     PowerLossTest()
     {
@@ -82,12 +111,13 @@ class PowerLossTest : public DirectoryTest
 
     void advance(diskModel* model, const diskOp& op)
     {
+        choice all;
         if (op.kind == diskWrite || op.kind == diskTruncate) {
             model->pending[op.inode].push_back(op);
-        } else if (op.kind == diskSync && op.name != ignored) {
-            model->durable[op.inode] = contentOf(*model, op.inode, SIZE_MAX, [] { return true; });
+        } else if (op.kind == diskSync && op.barrier != ignored) {
+            model->durable[op.inode] = contentOf(*model, "", op.inode, SIZE_MAX, &all);
             model->pending[op.inode].clear();
-        } else if (op.kind == diskNames && op.name != ignored) {
+        } else if (op.kind == diskNames && op.barrier != ignored) {
             for (const diskOp& change : model->pendingNames)
                 applyName(&model->names, change);
             model->pendingNames.clear();
@@ -98,73 +128,87 @@ class PowerLossTest : public DirectoryTest
         }
     }
 
-    void tryState(const Files& state, const std::vector<unsigned int>& allowed)
+    bool isNew(const Files& state, const std::vector<unsigned int>& allowed)
     {
         std::string all = std::to_string(100 * allowed.front() + allowed.back());
         for (const auto& [name, bytes] : state)
             all.append(name).append(bytes);
+        return opened.insert(std::hash<std::string>()(all)).second;
+    }
+
+    void tryState(const Files& state, const choice& kept, const std::vector<unsigned int>& allowed)
+    {
         tried++;
         secondTried += isSecond;
-        if (!opened.insert(std::hash<std::string>()(all)).second)
+        if (!isNew(state, allowed))
             return;
         store(state);
         const std::string fault = faultOf(allowed);
         if (!fault.empty())
-            bad = running + ": " + fault;
-        if (!fault.empty() || !ignored.empty() || isSecond || opened.size() % slowdown != 0)
-            return;
-        // The power goes again while the state is being opened.
+            bad = running + ", " + kept.told() + ": " + fault;
+        else if (ignored.empty() && !isSecond && opened.size() % slowdown == 0)
+            cutRecovery(state, allowed);
+    }
+
+    // The power goes again while the state is being opened.
+    void cutRecovery(const Files& state, const std::vector<unsigned int>& allowed)
+    {
         isSecond = true;
         store(state);
         diskModel model = present();
         watch([this] { return openAndClose(); });
         const std::vector<diskOp> recovery = disk.log;
-        for (const diskOp& op : recovery) {
-            advance(&model, op);
+        const std::string first = running;
+        for (size_t i = 0; i < recovery.size(); i++) {
+            advance(&model, recovery[i]);
+            running = first + "; its recovery " + momentOf(recovery, i + 1);
             cutPower(model, allowed, 8);
         }
+        running = first;
         isSecond = false;
     }
 
-    // Builds the states of one moment: nothing kept, all kept, each sector alone lost or kept, and
-    // at random; with every prefix of the changes of lengths and names. Ends at the first bad one.
+    // Builds the states of one moment, with every prefix of the changes of names, and ends at the
+    // first bad one.
     void cutPower(const diskModel& model, const std::vector<unsigned int>& allowed,
                   unsigned int tries)
     {
         std::map<std::string, ino_t> names = model.names;
         for (size_t i = 0; i <= model.pendingNames.size(); i++) {
-            for (size_t way = 0, sectors = 0; bad.empty() && way < 2 * (sectors + 1) + tries;
-                 way++) {
-                const bool most = way % 2 == 0, isRandom = way >= 2 * (sectors + 1);
-                const size_t lone = way / 2 - 1; // the first two ways have none
-                const unsigned int share = std::array{10u, 50u, 90u}[random() % 3];
-                size_t asked = 0;
-                Files state;
-                for (const auto& [name, inode] : names) {
-                    const size_t lengths = most ? SIZE_MAX : way == 1 ? 0 : random() % 8;
-                    state[name] = contentOf(model, inode, lengths, [&] {
-                        const bool isLone = asked++ == lone;
-                        return isRandom ? random() % 100 < share : isLone != most;
-                    });
-                }
-                sectors = way == 0 ? asked : sectors;
-                tryState(state, allowed);
-            }
+            cutUnderNames(model, names, allowed, tries);
             if (i < model.pendingNames.size())
                 applyName(&names, model.pendingNames[i]);
         }
     }
 
-    // The scenario, stopped where told and then opened, with a batch behind it; the power goes
-    // behind every operation. Returns the number of the scenario's own.
+    // Nothing kept, all kept, each sector alone lost or kept, and some at random.
+    void cutUnderNames(const diskModel& model, const std::map<std::string, ino_t>& names,
+                       const std::vector<unsigned int>& allowed, unsigned int tries)
+    {
+        for (size_t way = 0, sectors = 0; bad.empty() && way < 2 * (sectors + 1) + tries; way++) {
+            choice kept = {way % 2 == 0, way / 2 - 1}; // the first two ways have no exception
+            if (way >= 2 * (sectors + 1))
+                kept = {kept.most, SIZE_MAX, std::array{10u, 50u, 90u}[random() % 3], &random};
+            Files state;
+            for (const auto& [name, inode] : names) {
+                const size_t lengths = kept.most ? SIZE_MAX : way == 1 ? 0 : random() % 8;
+                state[name] = contentOf(model, name, inode, lengths, &kept);
+            }
+            sectors = way == 0 ? kept.asked : sectors;
+            tryState(state, kept, allowed);
+        }
+    }
+
+    // The scenario, stopped where told and then opened, with a batch after it; the power goes after
+    // every operation. Returns the number of the scenario's own.
     int cutOne(const scenario& s, int stopAt, unsigned int tries)
     {
-        running = s.action + " on " + s.before + ", stopped at " + std::to_string(stopAt);
         store(filesOf(s.before));
         diskModel model = present();
         std::vector<diskOp> log;
         const auto step = [&](auto use, int stop = -1) {
-            EXPECT_EQ(stop < 0, watch(use, {stop, SIZE_MAX}) >= 0) << running;
+            EXPECT_EQ(stop < 0, watch(use, {stop, SIZE_MAX}) >= 0)
+                << s.action << " on " << s.before;
             log.insert(log.end(), disk.log.begin(), disk.log.end());
         };
         step([&] { return run(s); }, stopAt);
@@ -176,12 +220,11 @@ class PowerLossTest : public DirectoryTest
         const unsigned int kept = countOf(slurp(historyPath));
         step([this] { return batch(1); });
         for (size_t i = 0; i <= log.size(); i++) {
+            running = s.action + " on " + s.before + ", stopped at " + std::to_string(stopAt) +
+                      ", power lost " + momentOf(log, i);
+            const auto later = i < log.size() ? std::vector{kept, kept + 1} : std::vector{kept + 1};
             if (stopAt < 0 || i >= operations)
-                cutPower(model,
-                         i < settled      ? s.outcomes
-                         : i < log.size() ? std::vector{kept, kept + 1}
-                                          : std::vector{kept + 1},
-                         tries);
+                cutPower(model, i < settled ? s.outcomes : later, tries);
             if (i < log.size())
                 advance(&model, log[i]);
         }

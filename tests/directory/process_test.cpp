@@ -53,55 +53,83 @@ class ProcessTest : public DirectoryTest
         return found;
     }
 };
-using LockTest = ProcessTest;
+// A call of the protocol that fails once: for the creator of the set or, held meaning that the lock
+// is taken, for one that comes later.
+struct failingLockCall {
+    bool held;
+    const char* call;
+    int command;
+    std::vector<int> errors;
+    int code = 0; // 0: the error itself
+};
+static const std::vector<failingLockCall> failingLockCalls = {
+    {false, "semget", IPC_CREAT | IPC_EXCL | 0747, {ENOSPC}},
+    {false, "semctl", SETVAL, {EINVAL}},
+    {false, "semop", -1, {ENOSPC}},
+    {false, "semctl", IPC_STAT, {EINVAL}},
+    {false, "semctl", IPC_SET, {EPERM}},
+    {true, "semget", 0, {EINVAL}},
+    {true, "semctl", IPC_STAT, {EFAULT}},
+    {true, "semop", -1, {EFBIG}},
+    {true, "semget", 0, {EACCES}, sqloNLCKKeyConflict},
+    {true, "semctl", IPC_STAT, {EACCES}, sqloNLCKKeyConflict},
+    // Vanished or interrupted: once more.
+    {true, "semget", 0, {ENOENT}, sqloNLCKBusy},
+    {true, "semctl", IPC_STAT, {EINVAL, EIDRM}, sqloNLCKBusy},
+    {true, "semop", -1, {EINVAL, EIDRM, EINTR}, sqloNLCKBusy},
+};
 
-// Each row: a call of the protocol fails once, for the creator of the set or, held meaning that the
-// lock is taken, for one that comes later.
+class LockTest : public ProcessTest
+{
+  protected:
+    // Locks with the row's call failing so, then with every take interrupted.
+    void lockWith(const failingLockCall& row, int error)
+    {
+        EXPECT_EQ(sqloNLCKAbsent, lockState().state);
+        SQLO_NLCK holder = lock;
+        EXPECT_EQ(0, row.held ? sqloNLCKLock(&holder, 0, 0) : 0);
+        int times = 0;
+        onCall = [&](const std::string& call, int command) {
+            return call == row.call && command == row.command && times++ == 0 ? error : 0;
+        };
+        EXPECT_EQ(row.code != 0 ? row.code : sqloSystemError | error, sqloNLCKLock(&lock, 0, 0));
+        onCall = [](const std::string&, int command) { return command == -1 ? EINTR : 0; };
+        EXPECT_EQ(row.held ? sqloNLCKInterrupted : sqloSystemError | EINTR,
+                  sqloNLCKLock(&lock, sqloNLCKReportInterrupts, -1));
+        onCall = nullptr;
+        // A set that could not be set up is removed; one of somebody else's stays.
+        EXPECT_EQ(row.held ? sqloNLCKHeld : sqloNLCKAbsent, lockState().state);
+        EXPECT_EQ(row.held ? 0 : sqloSystemError | EINVAL, sqloNLCKUnlock(&holder));
+    }
+
+    // The pid of a creator that ended just before the given call of its setup.
+    pid_t creatorThatDiesBefore(int step)
+    {
+        const pid_t creator = inChild([&] {
+            onCall = [&](const std::string& call, int command) {
+                return command == step && call != "semget" ? _exit(77), 0 : 0;
+            };
+            return sqloNLCKLock(&lock, 0, -1);
+        });
+        EXPECT_EQ(77, WEXITSTATUS(waitFor(creator)));
+        return creator;
+    }
+};
+
 TEST_F(LockTest, EveryErrorOfEveryCallEndsAsItShould)
 {
-    const struct {
-        bool held;
-        const char* call;
-        int command;
-        std::vector<int> errors;
-        int code; // 0: the error itself
-    } rows[] = {
-        {false, "semget", IPC_CREAT | IPC_EXCL | 0747, {ENOSPC}, 0},
-        {false, "semctl", SETVAL, {EINVAL}, 0},
-        {false, "semop", -1, {ENOSPC}, 0},
-        {false, "semctl", IPC_STAT, {EINVAL}, 0},
-        {false, "semctl", IPC_SET, {EPERM}, 0},
-        {true, "semget", 0, {EINVAL}, 0},
-        {true, "semctl", IPC_STAT, {EFAULT}, 0},
-        {true, "semop", -1, {EFBIG}, 0},
-        {true, "semget", 0, {EACCES}, sqloNLCKKeyConflict},
-        {true, "semctl", IPC_STAT, {EACCES}, sqloNLCKKeyConflict},
-        // Vanished or interrupted: once more.
-        {true, "semget", 0, {ENOENT}, sqloNLCKBusy},
-        {true, "semctl", IPC_STAT, {EINVAL, EIDRM}, sqloNLCKBusy},
-        {true, "semop", -1, {EINVAL, EIDRM, EINTR}, sqloNLCKBusy},
-    };
     store(filesOf("empty"));
-    for (const auto& row : rows)
+    for (const failingLockCall& row : failingLockCalls)
         for (const int error : row.errors) {
             SCOPED_TRACE(testing::Message() << row.call << " " << row.command << " " << error);
-            EXPECT_EQ(sqloNLCKAbsent, lockState().state);
-            SQLO_NLCK holder = lock;
-            EXPECT_EQ(0, row.held ? sqloNLCKLock(&holder, 0, 0) : 0);
-            int times = 0;
-            onCall = [&](const std::string& call, int command) {
-                return call == row.call && command == row.command && times++ == 0 ? error : 0;
-            };
-            EXPECT_EQ(row.code != 0 ? row.code : sqloSystemError | error,
-                      sqloNLCKLock(&lock, 0, 0));
-            onCall = [](const std::string&, int command) { return command == -1 ? EINTR : 0; };
-            EXPECT_EQ(row.held ? sqloNLCKInterrupted : sqloSystemError | EINTR,
-                      sqloNLCKLock(&lock, sqloNLCKReportInterrupts, -1));
-            onCall = nullptr;
-            // A set that could not be set up is removed; one of somebody else's stays.
-            EXPECT_EQ(row.held ? sqloNLCKHeld : sqloNLCKAbsent, lockState().state);
-            EXPECT_EQ(row.held ? 0 : sqloSystemError | EINVAL, sqloNLCKUnlock(&holder));
+            lockWith(row, error);
         }
+}
+
+TEST_F(LockTest, KeysAreMadeOfFileAndProject)
+{
+    store(filesOf("empty"));
+    lockState();
     EXPECT_EQ(ftok(historyPath.c_str(), sqlz_krcbp->nodeNumber + 1), lock.key);
     EXPECT_EQ(0, sqloNLCKInit(historyPath.c_str(), &lock, 0));
     EXPECT_EQ(ftok(historyPath.c_str(), 'n'), lock.key);
@@ -125,20 +153,13 @@ TEST_F(LockTest, ForeignSetsAreLeftAlone)
     }
 }
 
-// A creator that ends just before one of its calls; others wait for the ready bit, and the query
-// tells what has happened.
+// Others wait for the ready bit, and the query tells what has happened.
 TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
 {
     store(filesOf("empty"));
     lockState();
     for (const int step : {SETVAL, -1, IPC_STAT, IPC_SET}) {
-        const pid_t creator = inChild([&] {
-            onCall = [&](const std::string& call, int command) {
-                return command == step && call != "semget" ? _exit(77), 0 : 0;
-            };
-            return sqloNLCKLock(&lock, 0, -1);
-        });
-        ASSERT_EQ(77, WEXITSTATUS(waitFor(creator)));
+        const pid_t creator = creatorThatDiesBefore(step);
         SQLO_NLCKSTATE state = lockState();
         if (step == SETVAL) {
             // No operation yet, so no pid: only the set's age tells.
@@ -159,20 +180,22 @@ TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
     }
 }
 
-TEST_F(ProcessTest, NothingAcknowledgedIsLostByKills)
+// A child that commits without end is killed; what it has been told is committed stays.
+class KillTest : public ProcessTest
 {
-    const unsigned int kills = 1000 / slowdown, killsPerHistory = 25;
-    std::mt19937 random(20261122);
-    std::map<int, unsigned int> found;
-    size_t committed = 0, unacknowledged = 0;
-    auto* acknowledged = static_cast<std::atomic<size_t>*>(
+  protected:
+    std::mt19937 random{20261122};
+    std::map<int, unsigned int> found; // states of the lock
+    std::atomic<size_t>* acknowledged = static_cast<std::atomic<size_t>*>(
         mmap(nullptr, 4096, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
-    for (unsigned int i = 0; i < kills; i++) {
-        if (i % killsPerHistory == 0) {
-            store(filesOf(" 10/ 10"));
-            *acknowledged = 10;
-        }
-        committed -= *acknowledged;
+
+    ~KillTest() override
+    {
+        munmap(acknowledged, 4096);
+    }
+
+    void commitUntilKilled()
+    {
         const pid_t child = fork();
         if (child == 0)
             for (unsigned int entries = 1;; entries = entries % 3 + 1)
@@ -180,10 +203,29 @@ TEST_F(ProcessTest, NothingAcknowledgedIsLostByKills)
         usleep(static_cast<useconds_t>(200 + random() % (2500 * slowdown)));
         kill(child, SIGKILL);
         waitFor(child);
-        // While a set is set up only time would tell, but here it is known that nobody lives.
+    }
+
+    // While a set is set up only time would tell, but here it is known that nobody lives.
+    void removeSet()
+    {
         const SQLO_NLCKSTATE state = lockState();
         EXPECT_EQ(state.state != sqloNLCKAbsent, semctl(state.id, 0, IPC_RMID) == 0);
         found[state.state]++;
+    }
+};
+
+TEST_F(KillTest, NothingAcknowledgedIsLostByKills)
+{
+    const unsigned int kills = 1000 / slowdown, killsPerHistory = 25;
+    size_t committed = 0, unacknowledged = 0;
+    for (unsigned int i = 0; i < kills; i++) {
+        if (i % killsPerHistory == 0) {
+            store(filesOf(" 10/ 10"));
+            *acknowledged = 10;
+        }
+        committed -= *acknowledged;
+        commitUntilKilled();
+        removeSet();
         ASSERT_EQ(0, openAndClose());
         ASSERT_EQ(0, openAndClose());
         const size_t entries = writers().size();
@@ -193,7 +235,6 @@ TEST_F(ProcessTest, NothingAcknowledgedIsLostByKills)
         unacknowledged += entries != *acknowledged;
         *acknowledged = entries;
     }
-    munmap(acknowledged, 4096);
     printf("%u kills: lock found stale %u times, half set up %u, absent %u; %zu entries "
            "acknowledged, none lost; %zu batches survived unacknowledged\n",
            kills, found[sqloNLCKStale], found[sqloNLCKSetupDied] + found[sqloNLCKSettingUp],

@@ -4,7 +4,7 @@
 class StopTest : public DirectoryTest
 {
   protected:
-    // Of the run just watched: before each call, behind it, and in a write at several lengths.
+    // Of the run just watched: before each call, after it, and in a write at several lengths.
     static std::vector<stopPoint> stops()
     {
         std::vector<stopPoint> all;
@@ -19,37 +19,60 @@ class StopTest : public DirectoryTest
         }
         return all;
     }
+
+    // What a stop of the scenario may leave, with the moment of one stop that leaves it.
+    std::map<Files, std::string> statesAfterStops(const scenario& s)
+    {
+        std::map<Files, std::string> states;
+        store(filesOf(s.before));
+        watch([&] { return run(s); });
+        const std::vector<diskOp> whole = disk.log;
+        const std::vector<stopPoint> all = stops();
+        for (size_t i = 0; i < all.size(); i += (slowdown + 2) / 3, first++) {
+            store(filesOf(s.before));
+            watch([&] { return run(s); }, all[i]);
+            EXPECT_TRUE(disk.stopped);
+            states.try_emplace(load(), stopInWords(whole, all[i]));
+        }
+        return states;
+    }
+
+    static std::string stopInWords(const std::vector<diskOp>& log, const stopPoint& stop)
+    {
+        const size_t call = static_cast<size_t>(stop.call);
+        return "stopped " + momentOf(log, call + (stop.cut == SIZE_MAX)) +
+               (stop.cut == 0 || stop.cut == SIZE_MAX
+                    ? ""
+                    : ", " + std::to_string(stop.cut) + " bytes on");
+    }
+
+    // Opens the state; opens it and stops the open, everywhere, and opens what that leaves.
+    void openAndStopTheOpen(const Files& state, const std::vector<unsigned int>& outcomes)
+    {
+        const auto open = [this] { return openAndClose(); };
+        store(state);
+        watch(open);
+        const std::vector<diskOp> whole = disk.log;
+        const std::vector<stopPoint> all = stops();
+        EXPECT_EQ("", faultOf(outcomes));
+        for (const stopPoint& stop : all)
+            if (second++ % slowdown == 0) {
+                store(state);
+                watch(open, stop);
+                EXPECT_EQ("", faultOf(outcomes)) << "its open " << stopInWords(whole, stop);
+            }
+    }
+
+    unsigned int first = 0, second = 0; // stops made; the second ones in an open
 };
 
 TEST_F(StopTest, EveryStopLeavesTheOldOrTheNewHistory)
 {
-    unsigned int first = 0, second = 0;
     for (const scenario& s : scenarios) {
-        const auto use = [&] { return run(s); };
-        const auto open = [this] { return openAndClose(); };
         SCOPED_TRACE(s.action + " on " + s.before);
-        store(filesOf(s.before));
-        watch(use);
-        std::set<Files> states;
-        const std::vector<stopPoint> firstStops = stops();
-        for (size_t i = 0; i < firstStops.size(); i += (slowdown + 2) / 3, first++) {
-            store(filesOf(s.before));
-            watch(use, firstStops[i]);
-            EXPECT_TRUE(disk.stopped);
-            states.insert(load());
-        }
-        // Each state is opened, which is stopped; then opened again.
-        for (const Files& state : states) {
-            store(state);
-            watch(open);
-            const std::vector<stopPoint> secondStops = stops();
-            EXPECT_EQ("", faultOf(s.outcomes));
-            for (const stopPoint& stop : secondStops)
-                if (second++ % slowdown == 0) {
-                    store(state);
-                    watch(open, stop);
-                    EXPECT_EQ("", faultOf(s.outcomes)) << stop.call << " cut at " << stop.cut;
-                }
+        for (const auto& [state, moment] : statesAfterStops(s)) {
+            SCOPED_TRACE(moment);
+            openAndStopTheOpen(state, s.outcomes);
         }
     }
     printf("%u first stops, %u second stops; %u opens took a part of a restored image\n", first,
