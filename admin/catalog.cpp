@@ -89,12 +89,13 @@ const char* scopeOfImage(const historyEntry* image)
 
 // Applies the renames that lie before the target and were not applied for an earlier one. They act
 // from the oldest to the newest, so that they can be applied in several goes.
-static void applyRenames(imageCatalog* catalog, int target)
+static int applyRenames(imageCatalog* catalog, int target)
 {
+    int rc = 0;
     restorePlan due = {};
     backupImage oldest = {};
     if (catalog->firstRename < 0 || catalog->renamedUpTo >= target)
-        return;
+        return 0;
     memcpy(oldest.timestamp, catalog->history.entries[catalog->oldestImage].timestamp,
            timestampLength);
     due.images = &oldest;
@@ -103,9 +104,11 @@ static void applyRenames(imageCatalog* catalog, int target)
     if (isRenamePassDue(&due)) {
         due.histData.renameIndex = catalog->renamedUpTo;
         due.histData.backupIndex = target;
-        updateHistoryEntriesforRename(&due.histData);
+        rc = updateHistoryEntriesforRename(&due.histData);
     }
-    catalog->renamedUpTo = target;
+    if (rc == 0)
+        catalog->renamedUpTo = target;
+    return rc;
 }
 
 // Sets the plan on the entries from first to the target.
@@ -124,7 +127,7 @@ static void viewEntries(const imageCatalog* catalog, int target, int first, imag
 static bool allComplete(const restorePlan* stages)
 {
     for (int i = 0; i < stages->numTablespaces; i++)
-        if (stages->list[i].lastImageType != '*')
+        if (stages->list[i].lastImageType != chainComplete)
             return false;
     return true;
 }
@@ -183,9 +186,10 @@ static int listRows(imagePlan* plan)
 int planImage(imageCatalog* catalog, int target, const planScope* scope, imagePlan* plan)
 {
     *plan = {};
-    applyRenames(catalog, target);
+    int rc = applyRenames(catalog, target);
     viewEntries(catalog, target, target, plan);
-    int rc = scope->numNames == 0
+    if (rc == 0)
+        rc = scope->numNames == 0
                  ? listTargetTablespaces(&plan->stages)
                  : listNamedTablespaces(&plan->stages, scope->names, scope->numNames);
     if (rc == 0)
@@ -244,7 +248,7 @@ bool isChainComplete(const imagePlan* plan, int column, const char** image)
     for (int row = 0; row < plan->stages.numBackups; row++)
         if (cellAt(plan, row, column) == cellFull)
             return true;
-    if (!tablespace->tracking && tablespace->lastImageType != '*')
+    if (!tablespace->tracking && tablespace->lastImageType != chainComplete)
         *image = tablespace->restoredImage;
     return false;
 }

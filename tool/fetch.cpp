@@ -6,27 +6,26 @@
 
 #include "tool/nameindex.h"
 #include "tool/zq3ckrst.h"
-#include "zq3.h"
 
 enum : int { entryGrowth = 512 };
 
 enum : uint32_t {
     commandTextCapacity = 2097152,
-    objectPartLength = 17,    // timestamp and sequence number
-    commandPrefixLength = 35, // what isCreateTempspace looks at
+    objectPartLength = zq3ObjectPartCapacity - 1, // timestamp and sequence number
+    commandPrefixLength = 35,                     // what isCreateTempspace looks at
 };
 
 // The buffers that the scan fills, and what one get left in them.
 struct scanBuffers {
-    char objectPart[objectPartLength + 1];
-    char secondTimestamp[timestampLength + 1];
-    char firstText[13];
-    char lastText[13];
-    char idText[25];
-    char qualifierText[31];
-    char nameText[129];
-    char longText[256];
-    char noteText[31];
+    char objectPart[zq3ObjectPartCapacity];
+    char secondTimestamp[zq3SecondTimestampCapacity];
+    char firstText[zq3LogNameCapacity];
+    char lastText[zq3LogNameCapacity];
+    char idText[zq3IdTextCapacity];
+    char qualifierText[zq3QualifierTextCapacity];
+    char nameText[zq3NameTextCapacity];
+    char longText[zq3LongTextCapacity];
+    char noteText[zq3NoteTextCapacity];
     char* commandText;
     textBuffer* tablespaceBuffers;
     char (*names)[nameSize]; // the name block
@@ -109,19 +108,20 @@ static bool isFirstInSequence(const char* objectPart)
 static bool isKept(scanBuffers* buffers)
 {
     const zq3HistoryData* record = &buffers->tempHistData;
-    bool active = record->status == 'A' || record->status == 'a' || record->status == 'I' ||
-                  record->status == 'i';
-    if (!active || buffers->eventSQLCA.sqlcode < 0)
+    const char counting[] = {zq3StatusActive, zq3StatusActiveLower, zq3StatusInactive,
+                             zq3StatusInactiveLower};
+    if (memchr(counting, record->status, sizeof counting) == nullptr ||
+        buffers->eventSQLCA.sqlcode < 0)
         return false;
 
     switch (record->operation) {
-    case 'B':
-    case 'R':
+    case zq3OperationBackup:
+    case zq3OperationRestore:
         return isFirstInSequence(buffers->objectPart);
-    case 'A':
+    case zq3OperationCreate:
         return !isCreateTempspace(buffers->commandText);
-    case 'O':
-    case 'N':
+    case zq3OperationOther:
+    case zq3OperationRename:
         return true;
     default:
         return false;
@@ -163,7 +163,7 @@ static int keepEntry(scanBuffers* buffers, historyData* data)
     historyEntry* entry = &data->entries[data->numEntries];
     entry->index = static_cast<uint32_t>(data->numEntries);
     copyTimestamp(entry->timestamp, buffers->objectPart);
-    if (record->operation == 'R')
+    if (record->operation == zq3OperationRestore)
         copyTimestamp(entry->backupId, buffers->idText);
     entry->operation = record->operation;
     entry->object = record->object;
@@ -204,7 +204,8 @@ static int readEntries(scanBuffers* buffers, const zq3HistoryOpenStruct* scan,
             continue;
 
         rc = keepEntry(buffers, data);
-        if (rc == 0 && timestamp != nullptr && buffers->tempHistData.operation == 'B' &&
+        if (rc == 0 && timestamp != nullptr &&
+            buffers->tempHistData.operation == zq3OperationBackup &&
             strncmp(buffers->objectPart, timestamp, timestampLength) == 0)
             *targetFound = true;
     }
@@ -223,13 +224,13 @@ static void locateTarget(historyData* data, const char* timestamp, int* numBacku
 {
     for (int i = 0; i < data->numEntries; i++) {
         const historyEntry* entry = &data->entries[i];
-        if (entry->operation == 'B') {
+        if (entry->operation == zq3OperationBackup) {
             ++*numBackups;
             if (memcmp(entry->timestamp, timestamp, timestampLength) == 0) {
                 data->backupIndex = i;
                 return;
             }
-        } else if (entry->operation == 'N' && data->renameIndex == -1) {
+        } else if (entry->operation == zq3OperationRename && data->renameIndex == -1) {
             data->renameIndex = i;
         }
     }

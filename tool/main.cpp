@@ -170,7 +170,8 @@ static void settleRestoreKind(planOptions* options)
 
 static int refuseTablespaceImage(const restorePlan* plan, restoreKind kind)
 {
-    bool tablespaceImage = plan->histData.entries[plan->histData.backupIndex].object == 'P';
+    bool tablespaceImage =
+        plan->histData.entries[plan->histData.backupIndex].object == zq3ObjectTablespace;
     return kind == restoreDatabase && tablespaceImage ? reportError(msgTablespaceImage) : 0;
 }
 
@@ -183,15 +184,16 @@ static void listEntriesFound(restorePlan* plan)
     showEntries(&plan->histData);
 }
 
-static void renameTablespaces(restorePlan* plan)
+static int renameTablespaces(restorePlan* plan)
 {
     if (!isRenamePassDue(plan))
-        return;
-    updateHistoryEntriesforRename(&plan->histData);
-    if (VERBOSE) {
+        return 0;
+    int rc = updateHistoryEntriesforRename(&plan->histData);
+    if (rc == 0 && VERBOSE) {
         printf("\n\nAfter update for rename tablespaces ...\n");
         showEntries(&plan->histData);
     }
+    return rc;
 }
 
 // Fills and prunes the matrix. Without tablespaces only the listings remain.
@@ -224,10 +226,11 @@ static int planRestore(restorePlan* plan, planOptions* options, char** argv)
 
     listEntriesFound(plan);
     rc = listBackupImages(plan);
+    if (rc == 0)
+        rc = renameTablespaces(plan);
     if (rc != 0)
         return rc;
 
-    renameTablespaces(plan);
     if (options->kind == restoreDatabase || !options->namesGiven)
         rc = listTargetTablespaces(plan);
     else

@@ -1,5 +1,6 @@
-// An index of tablespace names: finds the number that a name was entered with, whatever the number
-// of names, by open addressing in a table that is at most half full.
+// Finds records by their tablespace names, whatever the number of records, in memory of the records
+// themselves: each also heads one of the buckets that the names are spread over. A record has the
+// members name, a slot, and links.
 //
 // A history names its tablespaces millions of times, so a name is taken as three words, not as a
 // string.
@@ -7,43 +8,25 @@
 
 #include <bit>
 #include <cstdint>
-#include <cstdlib>
 #include <cstring>
 
 #include "tool/zq3ckrst.h"
 
+static_assert(std::endian::native == std::endian::little, "a word's lowest byte comes first");
+
 // A name as numbers: the same for two slots exactly when their names are the same, whatever stands
-// behind the terminators.
+// after the terminators.
 struct nameKey {
     uint64_t head;   // characters 1 to 8
     uint64_t middle; // 9 to 16
     uint32_t tail;   // 17 and 18
 };
 
-struct nameIndexSlot {
-    nameKey key;
-    int number;
-    bool used;
-};
-
-struct nameIndex {
-    nameIndexSlot* slots; // null: not allocated
-    size_t mask;
-    unsigned int shift;
-};
-
-// Converts between memory order and a word whose lowest byte is the first character.
-inline uint64_t firstCharacterLowest(uint64_t word)
-{
-    return std::endian::native == std::endian::big ? __builtin_bswap64(word) : word;
-}
-
 // Loads 8 characters; clears those from the first zero byte on.
 inline uint64_t loadCharacters(const char* text)
 {
     uint64_t word;
     memcpy(&word, text, sizeof word);
-    word = firstCharacterLowest(word);
 
     uint64_t zeros = (word - 0x0101010101010101u) & ~word & 0x8080808080808080u;
     return word & ((zeros - 1) & ~zeros);
@@ -62,11 +45,11 @@ inline nameKey makeNameKey(const char* slot)
     return key;
 }
 
-// Copies a name from slot to slot, with zeros behind it.
+// Copies a name from slot to slot, with zeros after it.
 inline void copyName(char* target, const char* source)
 {
     nameKey key = makeNameKey(source);
-    uint64_t words[2] = {firstCharacterLowest(key.head), firstCharacterLowest(key.middle)};
+    uint64_t words[2] = {key.head, key.middle};
     memcpy(target, words, sizeof words);
     target[16] = static_cast<char>(key.tail & 0xFF);
     target[17] = static_cast<char>(key.tail >> 8);
@@ -78,54 +61,36 @@ inline bool sameName(const nameKey& first, const nameKey& second)
     return first.head == second.head && first.middle == second.middle && first.tail == second.tail;
 }
 
-// Allocates an index for up to capacity names. Returns false, with nothing to free, when there is
-// no memory for it.
-inline bool initNameIndex(nameIndex* index, size_t capacity)
-{
-    *index = {};
-    if (capacity > SIZE_MAX / 4 / sizeof(nameIndexSlot))
-        return false;
-
-    size_t size = std::bit_ceil(capacity * 2 + 2);
-    index->slots = static_cast<nameIndexSlot*>(calloc(size, sizeof(nameIndexSlot)));
-    index->mask = size - 1;
-    index->shift = 64 - static_cast<unsigned int>(std::countr_zero(size));
-    return index->slots != nullptr;
-}
-
-inline void freeNameIndex(nameIndex* index)
-{
-    free(index->slots);
-    *index = {};
-}
-
-// The slot that holds the key or, when it was not entered, the free one where it would stand.
-inline nameIndexSlot* findNameSlot(const nameIndex* index, const nameKey& key)
+// The bucket of a key, of so many.
+inline size_t bucketOf(const nameKey& key, size_t buckets)
 {
     uint64_t hash =
         key.head ^ std::rotl(key.middle * 0x9E3779B97F4A7C15u, 29) ^ key.tail * 0xC2B2AE3D27D4EB4Fu;
     hash = (hash ^ hash >> 32) * 0xD6E8FEB86659FD93u;
-
-    size_t at = static_cast<size_t>(hash >> index->shift);
-    while (index->slots[at].used && !sameName(index->slots[at].key, key))
-        at = (at + 1) & index->mask;
-    return &index->slots[at];
+    return static_cast<size_t>((hash >> 32) * buckets >> 32);
 }
 
-// The number of the name in a slot, or -1.
-inline int findName(const nameIndex* index, const char* slot)
+// Forgets the names of all records; there are as many buckets as records.
+template <typename Record> void clearNames(Record* records, size_t buckets)
 {
-    nameIndexSlot* found = findNameSlot(index, makeNameKey(slot));
-    return found->used ? found->number : -1;
+    for (size_t i = 0; i < buckets; i++)
+        records[i].links = {};
 }
 
-// Enters a name; one that was entered before keeps its number. Returns whether it is new.
-inline bool enterName(nameIndex* index, const char* slot, int number)
+// The number of the record with the name in a slot, or -1.
+template <typename Record> int findName(const Record* records, size_t buckets, const char* slot)
 {
     nameKey key = makeNameKey(slot);
-    nameIndexSlot* found = findNameSlot(index, key);
-    if (found->used)
-        return false;
-    *found = {key, number, true};
-    return true;
+    uint32_t at = records[bucketOf(key, buckets)].links.first;
+    while (at != 0 && !sameName(makeNameKey(records[at - 1].name), key))
+        at = records[at - 1].links.next;
+    return static_cast<int>(at) - 1;
+}
+
+// Enters the name of a record, which no entered one has.
+template <typename Record> void enterName(Record* records, size_t buckets, size_t number)
+{
+    uint32_t* first = &records[bucketOf(makeNameKey(records[number].name), buckets)].links.first;
+    records[number].links.next = *first;
+    *first = static_cast<uint32_t>(number + 1);
 }

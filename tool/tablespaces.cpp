@@ -55,38 +55,27 @@ bool isTablespaceInHistoryEntry(historyEntry* entry, char* name, int* index)
     return found >= 0;
 }
 
-static void appendTablespace(tablespaceInfo* list, const char* name, int* count)
+// Appends a name that the list does not hold; buckets: records that the list has room for.
+static void appendTablespace(tablespaceInfo* list, size_t buckets, const char* name, int* count)
 {
     tablespaceInfo* tablespace = &list[*count];
     tablespace->id = *count;
     tablespace->deleted = 0;
-    snprintf(tablespace->name, sizeof tablespace->name, "%s", name);
+    copyName(tablespace->name, name);
+    enterName(list, buckets, static_cast<size_t>(*count));
     ++*count;
-}
-
-// Enters the list's first count names in a new index with room for more. False: no memory.
-static bool indexList(nameIndex* index, const tablespaceInfo* list, int count, size_t more)
-{
-    if (!initNameIndex(index, static_cast<size_t>(count) + more))
-        return false;
-    for (int i = 0; i < count; i++)
-        enterName(index, list[i].name, i);
-    return true;
 }
 
 void addTablespacesFromHistEntryToList(tablespaceInfo* list, historyEntry* entry, int* count)
 {
-    nameIndex index;
-    bool indexed = indexList(&index, list, *count, entry->numTablespaces);
-
-    for (uint32_t i = 0; i < entry->numTablespaces; i++) {
-        char* name = entry->tablespaceNames[i];
-        bool isNew = indexed ? enterName(&index, name, *count)
-                             : !isTablespaceInList(list, name, *count, nullptr);
-        if (isNew)
-            appendTablespace(list, name, count);
-    }
-    freeNameIndex(&index);
+    size_t held = static_cast<size_t>(*count);
+    size_t buckets = held + entry->numTablespaces;
+    clearNames(list, buckets);
+    for (size_t i = 0; i < held; i++)
+        enterName(list, buckets, i);
+    for (uint32_t i = 0; i < entry->numTablespaces; i++)
+        if (findName(list, buckets, entry->tablespaceNames[i]) < 0)
+            appendTablespace(list, buckets, entry->tablespaceNames[i], count);
 }
 
 int listTargetTablespaces(restorePlan* plan)
@@ -111,54 +100,58 @@ static void warnNotInImage(const char* name)
     fprintf(stderr, "                     remaining valid names.\n\n");
 }
 
-// Enters the names of an entry in a new index. False: no memory.
-static bool indexEntry(nameIndex* index, historyEntry* entry)
+// Puts a name of any length into a slot. False: no tablespace can have it.
+static bool fillSlot(char* slot, const char* name)
 {
-    if (!initNameIndex(index, entry->numTablespaces))
-        return false;
-    for (uint32_t i = 0; i < entry->numTablespaces; i++)
-        enterName(index, entry->tablespaceNames[i], static_cast<int>(i));
-    return true;
+    memset(slot, 0, nameSize);
+    size_t length = strlen(name);
+    memcpy(slot, name, length < nameSize ? length : 0);
+    return length < nameSize;
 }
 
-// Tells whether the entry, indexed or not, holds a name of any length; *slot receives its slot.
-static bool findInEntry(const nameIndex* index, historyEntry* entry, char* name, int* slot)
+// Marks in the list, by tracking, the tablespaces that the image holds.
+static void markHeld(tablespaceInfo* list, size_t buckets, const historyEntry* image)
 {
-    if (index->slots == nullptr)
-        return isTablespaceInHistoryEntry(entry, name, slot);
+    for (uint32_t i = 0; i < image->numTablespaces; i++) {
+        int held = findName(list, buckets, image->tablespaceNames[i]);
+        if (held >= 0)
+            list[held].tracking = 1;
+    }
+}
 
-    char padded[nameSize] = {};
-    size_t length = strlen(name);
-    memcpy(padded, name, length < nameSize ? length : 0);
-    *slot = length < nameSize ? findName(index, padded) : -1;
-    return *slot >= 0;
+// Keeps the marked ones of the list's first count tablespaces. Returns their number.
+static int keepMarked(tablespaceInfo* list, int count)
+{
+    int kept = 0;
+    for (int i = 0; i < count; i++) {
+        if (!list[i].tracking)
+            continue;
+        list[i].tracking = 0;
+        copyName(list[kept].name, list[i].name);
+        kept++;
+    }
+    return kept;
 }
 
 int listNamedTablespaces(restorePlan* plan, char** names, int numNames)
 {
-    historyEntry* target = &plan->histData.entries[plan->histData.backupIndex];
     int rc = increaseTablespaceList(0, numNames, &plan->list);
     if (rc != 0)
         return rc;
 
-    nameIndex imageIndex, listIndex;
-    indexEntry(&imageIndex, target);
-    bool indexed = indexList(&listIndex, nullptr, 0, static_cast<size_t>(numNames));
-
+    char slot[nameSize];
+    int count = 0;
+    size_t buckets = static_cast<size_t>(numNames);
     for (int i = 0; i < numNames; i++) {
-        int slot;
         str2upper(names[i]);
-        if (!findInEntry(&imageIndex, target, names[i], &slot)) {
-            warnNotInImage(names[i]);
-            continue;
-        }
-        char* name = target->tablespaceNames[slot];
-        if (indexed ? enterName(&listIndex, name, plan->numTablespaces)
-                    : !isTablespaceInList(plan->list, name, plan->numTablespaces, nullptr))
-            appendTablespace(plan->list, name, &plan->numTablespaces);
+        if (fillSlot(slot, names[i]) && findName(plan->list, buckets, slot) < 0)
+            appendTablespace(plan->list, buckets, slot, &count);
     }
-    freeNameIndex(&imageIndex);
-    freeNameIndex(&listIndex);
+    markHeld(plan->list, buckets, &plan->histData.entries[plan->histData.backupIndex]);
+    for (int i = 0; i < numNames; i++)
+        if (!fillSlot(slot, names[i]) || !plan->list[findName(plan->list, buckets, slot)].tracking)
+            warnNotInImage(names[i]);
+    plan->numTablespaces = keepMarked(plan->list, count);
     return plan->numTablespaces == 0 ? reportError(msgNoValidNames) : 0;
 }
 
@@ -177,9 +170,10 @@ int listNamedTablespaces(restorePlan* plan, char** names, int numNames)
 
 // A rename, or what the table makes of a name.
 struct nameChange {
-    char from[nameSize];
-    char to[nameSize];
+    nameLinks links;
     int seenIn; // table: the last entry that was found to list the name
+    char name[nameSize];
+    char newName[nameSize];
 };
 
 // The renames met so far on the walk, newest first, and the table of their effect.
@@ -188,13 +182,13 @@ struct renameWalk {
     int numRenames;
     nameChange* effects;
     int numEffects;
-    nameIndex index; // of effects
-    bool oneByOne;   // a rename concerns ***
+    size_t buckets; // of effects
+    bool oneByOne;  // a rename concerns ***
 };
 
 static bool isRename(const historyEntry* entry)
 {
-    return entry->operation == 'N' && entry->numTablespaces >= 2;
+    return entry->operation == zq3OperationRename && entry->numTablespaces >= 2;
 }
 
 bool isRenamePassDue(restorePlan* plan)
@@ -213,51 +207,39 @@ static void applyRename(historyEntry* entry, char* oldName, char* newName)
         copyName(entry->tablespaceNames[slot], newName);
 }
 
-// The pass without a table, for want of memory.
-static void renameOneByOne(historyData* data)
-{
-    for (int i = data->renameIndex; i < data->backupIndex; i++) {
-        if (!isRename(&data->entries[i]))
-            continue;
-        char oldName[nameSize], newName[nameSize];
-        copyName(oldName, data->entries[i].tablespaceNames[0]);
-        copyName(newName, data->entries[i].tablespaceNames[1]);
-        for (int j = i; j >= 0; j--)
-            applyRename(&data->entries[j], oldName, newName);
-    }
-}
-
 // What the table makes of a name; the name itself when no rename concerns it.
 static const char* effectOn(const renameWalk* walk, const char* name)
 {
-    int effect = findName(&walk->index, name);
-    return effect < 0 ? name : walk->effects[effect].to;
+    int effect = findName(walk->effects, walk->buckets, name);
+    return effect < 0 ? name : walk->effects[effect].newName;
 }
 
-static void setEffect(renameWalk* walk, const char* from, const char* to)
+static void setEffect(renameWalk* walk, const char* name, const char* newName)
 {
-    if (enterName(&walk->index, from, walk->numEffects)) {
-        copyName(walk->effects[walk->numEffects].from, from);
-        walk->effects[walk->numEffects].seenIn = -1;
-        walk->numEffects++;
+    int effect = findName(walk->effects, walk->buckets, name);
+    if (effect < 0) {
+        effect = walk->numEffects++;
+        walk->effects[effect].seenIn = -1;
+        copyName(walk->effects[effect].name, name);
+        enterName(walk->effects, walk->buckets, static_cast<size_t>(effect));
     }
-    copyName(walk->effects[findName(&walk->index, from)].to, to);
+    copyName(walk->effects[effect].newName, newName);
 }
 
 static void addRename(renameWalk* walk, const historyEntry* entry)
 {
     nameChange* rename = &walk->renames[walk->numRenames++];
-    copyName(rename->from, entry->tablespaceNames[0]);
-    copyName(rename->to, entry->tablespaceNames[1]);
-    if (strcmp(rename->from, DELETED_RENAMED) == 0 || strcmp(rename->to, DELETED_RENAMED) == 0)
+    copyName(rename->name, entry->tablespaceNames[0]);
+    copyName(rename->newName, entry->tablespaceNames[1]);
+    if (strcmp(rename->name, DELETED_RENAMED) == 0 || strcmp(rename->newName, DELETED_RENAMED) == 0)
         walk->oneByOne = true;
 
     // The new name becomes *** first: of a rename to itself nothing else remains.
     char newest[nameSize];
-    copyName(newest, effectOn(walk, rename->to));
-    setEffect(walk, rename->to, DELETED_RENAMED);
-    if (strcmp(rename->from, rename->to) != 0)
-        setEffect(walk, rename->from, newest);
+    copyName(newest, effectOn(walk, rename->newName));
+    setEffect(walk, rename->newName, DELETED_RENAMED);
+    if (strcmp(rename->name, rename->newName) != 0)
+        setEffect(walk, rename->name, newest);
 }
 
 // Tells how many of the entry's names the table changes; -1 when one of them is there twice.
@@ -265,7 +247,7 @@ static int countChanges(renameWalk* walk, const historyEntry* entry, int positio
 {
     int changes = 0;
     for (uint32_t i = 0; i < entry->numTablespaces; i++) {
-        int effect = findName(&walk->index, entry->tablespaceNames[i]);
+        int effect = findName(walk->effects, walk->buckets, entry->tablespaceNames[i]);
         if (effect < 0)
             continue;
         if (walk->effects[effect].seenIn == position)
@@ -281,50 +263,33 @@ static void renameInEntry(renameWalk* walk, historyEntry* entry, int position)
     int changes = walk->oneByOne ? -1 : countChanges(walk, entry, position);
     if (changes < 0) {
         for (int i = walk->numRenames - 1; i >= 0; i--)
-            applyRename(entry, walk->renames[i].from, walk->renames[i].to);
+            applyRename(entry, walk->renames[i].name, walk->renames[i].newName);
         return;
     }
     for (uint32_t i = 0; i < entry->numTablespaces && changes > 0; i++) {
-        int effect = findName(&walk->index, entry->tablespaceNames[i]);
+        int effect = findName(walk->effects, walk->buckets, entry->tablespaceNames[i]);
         if (effect < 0)
             continue;
-        copyName(entry->tablespaceNames[i], walk->effects[effect].to);
+        copyName(entry->tablespaceNames[i], walk->effects[effect].newName);
         changes--;
     }
-}
-
-// Allocates a walk for so many renames. False: no memory; what was allocated is freed by freeWalk.
-static bool initWalk(renameWalk* walk, size_t numRenames)
-{
-    *walk = {};
-    walk->renames = static_cast<nameChange*>(calloc(numRenames, sizeof(nameChange)));
-    walk->effects = static_cast<nameChange*>(calloc(numRenames, 2 * sizeof(nameChange)));
-    return walk->renames != nullptr && walk->effects != nullptr &&
-           initNameIndex(&walk->index, numRenames * 2);
-}
-
-static void freeWalk(renameWalk* walk)
-{
-    free(walk->renames);
-    free(walk->effects);
-    freeNameIndex(&walk->index);
 }
 
 // What the last entry listed before the renames, and the entry as they left it. Most entries list
 // what their neighbour lists, and the same renames make the same of it: a comparison then stands
 // for the look-up of every name.
 struct lastNames {
-    char (*before)[nameSize];  // room for the names of any entry; null: no memory
+    char (*before)[nameSize];  // room for the names of any entry
     const historyEntry* after; // null: nothing to compare with
 };
 
 static void renameLikeLast(renameWalk* walk, lastNames* last, historyEntry* entry, int position)
 {
     size_t size = sizeof *entry->tablespaceNames * entry->numTablespaces;
-    if (last->before == nullptr || size == 0) {
-        renameInEntry(walk, entry, position);
-    } else if (last->after != nullptr && last->after->numTablespaces == entry->numTablespaces &&
-               memcmp(last->before, entry->tablespaceNames, size) == 0) {
+    if (size == 0)
+        return;
+    if (last->after != nullptr && last->after->numTablespaces == entry->numTablespaces &&
+        memcmp(last->before, entry->tablespaceNames, size) == 0) {
         memcpy(entry->tablespaceNames, last->after->tablespaceNames, size);
     } else {
         memcpy(last->before, entry->tablespaceNames, size);
@@ -348,18 +313,37 @@ static size_t countRenames(const historyData* data, size_t* mostNames)
     return numRenames;
 }
 
-void updateHistoryEntriesforRename(historyData* data)
+// Allocates a walk for so many renames, in one block that starts with walk->renames and has room
+// for so many names at its end. False: no memory.
+static bool initWalk(renameWalk* walk, size_t numRenames, size_t mostNames, lastNames* last)
+{
+    *walk = {};
+    *last = {};
+    size_t changes = 3 * numRenames;
+    size_t records = changes + mostNames * nameSize / sizeof(nameChange) + 1;
+    if (numRenames > INT_MAX / 2)
+        return false;
+    walk->renames = static_cast<nameChange*>(calloc(records, sizeof(nameChange)));
+    if (walk->renames == nullptr)
+        return false;
+    walk->effects = walk->renames + numRenames;
+    walk->buckets = 2 * numRenames;
+    last->before = reinterpret_cast<char(*)[nameSize]>(walk->renames + changes);
+    return true;
+}
+
+int updateHistoryEntriesforRename(historyData* data)
 {
     size_t mostNames = 0;
     size_t numRenames = data->renameIndex < 0 ? 0 : countRenames(data, &mostNames);
     if (numRenames == 0)
-        return;
+        return 0;
 
     renameWalk walk;
-    bool allocated = initWalk(&walk, numRenames);
-    // No more than the largest entry's own names take, which were allocated.
-    lastNames last = {static_cast<char(*)[nameSize]>(malloc(mostNames * nameSize)), nullptr};
-    for (int i = data->backupIndex - 1; allocated && i >= 0; i--) {
+    lastNames last;
+    if (!initWalk(&walk, numRenames, mostNames, &last))
+        return reportError(msgNoMemoryImages);
+    for (int i = data->backupIndex - 1; i >= 0; i--) {
         historyEntry* entry = &data->entries[i];
         if (i >= data->renameIndex && isRename(entry)) {
             addRename(&walk, entry);
@@ -368,8 +352,6 @@ void updateHistoryEntriesforRename(historyData* data)
         if (walk.numRenames > 0)
             renameLikeLast(&walk, &last, entry, i);
     }
-    if (!allocated)
-        renameOneByOne(data);
-    free(last.before);
-    freeWalk(&walk);
+    free(walk.renames);
+    return 0;
 }

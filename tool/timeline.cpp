@@ -18,7 +18,7 @@ int listBackupImages(restorePlan* plan)
     backupImage* image = plan->images;
     for (int i = 0; i <= plan->histData.backupIndex; i++) {
         const historyEntry* entry = &plan->histData.entries[i];
-        if (entry->operation != 'B')
+        if (entry->operation != zq3OperationBackup)
             continue;
         memcpy(image->timestamp, entry->timestamp, timestampLength);
         image->numTablespaces = static_cast<int>(entry->numTablespaces);
@@ -47,7 +47,7 @@ int allocateTimelineMatrix(restorePlan* plan)
 // After its full image, or its creation, nothing older acts on a tablespace any more.
 static bool isComplete(const tablespaceInfo* tablespace)
 {
-    return tablespace->lastImageType == '*';
+    return tablespace->lastImageType == chainComplete;
 }
 
 static char imageLetter(char operationType)
@@ -71,7 +71,7 @@ static bool visitBackup(tablespaceInfo* tablespace, const historyEntry* entry, c
         tablespace->tracking = 1;
     }
     rowCells[tablespace->id] = letter;
-    tablespace->lastImageType = letter == cellFull ? '*' : letter;
+    tablespace->lastImageType = letter == cellFull ? chainComplete : letter;
     return true;
 }
 
@@ -79,15 +79,15 @@ static bool visitBackup(tablespaceInfo* tablespace, const historyEntry* entry, c
 // time changes nothing, so a name that an entry lists twice does no harm.
 static bool visitEntry(tablespaceInfo* tablespace, historyEntry* entry, char letter, char* rowCells)
 {
-    if (entry->operation == 'B')
+    if (entry->operation == zq3OperationBackup)
         return visitBackup(tablespace, entry, letter, rowCells);
 
-    if (tablespace->tracking && entry->operation == 'R') {
+    if (tablespace->tracking && entry->operation == zq3OperationRestore) {
         tablespace->tracking = 0;
         tablespace->restoredImage = entry->backupId;
-    } else if (tablespace->tracking && entry->operation == 'A') {
+    } else if (tablespace->tracking && entry->operation == zq3OperationCreate) {
         tablespace->tracking = 0;
-        tablespace->lastImageType = '*';
+        tablespace->lastImageType = chainComplete;
     }
     return true;
 }
@@ -101,17 +101,17 @@ struct timelineWalk {
 };
 
 // Goes on to the next older entry that can act on a tablespace. False: there is none.
-static bool nextEntry(timelineWalk* walk, const historyData* data, int numTablespaces)
+static bool stepBack(timelineWalk* walk, const historyData* data, int numTablespaces)
 {
     while (walk->position > 0) {
         walk->entry = &data->entries[--walk->position];
         switch (walk->entry->operation) {
-        case 'B':
+        case zq3OperationBackup:
             walk->rowCells -= numTablespaces;
             walk->letter = imageLetter(walk->entry->operationType);
             return true;
-        case 'R':
-        case 'A':
+        case zq3OperationRestore:
+        case zq3OperationCreate:
             return true;
         default:
             break;
@@ -122,26 +122,42 @@ static bool nextEntry(timelineWalk* walk, const historyData* data, int numTables
 
 // The column of a name, or -1. Most images list the same names in the same order, so the column
 // after the last one found is tried first.
-static int findColumn(const nameIndex* index, const tablespaceInfo* list, int numTablespaces,
-                      int lastColumn, const char* name)
+static int findColumn(const tablespaceInfo* list, int numTablespaces, int lastColumn,
+                      const char* name)
 {
     int guess = lastColumn + 1 < numTablespaces ? lastColumn + 1 : 0;
     if (memcmp(list[guess].name, name, nameSize) == 0)
         return guess;
-    return findName(index, name);
+    return findName(list, static_cast<size_t>(numTablespaces), name);
 }
 
-// One walk for all columns.
-static int fillByIndex(timelineWalk walk, historyData* data, const nameIndex* index,
-                       tablespaceInfo* list, int numTablespaces)
+static void startColumns(tablespaceInfo* list, int numTablespaces)
 {
+    size_t columns = static_cast<size_t>(numTablespaces);
+    clearNames(list, columns);
+    for (size_t i = 0; i < columns; i++) {
+        list[i].tracking = 1;
+        list[i].restoredImage = nullptr;
+        list[i].lastImageType = cellUnused;
+        enterName(list, columns, i);
+    }
+}
+
+int fillColumns(char* matrix, historyData* data, tablespaceInfo* list, int numTablespaces,
+                int numBackups)
+{
+    if (numTablespaces < 1)
+        return -1;
+
+    startColumns(list, numTablespaces);
+    char* end = matrix + static_cast<size_t>(numBackups) * static_cast<size_t>(numTablespaces);
+    timelineWalk walk = {data->backupIndex + 1, nullptr, end, cellUnused};
     int firstFailed = -1;
     int incomplete = numTablespaces;
-    while (incomplete > 0 && nextEntry(&walk, data, numTablespaces)) {
+    while (incomplete > 0 && stepBack(&walk, data, numTablespaces)) {
         int column = -1;
         for (uint32_t i = 0; i < walk.entry->numTablespaces; i++) {
-            column =
-                findColumn(index, list, numTablespaces, column, walk.entry->tablespaceNames[i]);
+            column = findColumn(list, numTablespaces, column, walk.entry->tablespaceNames[i]);
             if (column < 0 || isComplete(&list[column]))
                 continue;
             if (!visitEntry(&list[column], walk.entry, walk.letter, walk.rowCells)) {
@@ -155,45 +171,6 @@ static int fillByIndex(timelineWalk walk, historyData* data, const nameIndex* in
     return firstFailed;
 }
 
-// One walk for each column, for want of memory.
-static int fillByLookup(timelineWalk start, historyData* data, tablespaceInfo* list,
-                        int numTablespaces)
-{
-    for (int column = 0; column < numTablespaces; column++) {
-        timelineWalk walk = start;
-        while (!isComplete(&list[column]) && nextEntry(&walk, data, numTablespaces)) {
-            if (isTablespaceInHistoryEntry(walk.entry, list[column].name, nullptr) &&
-                !visitEntry(&list[column], walk.entry, walk.letter, walk.rowCells))
-                return column;
-        }
-    }
-    return -1;
-}
-
-int fillColumns(char* matrix, historyData* data, tablespaceInfo* list, int numTablespaces,
-                int numBackups)
-{
-    if (numTablespaces < 1)
-        return -1;
-
-    nameIndex index;
-    bool indexed = initNameIndex(&index, static_cast<size_t>(numTablespaces));
-    for (int column = 0; column < numTablespaces; column++) {
-        list[column].tracking = 1;
-        list[column].restoredImage = nullptr;
-        list[column].lastImageType = cellUnused;
-        if (indexed)
-            enterName(&index, list[column].name, column);
-    }
-
-    char* end = matrix + static_cast<size_t>(numBackups) * static_cast<size_t>(numTablespaces);
-    timelineWalk walk = {data->backupIndex + 1, nullptr, end, cellUnused};
-    int failed = indexed ? fillByIndex(walk, data, &index, list, numTablespaces)
-                         : fillByLookup(walk, data, list, numTablespaces);
-    freeNameIndex(&index);
-    return failed;
-}
-
 int fillTimelineMatrix(char* matrix, historyData* data, tablespaceInfo* list, int numTablespaces,
                        int numBackups)
 {
@@ -204,7 +181,7 @@ int fillTimelineMatrix(char* matrix, historyData* data, tablespaceInfo* list, in
 // --- The scan pass -------------------------------------------------------------------------------
 
 // Columns are scanned side by side: a row's cells stand together in memory, a column's do not.
-enum : int { columnsAtATime = 64 };
+enum : int { columnsAtATime = 1024 };
 
 // The kind of the needed image met last on the way back from the target, and whether older images
 // are no longer needed.

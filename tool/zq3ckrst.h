@@ -7,6 +7,8 @@
 #include <cstddef>
 #include <cstdint>
 
+#include "zq3.h"
+
 // --- Codes and messages --------------------------------------------------------------------------
 
 enum : int {
@@ -79,8 +81,7 @@ int reportScanError(const planMessage& message, int sqlcode);
 enum : size_t {
     timestampLength = 14,
     aliasLength = 8,
-    nameLength = 18,
-    nameSize = nameLength + 1, // a name's slot: the name, then zeros to the end
+    nameSize = zq3TablespaceNameCapacity, // a name's slot: the name, then zeros to the end
 };
 
 // One kept entry of the history.
@@ -88,8 +89,8 @@ struct historyEntry {
     uint32_t index; // its place among the kept entries as the scan returned them
     char timestamp[timestampLength + 1];
     char backupId[timestampLength + 1]; // of a restore: timestamp of the image that it used
-    char operation;                     // B backup image, R restore, A creation, N rename, O other
-    char object;                        // P: a tablespace-level image
+    char operation;                     // zq3Operation...
+    char object;                        // zq3Object...
     char operationType;                 // of a backup: full, incremental or delta
     uint32_t numTablespaces;
     char (*tablespaceNames)[nameSize]; // numTablespaces slots, the entry's; null when it has none
@@ -103,13 +104,21 @@ struct historyData {
     historyEntry* entries;
 };
 
+// A record's place among records that are found by name (nameindex.h). Numbers are counted from 1;
+// 0: none.
+struct nameLinks {
+    uint32_t first; // record of the bucket that this record heads
+    uint32_t next;  // record after this one in its own bucket
+};
+
 // One tablespace to be restored: a column of the timeline matrix.
 struct tablespaceInfo {
     int id;              // the column, equal to the position in the list
     char deleted;        // 0
     char tracking;       // 1 while images are taken, 0 while waiting for the restored image
     char* restoredImage; // timestamp of the image waited for; an entry's backupId
-    char lastImageType; // of the image taken last: X none yet, I, D, or * when nothing older counts
+    char lastImageType;  // cell of the image taken last, or chainComplete
+    nameLinks links;
     char name[nameSize];
 };
 
@@ -121,6 +130,7 @@ struct backupImage {
 
 // Cells of the timeline matrix, row after row, one column for each tablespace of the list.
 enum : char { cellUnused = 'X', cellFull = 'F', cellIncremental = 'I', cellDelta = 'D' };
+inline constexpr char chainComplete = '*'; // in place of a cell: nothing older counts
 
 enum restoreKind { restoreDatabase, restoreTablespace };
 
@@ -192,7 +202,8 @@ int listNamedTablespaces(restorePlan* plan, char** names, int numNames);
 bool isRenamePassDue(restorePlan* plan);
 
 // Gives the tablespaces in all entries before the target the names that they have at the target.
-void updateHistoryEntriesforRename(historyData* data);
+// Returns 0, or outOfMemory with the entries as they were.
+int updateHistoryEntriesforRename(historyData* data);
 
 // --- Timeline (timeline.cpp) ---------------------------------------------------------------------
 
@@ -215,7 +226,8 @@ int scanAndUpdateTimelineMatrix(char* matrix, tablespaceInfo* list, int numTable
 
 // The same two passes without a report: each returns the first column that fails, or -1. After the
 // fill, a column that waits in vain has tracking 0, the timestamp of the missing image in
-// restoredImage, and a lastImageType other than *.
+// restoredImage, and a lastImageType other than
+// chainComplete.
 int fillColumns(char* matrix, historyData* data, tablespaceInfo* list, int numTablespaces,
                 int numBackups);
 int scanColumns(char* matrix, int numTablespaces, int numBackups);

@@ -56,7 +56,7 @@ void readScript(const char* source)
         script.maxTablespaces = static_cast<size_t>(script.outcomes["@max"].first);
 }
 
-// Overwrites the whole buffer first: nobody may rely on what stands behind a terminator.
+// Overwrites the whole buffer first: nobody may rely on what stands after a terminator.
 void deliver(const textBuffer& buffer, uint32_t capacity, const std::string& text)
 {
     broken(buffer.capacity != capacity, "capacity of a text");

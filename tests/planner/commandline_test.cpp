@@ -172,8 +172,8 @@ TEST(Fetch, EachAllocationFailingInTurn)
     history += "BDIA 20240104000000 NEW\n";
     const char* const sites[] = {
         "1096", "1111", "1121", "1196", "1224", "1224", // buffers of the scan; entries, two's names
-        "1196", "1224", "627", "", "", "", "",          // the 513th entry; images; table of renames
-        "286", "", "", "782", "", "892", "",            // list, two indexes; matrix, index; selected
+        "1196", "1224", "627", "627",                   // the 513th entry; images; table of renames
+        "286", "782", "892", "",                        // list; matrix; selected
     };
     std::string begun = SUGGESTED TS("NEW", "04"), plan = begun + DB("01") DB("04") RULE "\n";
     int request = 0;
@@ -239,7 +239,7 @@ static std::string entry(const std::string& index, const std::string& timestamp,
 }
 
 // Two images of one timestamp, entries out of order, every letter of the keep rule, a rename that
-// takes a name away from another tablespace, entries behind the target.
+// takes a name away from another tablespace, entries after the target.
 TEST(Plan, VerboseListsEverything)
 {
     auto entries = [](const char* old, const char* taken) {
