@@ -102,34 +102,18 @@ static inline uint32_t numberAt(const char* text, uint32_t width, int base)
     return static_cast<uint32_t>(strtoul(digits, nullptr, base));
 }
 
-// A bit for each of the first count (1 to 8) characters: set where it is printable and no blank.
-// *strange becomes nonzero where one is neither printable ASCII nor a blank.
-static inline uint32_t wordColumns(const char* text, uint32_t count, uint64_t* strange)
-{
-    uint64_t used = count == 8 ? ~uint64_t{0} : (uint64_t{1} << 8 * count) - 1;
-    uint64_t word = columnsAt(text);
-    uint64_t notBlank = (word ^ everyByte(' ')) + everyByte(0x7F);
-    // Below 0x20, 0x7F and above 0x7F.
-    *strange |=
-        (~(word + everyByte(0x60)) | (word + everyByte(0x01)) | word) & used & everyByte(0x80);
-    uint64_t flags = (notBlank & used & everyByte(0x80)) >> 7;
-    return static_cast<uint32_t>(flags * 0x0102040810204080 >> 56); // flag i moves to bit i
-}
-
 // The length of a field's text when it is one word of printable ASCII with blanks after it up to
-// width (at most 24), and 7 more characters may be read there; 0 when it is anything else.
-// Whatever a locale calls white space, the scanning format takes such a field the same way.
-template <uint32_t width> static inline uint32_t wordLength(const char* text)
+// width; 0 when it is anything else. Whatever a locale calls white space, the scanning format takes
+// such a field the same way.
+static inline uint32_t wordLength(const char* text, uint32_t width)
 {
-    static_assert(width <= 24);
-    uint64_t strange = 0;
-    uint32_t used = wordColumns(text, width < 8 ? width : 8, &strange);
-    if constexpr (width > 8)
-        used |= wordColumns(text + 8, width < 16 ? width - 8 : 8, &strange) << 8;
-    if constexpr (width > 16)
-        used |= wordColumns(text + 16, width - 16, &strange) << 16;
-    bool oneWord = (used & (used + 1)) == 0;
-    return strange == 0 && oneWord ? static_cast<uint32_t>(std::countr_one(used)) : 0;
+    uint32_t length = 0;
+    while (length < width && text[length] > ' ' && text[length] < 0x7F)
+        length++;
+    for (uint32_t i = length; i < width; i++)
+        if (text[i] != ' ')
+            return 0;
+    return length;
 }
 
 // memcpy for the short texts that entries are full of: two overlapping moves instead of a call.

@@ -55,43 +55,14 @@ static inline auto targetOf(SQLUH_ENTRY* entry, sqluhFixedWords* words)
 
 // --- By column -----------------------------------------------------------------------------------
 
-// What stands between the fields of a canonical fixed part: colons, the blanks that end line 1, its
-// line feed. What is after field 23 is not looked at, here or by the scanning format.
-struct entryFrame {
-    char mask[entryFixedLength]; // 0xFF where text counts
-    char text[entryFixedLength];
-};
-
-static constexpr entryFrame makeEntryFrame(void)
-{
-    entryFrame frame = {};
-    for (const sqluhEntryField& field : entryFields)
-        frame.text[field.at + field.width] = ':';
-    for (uint32_t i = 0; i < entryReserved1Length; i++)
-        frame.text[entryReserved1At + i] = ' ';
-    frame.text[lineLength - 1] = '\n';
-    for (uint32_t i = 0; i < entryFixedLength; i++)
-        frame.mask[i] = frame.text[i] != '\0' ? '\xFF' : '\0';
-    return frame;
-}
-static constexpr entryFrame canonicalFrame = makeEntryFrame();
-
-static bool hasCanonicalFrame(const char* text)
-{
-    unsigned char different = 0;
-    for (uint32_t i = 0; i < entryFixedLength; i++)
-        different |=
-            static_cast<unsigned char>((text[i] ^ canonicalFrame.text[i]) & canonicalFrame.mask[i]);
-    char operation = text[entryFields[fieldOperation].at];
-    return different == 0 && operation > 0x20 && operation < 0x7F;
-}
-
 // Takes a number aside, or a word; tells whether the field stands as the writer writes it.
 template <unsigned int field>
 static inline bool takeColumn(const char* text, uint32_t* numbers, sqluhFixedWords* words)
 {
     constexpr sqluhEntryField row = entryFields[field];
     const char* from = text + row.at;
+    if (from[row.width] != ':')
+        return false;
     if constexpr (row.kind == kindHex) {
         return hexColumns(from, &numbers[field]);
     } else if constexpr (row.kind == kindHex16) {
@@ -102,7 +73,7 @@ static inline bool takeColumn(const char* text, uint32_t* numbers, sqluhFixedWor
         return *from != '\0'; // which ends the text for the scanning format
     } else {
         char* word = words->text[field - fieldObjectPart];
-        uint32_t length = wordLength<row.width>(from);
+        uint32_t length = wordLength(from, row.width);
         memcpy(word, from, row.width);
         word[length] = '\0';
         return length != 0;
@@ -126,7 +97,12 @@ static bool takeCanonical(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords*
                           std::integer_sequence<unsigned int, fields...>)
 {
     uint32_t numbers[entryFieldCount];
-    if (!hasCanonicalFrame(text) || !(takeColumn<fields>(text, numbers, words) && ...))
+    const char* reserved = text + entryReserved1At; // blanks, each like the one before it
+    char operation = text[entryFields[fieldOperation].at];
+    // What is after field 23 is not looked at, here or by the scanning format.
+    if (reserved[0] != ' ' || memcmp(reserved, reserved + 1, entryReserved1Length - 1) != 0 ||
+        text[lineTextLength] != '\n' || operation <= ' ' || operation >= 0x7F ||
+        !(takeColumn<fields>(text, numbers, words) && ...))
         return false;
     (storeColumn<fields>(text, numbers, entry), ...);
     return true;

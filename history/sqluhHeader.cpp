@@ -154,7 +154,7 @@ static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header)
 // Takes the header's timestamp from the entry at offset3.
 static int takeTimestampFromEntry(SQLO_FHANDLE fh, SQLUH_HEADER* header)
 {
-    char objectPart[18] = {};
+    char objectPart[zq3ObjectPartCapacity] = {};
     zq3HistoryData data = {};
     data.objectPart.data = objectPart;
     data.objectPart.capacity = sizeof objectPart;

@@ -7,19 +7,21 @@
 #include "history/sqluhfun.h"
 #include "history/sqluhist.h"
 
-enum : size_t { tablespaceSlot = 19 };
-
 // The nine texts before the command text, in the record's order, with the size of their buffers.
 struct textSlot {
     textBuffer zq3HistoryData::*text;
     uint32_t capacity;
 };
 static constexpr textSlot textSlots[] = {
-    {&zq3HistoryData::objectPart, 18}, {&zq3HistoryData::secondTimestamp, 15},
-    {&zq3HistoryData::firstText, 13},  {&zq3HistoryData::lastText, 13},
-    {&zq3HistoryData::idText, 25},     {&zq3HistoryData::qualifierText, 31},
-    {&zq3HistoryData::nameText, 129},  {&zq3HistoryData::longText, 256},
-    {&zq3HistoryData::noteText, 31},
+    {&zq3HistoryData::objectPart, zq3ObjectPartCapacity},
+    {&zq3HistoryData::secondTimestamp, zq3SecondTimestampCapacity},
+    {&zq3HistoryData::firstText, zq3LogNameCapacity},
+    {&zq3HistoryData::lastText, zq3LogNameCapacity},
+    {&zq3HistoryData::idText, zq3IdTextCapacity},
+    {&zq3HistoryData::qualifierText, zq3QualifierTextCapacity},
+    {&zq3HistoryData::nameText, zq3NameTextCapacity},
+    {&zq3HistoryData::longText, zq3LongTextCapacity},
+    {&zq3HistoryData::noteText, zq3NoteTextCapacity},
 };
 
 static constexpr size_t lengthOfTextSlots(void)
@@ -54,7 +56,7 @@ static void layOutHistoryData(zq3HistoryData* data, unsigned int numTablespaces,
         at += numTablespaces * sizeof(textBuffer);
     }
     for (unsigned int i = 0; i < numTablespaces; i++)
-        at = slotAt(&data->tablespaceBuffers[i], at, tablespaceSlot);
+        at = slotAt(&data->tablespaceBuffers[i], at, zq3TablespaceNameCapacity);
     for (const textSlot& slot : textSlots)
         at = slotAt(&(data->*slot.text), at, slot.capacity);
     if (commandCapacity != 0)
@@ -69,7 +71,7 @@ int sqluhAllocateHistoryData(zq3HistoryData** dataOut, SMemPool* pool, unsigned 
     void* block = nullptr;
     uint64_t commandCapacity = withCommandText ? uint64_t{commandTextLength} + 1 : 0;
     uint64_t size = sizeof(zq3HistoryData) + sizeof(sqlca) +
-                    uint64_t{numTablespaces} * (sizeof(textBuffer) + tablespaceSlot) +
+                    uint64_t{numTablespaces} * (sizeof(textBuffer) + zq3TablespaceNameCapacity) +
                     lengthOfTextSlots() + commandCapacity;
     // A size or a capacity that wraps would make a block smaller than what is laid out in it.
     bool fits = commandCapacity <= UINT32_MAX && size <= SIZE_MAX / 2;
