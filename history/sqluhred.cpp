@@ -29,11 +29,6 @@ int sqluhInitWorkArea(SQLUH_WORKAREA* workArea, uint32_t size)
     return rc;
 }
 
-static char blankForEmpty(char letter)
-{
-    return letter == SQLUH_EMPTY_WORD[0] ? ' ' : letter;
-}
-
 static int readFixedPart(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, bool* begun,
                          const char* operation)
 {
@@ -52,10 +47,10 @@ static int readFixedPart(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, bool* begun,
     return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), operation);
 }
 
-static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* words,
+static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhProvenEntry* proven,
                           const char* operation)
 {
-    int found = sqluhTakeFixedPart(text, entry, words);
+    int found = sqluhTakeFixedPart(text, entry, &proven->words);
     if (found < static_cast<int>(entryFieldCount)) {
         logRecord({textItem(TEXT_ENTRY_FIELDS), numberItem(TEXT_ENTRY_FIELDS_READ, found),
                    dataItem("", text, entryFixedLength)},
@@ -63,9 +58,12 @@ static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords*
         return HISTORY_FILE_DAMAGED;
     }
     zq3HistoryData* data = entry->data;
-    data->object = blankForEmpty(data->object);
-    data->operationType = blankForEmpty(data->operationType);
-    data->auxCode = blankForEmpty(data->auxCode);
+    char* letters[optionalLetterCount] = {&data->object, &data->operationType, &data->auxCode};
+    for (unsigned int i = 0; i < optionalLetterCount; i++) {
+        proven->optional[i] = *letters[i];
+        if (*letters[i] == SQLUH_EMPTY_WORD[0])
+            *letters[i] = ' ';
+    }
     if (entry->size < entryMinLength) {
         logRecord({textItem(TEXT_ENTRY_LENGTHS), numberItem("Size field: ", entry->size),
                    dataItem("", text, entryFixedLength)},
@@ -182,7 +180,7 @@ int sqluhProveEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workAre
 {
     int rc = readFixedPart(fh, workArea, &proven->begun, operation);
     if (rc == 0)
-        rc = parseFixedPart(workArea->buffer, entry, &proven->words, operation);
+        rc = parseFixedPart(workArea->buffer, entry, proven, operation);
     if (rc == 0)
         rc = readBody(fh, workArea, entry->size, operation);
     if (rc == 0)
@@ -193,21 +191,6 @@ int sqluhProveEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workAre
 }
 
 // --- Taking an entry out -------------------------------------------------------------------------
-
-static void copyText(textBuffer* target, const char* text, size_t length)
-{
-    target->length = static_cast<uint32_t>(length);
-    if (target->data == nullptr || target->capacity == 0)
-        return;
-    size_t copied = length < target->capacity ? length : target->capacity - 1;
-    copyShort(target->data, text, copied);
-    target->data[copied] = '\0';
-}
-
-static void copyWord(textBuffer* target, const char* word, const char* empty)
-{
-    copyText(target, word, strcmp(word, empty) == 0 ? 0 : strlen(word));
-}
 
 // Ends the text of at most length characters at text and copies it.
 static void takeText(textBuffer* target, char* text, uint32_t length)
@@ -222,7 +205,7 @@ static unsigned int compareTimestamp(const char* filter, const char* timestamp)
     return order < 0 ? matchFilterEarlier : order > 0 ? matchFilterLater : matchFilterEqual;
 }
 
-static void parseLogPosition(const char* text, uint8_t* position)
+void sqluhParseLogPosition(const char* text, uint8_t* position)
 {
     memset(position, 0, sizeof zq3HistoryData::logPosition);
     for (uint32_t group = 0; group < 3; group++) {
@@ -241,10 +224,9 @@ static void takeLine2(zq3HistoryData* data, const sqluhFixedWords* words)
         char* member = reinterpret_cast<char*>(data) + row.member;
         const char* word = wordOfField(words, field);
         if (row.kind == kindLogPosition)
-            parseLogPosition(word, data->logPosition);
+            sqluhParseLogPosition(word, data->logPosition);
         else
-            copyWord(reinterpret_cast<textBuffer*>(member), word,
-                     row.kind == kindTimestamp ? SQLUH_EMPTY_TIMESTAMP : SQLUH_EMPTY_WORD);
+            copyWord(reinterpret_cast<textBuffer*>(member), word, row.kind);
     }
 }
 
@@ -280,44 +262,6 @@ static unsigned int takeObjectNames(SQLUH_ENTRY* entry, char* at, const char* qu
     if (nameFilter != nullptr && strcmp(name, nameFilter) == 0)
         flags |= matchName;
     return flags;
-}
-
-// For a head that is no number: does not fit, whatever room there is.
-static constexpr uint64_t noTablespaceLength = UINT64_MAX - tablespaceLineExtra;
-
-// The length at the head of a tablespace line: what scanning a hexadecimal number of eight
-// characters gives.
-static uint64_t tablespaceLength(const char* line)
-{
-    // The next line's place waits for this number, so the usual one, of two digits, takes the
-    // shortest way to it.
-    uint32_t high = hexDigits.value[static_cast<unsigned char>(line[6])];
-    uint32_t low = hexDigits.value[static_cast<unsigned char>(line[7])];
-    if (memcmp(line, "000000", 6) == 0 && (high | low) <= 0x0F)
-        return high << 4 | low;
-    uint32_t length = 0;
-    if (hexColumns(line, &length))
-        return length;
-    char digits[headerNumberWidth + 1];
-    memcpy(digits, line, headerNumberWidth);
-    digits[headerNumberWidth] = '\0';
-    return sscanf(digits, "%8x", &length) == 1 ? length : noTablespaceLength;
-}
-
-// Tells whether the tablespace line at at has a length and fits before end. Starts with *head 0,
-// which is no number.
-//
-// Neighbouring names often have one length. Comparing the head with the last one lets the processor
-// go on with the next line before this one's number is known.
-static inline bool tablespaceFits(const char* at, const char* end, uint64_t* head, uint64_t* length)
-{
-    if (end - at < static_cast<ptrdiff_t>(tablespaceLineExtra))
-        return false;
-    uint64_t digits = columnsAt(at);
-    if (digits != *head)
-        *length = tablespaceLength(at);
-    *head = digits;
-    return static_cast<uint64_t>(end - at) >= *length + tablespaceLineExtra;
 }
 
 // Takes count tablespace lines from at to at most end, storing the first of them in buffers.
@@ -383,7 +327,7 @@ static int32_t signedNumberAt(const char* text, uint32_t width)
     return static_cast<int32_t>(strtoll(digits, nullptr, 10));
 }
 
-static void fillSqlca(sqlca* ca, const char* line)
+void sqluhFillSqlca(sqlca* ca, const char* line)
 {
     *ca = {};
     memcpy(ca->sqlcaid, line + sqlcaIdField.at, sqlcaIdField.width);
@@ -405,7 +349,7 @@ static void fillSqlca(sqlca* ca, const char* line)
 static unsigned int takeSqlca(sqlca* target, const char* line)
 {
     if (target != nullptr)
-        fillSqlca(target, line);
+        sqluhFillSqlca(target, line);
     int32_t code = signedNumberAt(line + sqlcaCodeField.at, sqlcaCodeField.width);
     return code != 0 ? unsigned{matchSqlcodeSet} : 0;
 }

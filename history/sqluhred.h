@@ -4,11 +4,18 @@
 // operation, in all of these, is the name under which failures are logged; null: they are not.
 #pragma once
 
+#include <cstdio>
+#include <cstring>
+
+#include "history/sqluhColumns.h"
 #include "history/sqluhFixedPart.h"
+
+enum : unsigned int { optionalLetterCount = 3 };
 
 // Offsets are from the start of the record, which is in the work area.
 struct sqluhProvenEntry {
-    bool begun; // the file held something at its position
+    bool begun;                         // the file held something at its position
+    char optional[optionalLetterCount]; // object, operation type and aux code, "-" as it stands
     sqluhFixedWords words;
     uint32_t objectNamesAt; // both lines, if the entry has any
     uint32_t tablespacesAt;
@@ -30,3 +37,67 @@ int sqluhPassTablespaces(const SQLUH_ENTRY* entry, const SQLUH_WORKAREA* workAre
 // Reads and proves the whole entry at the file's position, and takes nothing out. Returns what
 // sqluhReadEntry without filters does, but for TABLESPACE_LIST_TRUNCATED, and logs the same.
 int sqluhCheckEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea);
+
+// --- Taking texts out ----------------------------------------------------------------------------
+
+static inline void copyText(textBuffer* target, const char* text, size_t length)
+{
+    target->length = static_cast<uint32_t>(length);
+    if (target->data == nullptr || target->capacity == 0)
+        return;
+    size_t copied = length < target->capacity ? length : target->capacity - 1;
+    copyShort(target->data, text, copied);
+    target->data[copied] = '\0';
+}
+
+// Copies a word, or the empty text for what stands in the file for it.
+static inline void copyWord(textBuffer* target, const char* word, sqluhFieldKind kind)
+{
+    const char* empty = kind == kindTimestamp ? SQLUH_EMPTY_TIMESTAMP : SQLUH_EMPTY_WORD;
+    copyText(target, word, strcmp(word, empty) == 0 ? 0 : strlen(word));
+}
+
+// For a head that is no number: does not fit, whatever room there is.
+static constexpr uint64_t noTablespaceLength = UINT64_MAX - tablespaceLineExtra;
+
+// The length at the head of a tablespace line: what scanning a hexadecimal number of eight
+// characters gives.
+static inline uint64_t tablespaceLength(const char* line)
+{
+    // The next line's place waits for this number, so the usual one, of two digits, takes the
+    // shortest way to it.
+    uint32_t high = hexDigits.value[static_cast<unsigned char>(line[6])];
+    uint32_t low = hexDigits.value[static_cast<unsigned char>(line[7])];
+    if (memcmp(line, "000000", 6) == 0 && (high | low) <= 0x0F)
+        return high << 4 | low;
+    uint32_t length = 0;
+    if (hexColumns(line, &length))
+        return length;
+    char digits[headerNumberWidth + 1];
+    memcpy(digits, line, headerNumberWidth);
+    digits[headerNumberWidth] = '\0';
+    return sscanf(digits, "%8x", &length) == 1 ? length : noTablespaceLength;
+}
+
+// Tells whether the tablespace line at at has a length and fits before end. Starts with *head 0,
+// which is no number.
+//
+// Neighbouring names often have one length. Comparing the head with the last one lets the processor
+// go on with the next line before this one's number is known.
+static inline bool tablespaceFits(const char* at, const char* end, uint64_t* head, uint64_t* length)
+{
+    if (end - at < static_cast<ptrdiff_t>(tablespaceLineExtra))
+        return false;
+    uint64_t digits = columnsAt(at);
+    if (digits != *head)
+        *length = tablespaceLength(at);
+    *head = digits;
+    return static_cast<uint64_t>(end - at) >= *length + tablespaceLineExtra;
+}
+
+// Takes the six bytes out of a text of 12 hexadecimal digits; zero from the first group of four on
+// that is none.
+void sqluhParseLogPosition(const char* text, uint8_t* position);
+
+// Takes an sqlca line, of 194 characters, apart.
+void sqluhFillSqlca(sqlca* ca, const char* line);
