@@ -1,12 +1,13 @@
 // The header: reading it, with the conversion of older versions, and writing it. Stands on the
 // primitives and on the reader of entries, which older headers send it to.
 
+#include "history/sqluhHeader.h"
+
 #include <cstdio>
 #include <cstring>
 
 #include "history/sqluhColumns.h"
 #include "history/sqluhDiagnostics.h"
-#include "history/sqluhist.h"
 
 static_assert(placeInFormat(headerFormat, 13).at == headerVersionAt);
 static_assert(placeInFormat(headerFormat, 14).at == headerNumber15At);
@@ -70,10 +71,10 @@ int sqluhFindMaxCommandLen(SQLO_FHANDLE fh, uint32_t* maxLength)
 }
 
 // Reads the header's text into buffer, which holds one byte more for the terminator.
-static int readHeaderText(SQLO_FHANDLE fh, char* buffer)
+static int readHeaderText(SQLO_FHANDLE fh, char* buffer, const char* operation)
 {
     uint32_t bytesRead = 0;
-    int rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr), readHeader);
+    int rc = logged(sqloseek(fh, 0, sqloFromStart, nullptr), operation);
     if (rc != 0)
         return rc;
 
@@ -85,8 +86,8 @@ static int readHeaderText(SQLO_FHANDLE fh, char* buffer)
     bool partial = rc == END_OF_FILE || rc == 0;
     logRecord({textItem(partial ? TEXT_HEADER_PARTIAL : TEXT_HEADER_READ), codeItem("rc = ", rc),
                numberItem("Bytes read: ", bytesRead), dataItem("", buffer, headerLength)},
-              readHeader);
-    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), readHeader);
+              operation);
+    return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), operation);
 }
 
 // Fields 1 to 13. What a damaged text leaves out stays zero: the checksum tells.
@@ -136,7 +137,8 @@ static uint32_t takeVersionedFields(const char* text, SQLUH_HEADER* header)
 
 // Parses the header's text. Returns 0, or HISTORY_FILE_DAMAGED when the entries had to be scanned
 // for field 17 and could not be.
-static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header)
+static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header,
+                       const char* operation)
 {
     memset(header, 0, sizeof *header);
     scanHeaderFields(text, header);
@@ -148,7 +150,7 @@ static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header)
     uint32_t longest = 0;
     int rc = sqluhFindMaxCommandLen(fh, &longest);
     header->maxCommandLength = longest;
-    return rc == 0 ? 0 : loggedPlain(HISTORY_FILE_DAMAGED, readHeader);
+    return rc == 0 ? 0 : loggedPlain(HISTORY_FILE_DAMAGED, operation);
 }
 
 // Takes the header's timestamp from the entry at offset3.
@@ -200,29 +202,33 @@ static int convertOldHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
     return 0;
 }
 
-int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+int sqluhTakeHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header, const char* operation)
 {
-    pdtEntry();
-
     void* block = nullptr;
-    int rc = logged(allocateZeroed(headerLength + 1, &block));
+    int rc = logged(allocateZeroed(headerLength + 1, &block), operation);
     if (rc == 0) {
         char* text = static_cast<char*>(block);
-        rc = readHeaderText(fh, text);
+        rc = readHeaderText(fh, text, operation);
         if (rc == 0) {
-            int scanned = parseHeader(fh, text, header);
-            rc = sqluhCheckHeaderChecksum(header) ? 0 : logged(HISTORY_FILE_DAMAGED);
+            int scanned = parseHeader(fh, text, header, operation);
+            rc = sqluhCheckHeaderChecksum(header) ? 0 : logged(HISTORY_FILE_DAMAGED, operation);
             if (rc == 0 && header->version < versionWithTimestamp)
                 rc = convertOldHeader(fh, header);
             rc = firstOf(rc, scanned);
         }
         sqlofmblkEx(block);
     }
-    if (rc < 0 && rc != END_OF_FILE) {
-        sqlt_logadmin(__func__, pdAdminReadFailed);
-        logRecord({textItem(TEXT_HEADER_FAILED)});
+    if (rc < 0 && rc != END_OF_FILE && operation != nullptr) {
+        sqlt_logadmin(operation, pdAdminReadFailed);
+        logRecord({textItem(TEXT_HEADER_FAILED)}, operation);
     }
+    return rc;
+}
 
+int sqluhReadHeader(SQLO_FHANDLE fh, SQLUH_HEADER* header)
+{
+    pdtEntry();
+    int rc = sqluhTakeHeader(fh, header, __func__);
     pdtExit(rc);
     return rc;
 }

@@ -27,6 +27,8 @@ enum : int {
     HISTORY_FILE_DAMAGED = -2161,     // a record is damaged, incomplete or cannot be formatted
     HISTORY_FILE_MISSING = -2036,     // the directory holds no history file
     HISTORY_FILE_RECREATED = 2160,    // both files were unusable: moved aside, an empty pair made
+    HISTORY_READ_FROM_SHADOW = 2162,  // the shadow was read: the history file cannot be used
+    HISTORY_READ_PAST_DAMAGE = 2163,  // one copy has a damaged entry: the other one was read
     TABLESPACE_LIST_TRUNCATED = 2165, // more tablespaces than the caller's buffers hold
     HISTORY_WARNING = 2172,           // an error turned into a warning by sqluh_build_warning
 };
@@ -556,6 +558,45 @@ int sqluhEndBatch(SQLUH_HANDLE** handle, unsigned int flags);
 int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory);
 
 } // extern "C"
+
+// --- The committed history, only looked at -------------------------------------------------------
+
+// The history of a directory as the last commit left it, in memory.
+struct SQLUH_COMMITTED {
+    uint32_t numRows;        // entries
+    uint32_t maxTablespaces; // largest number of names that one of them lists
+    int failure;             // what ended the rows early; 0: nothing did
+    bool fromShadow;         // they are the shadow's
+    // The damaged entry that ended the rows or, if the other copy was read instead, the damaged one
+    // there: its offset, and its number counted from 1. 0: there is none.
+    long long damagedAt;
+    uint32_t damagedEntry;
+    SQLUH_FILESTATE history, shadow; // what the two headers said
+    SQLUH_HEADER header;             // of the copy that was read
+    struct sqluhRows* rows;          // the library's
+};
+
+// Reads the committed history of a directory. It opens for reading only, creates, repairs and moves
+// nothing, and takes the directory's lock, for as long as it reads, only where a writer leaves it
+// no quiet moment; it does not wait for a writer that does nothing.
+//
+// directory: with its last separator, at most 1011 bytes. Stores what was read, the caller's until
+// sqluhFreeCommitted, and returns 0; HISTORY_READ_FROM_SHADOW; HISTORY_READ_PAST_DAMAGE. Or stores
+// null and returns HISTORY_FILE_MISSING when neither file is there; HISTORY_FILE_DAMAGED when
+// neither can be used; sqluhPathTooLong; sqloNLCKBusy, or another lock code, when writers kept it
+// off for some seconds; an allocation's code; sqloSystemError with the errno of what kept it from
+// opening or reading a file that may be sound.
+int sqluhReadCommitted(const char* directory, SQLUH_COMMITTED** out);
+
+// Copies a row, counted from 0, into the entry and its data, as sqluhReadEntry would. asWritten:
+// object, operation type, aux code, note and long text as they stand in the file, so that writing
+// the entry gives the same bytes. Returns 0 or TABLESPACE_LIST_TRUNCATED; past the last row
+// END_OF_FILE or the failure that ended them, with the entry as it was.
+int sqluhGetCommitted(const SQLUH_COMMITTED* committed, uint32_t row, SQLUH_ENTRY* entry,
+                      bool asWritten);
+
+// Releases it and sets the caller's pointer to null, which it may have been.
+void sqluhFreeCommitted(SQLUH_COMMITTED** committed);
 
 // --- Utilities -----------------------------------------------------------------------------------
 

@@ -1,12 +1,9 @@
 // The three scan calls.
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <pthread.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
-#include "platform/client/snapshot.h"
+#include "history/sqluhist.h"
 #include "zq3.h"
 
 #define ZQ3_EXPORT extern "C" __attribute__((visibility("default")))
@@ -29,10 +26,8 @@ enum : size_t { maxAliasLength = 8 };
 // One open scan.
 struct historyScan {
     uint16_t handle;
-    historySnapshot snapshot;
-    SQLUH_WORKAREA workArea;
-    uint32_t rowsLeft;
-    int failure;                      // the code of a get that failed: nothing can be got after it
+    SQLUH_COMMITTED* history;
+    uint32_t nextRow;
     const zq3HistoryData* lastRecord; // the record of the last get
     uint32_t filledSlots;             // name slots that the last get filled in it
 };
@@ -84,8 +79,7 @@ static bool nameOfAlias(const char* alias, char* name)
     return true;
 }
 
-// Forms the directory of a database and sees to it that a history file is in it: opening a history
-// makes one where there is none. directory holds pathCapacity bytes.
+// Forms the directory of a database. directory holds pathCapacity bytes.
 static int findDirectory(const char* alias, char* directory)
 {
     char name[maxAliasLength + 1];
@@ -95,25 +89,15 @@ static int findDirectory(const char* alias, char* directory)
     const char* separator = "/";
     if (folder == nullptr || folder[0] == '\0')
         folder = separator = "";
-    if (strlen(folder) + strlen(name) + 2 > maxDirectoryLength)
-        return sqluhPathTooLong;
-
-    char path[pathCapacity];
-    struct stat status;
-    ossSnprintf(directory, pathCapacity, "%s%s%s/", folder, separator, name);
-    ossSnprintf(path, sizeof path, "%s" SQLUH_HISTORY_NAME, directory);
-    if (stat(path, &status) != 0 || !S_ISREG(status.st_mode))
-        return scanNoDatabase;
-    // To the library a file that may not be read is damaged, and it would move it aside.
-    return access(path, R_OK) == 0 ? 0 : sqloSystemError | errno;
+    int length = ossSnprintf(directory, pathCapacity, "%s%s%s/", folder, separator, name);
+    return length < 0 || length > static_cast<int>(maxDirectoryLength) ? sqluhPathTooLong : 0;
 }
 
 // --- The table of scans --------------------------------------------------------------------------
 
 static void freeScan(historyScan* scan)
 {
-    if (scan->workArea.buffer != nullptr)
-        sqlofmblkEx(scan->workArea.buffer);
+    sqluhFreeCommitted(&scan->history);
     free(scan);
 }
 
@@ -150,24 +134,18 @@ static historyScan* findScan(uint16_t handle, bool take)
 // --- The calls -----------------------------------------------------------------------------------
 
 // Opens the scan of a directory; *scanOut is set unless the result is negative.
-static int openScan(char* directory, historyScan** scanOut)
+static int openScan(const char* directory, historyScan** scanOut)
 {
     historyScan* scan = static_cast<historyScan*>(calloc(1, sizeof *scan));
     if (scan == nullptr)
         return scanNoMemory;
-    int rc = sqluhInitWorkArea(&scan->workArea, defaultWorkAreaSize);
-    if (rc == 0)
-        rc = takeSnapshot(directory, &scan->workArea, &scan->snapshot);
-    if (rc >= 0 && !enterScan(scan)) {
-        sqloclose(scan->snapshot.file);
+    int rc = sqluhReadCommitted(directory, &scan->history);
+    if (rc >= 0 && !enterScan(scan))
         rc = scanTooManyScans;
-    }
-    if (rc < 0) {
+    if (rc < 0)
         freeScan(scan);
-        return rc;
-    }
-    scan->rowsLeft = scan->snapshot.numRows;
-    *scanOut = scan;
+    else
+        *scanOut = scan;
     return rc;
 }
 
@@ -188,8 +166,12 @@ ZQ3_EXPORT int zq3HistoryOpenScan(unsigned int version, void* openStruct, sqlca*
     if (rc == 0)
         rc = openScan(directory, &scan);
     if (rc >= 0) {
-        request->numRows = scan->snapshot.numRows;
-        request->maxTablespaces = scan->snapshot.maxTablespaces;
+        // What ended the rows early is a row of its own, which no get delivers, and must be got.
+        uint32_t failed = scan->history->failure != 0;
+        request->numRows = scan->history->numRows + failed;
+        request->maxTablespaces = scan->history->maxTablespaces;
+        if (request->maxTablespaces == 0)
+            request->maxTablespaces = failed;
         request->handle = scan->handle;
     }
     return outcome(ca, rc);
@@ -231,42 +213,26 @@ static void clearRecord(zq3HistoryData* record)
         sqloinca(record->eventSqlca);
 }
 
-// Reads the next entry into the record. Of the name slots only those are emptied that the entry
+// Copies the next entry into the record. Of the name slots only those are emptied that the entry
 // before it filled and this one does not: an entry costs its own names, not the largest entry's.
-static int readNext(historyScan* scan, zq3HistoryData* record)
+static int getNext(historyScan* scan, zq3HistoryData* record)
 {
     SQLUH_ENTRY entry = {};
-    unsigned int flags = 0;
     uint32_t filled = record == scan->lastRecord && scan->filledSlots <= record->maxTablespaces
                           ? scan->filledSlots
                           : record->maxTablespaces;
     entry.data = record;
-    clearRecord(record);
-    int rc = scan->failure;
-    if (rc == 0)
-        rc = scan->rowsLeft == 0 ? static_cast<int>(END_OF_FILE)
-                                 : sqluhReadEntry(scan->snapshot.file, &entry, &scan->workArea,
-                                                  nullptr, nullptr, nullptr, nullptr, &flags);
+    int rc = sqluhGetCommitted(scan->history, scan->nextRow, &entry, false);
+    if (rc < 0)
+        clearRecord(record);
+    else
+        scan->nextRow++;
     uint32_t named = record->numTablespaces < record->maxTablespaces ? record->numTablespaces
                                                                      : record->maxTablespaces;
-    if (rc == 0 || rc == TABLESPACE_LIST_TRUNCATED) {
-        clearSlots(record, named, filled);
-        scan->rowsLeft--;
-    } else {
-        clearRecord(record);
-        clearSlots(record, 0, filled > named ? filled : named);
-        named = 0;
-    }
+    clearSlots(record, named, filled);
     scan->lastRecord = record;
     scan->filledSlots = named;
-    if (rc == END_OF_FILE && scan->rowsLeft == 0)
-        return scanNoMoreEntries;
-    // Entries were counted before: a file that ends earlier ends inside one.
-    if (rc == END_OF_FILE)
-        rc = HISTORY_FILE_DAMAGED;
-    if (rc < 0)
-        scan->failure = rc;
-    return rc;
+    return rc == END_OF_FILE ? static_cast<int>(scanNoMoreEntries) : rc;
 }
 
 ZQ3_EXPORT int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca* ca)
@@ -280,7 +246,7 @@ ZQ3_EXPORT int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca
     historyScan* scan = findScan(request->handle, false);
     if (scan == nullptr)
         return failCall(ca, scanUnknownHandle);
-    return outcome(ca, readNext(scan, request->historyRecord));
+    return outcome(ca, getNext(scan, request->historyRecord));
 }
 
 ZQ3_EXPORT int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca)
@@ -294,7 +260,6 @@ ZQ3_EXPORT int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca
     historyScan* scan = findScan(number, true);
     if (scan == nullptr)
         return failCall(ca, scanUnknownHandle);
-    int rc = sqloclose(scan->snapshot.file);
     freeScan(scan);
-    return outcome(ca, rc);
+    return outcome(ca, 0);
 }

@@ -108,22 +108,6 @@ TEST_F(ScanTest, EntriesAreCountedAndNothingOfOneIsLeftInTheNext)
     EXPECT_EQ(nothing, scan.shown());
 }
 
-// The copy is made in pieces of 256 KB; the numbers of entry 334 stand in two of them.
-TEST_F(ScanTest, LongHistoriesAreCountedAlsoWithoutAFolderForTemporaryFiles)
-{
-    std::string entries;
-    for (int i = 0; i < 340; i++)
-        entries += commandEntry(0, "20250101010000001", {"SIXLET"});
-    store(entries);
-    for (const char* folder : {"/tmp", "/nonexistent"}) {
-        setenv("TMPDIR", folder, 1);
-        Scan scan;
-        EXPECT_EQ(340u, scan.request.numRows);
-        EXPECT_EQ(0, scan.get());
-    }
-    unsetenv("TMPDIR");
-}
-
 TEST_F(ScanTest, ScansRunSideBySideAndKeepTheHistoryTheyOpened)
 {
     store(threeImages);
@@ -212,12 +196,16 @@ TEST_F(ScanTest, DamageFailsTheScanWhereItStands)
     }
 }
 
-TEST_F(ScanTest, AHistoryMadeAnewIsAWarning)
+TEST_F(ScanTest, FilesThatCannotBeUsedAreRefusedAndStay)
 {
     spill(historyPath, "damaged");
-    spill(shadowPath, "damaged");
-    Scan scan;
-    EXPECT_EQ(2160, scan.ca.sqlcode);
-    EXPECT_EQ(0u, scan.request.numRows);
-    EXPECT_EQ(100, scan.get());
+    spill(shadowPath, "damaged, too");
+    zq3HistoryOpenStruct request = {};
+    sqlca ca = {};
+    char alias[] = "sample";
+    request.databaseAlias = alias;
+    EXPECT_EQ(0, zq3HistoryOpenScan(zq3Version, &request, &ca));
+    EXPECT_EQ(-2161, ca.sqlcode);
+    EXPECT_EQ("damaged", slurp(historyPath));
+    EXPECT_EQ("damaged, too", slurp(shadowPath));
 }
