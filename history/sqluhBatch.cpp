@@ -113,6 +113,9 @@ static int commitBatch(SQLUH_HANDLE* handle, const char* operation)
 {
     // B2: the entries before the letter that vouches for them.
     int rc = logged(sqlosync(handle->fileHandle), operation);
+    // Where the lock was taken away others have been here: nothing of this batch may stay.
+    if (rc == 0)
+        rc = logged(sqloNLCKCheckHeld(&handle->namedLock), operation);
     if (rc == 0)
         rc = writeStatus(handle, statusCommitted, operation);
     // B3: the letter before the shadow changes.

@@ -117,7 +117,9 @@ static int lockFileAtPath(SQLUH_HANDLE* handle, const char* operation)
     SQLO_NLCK lock;
     int rc = makeLockKey(handle, &lock);
     while (rc == 0 && (!handle->isLocked || lock.key != handle->namedLock.key)) {
-        rc = sqloNLCKLock(&lock, 0, -1);
+        rc = sqloNLCKCheckDeadlock(&lock);
+        if (rc == 0)
+            rc = sqloNLCKLock(&lock, 0, -1);
         if (rc == 0) {
             releaseLock(handle, operation);
             handle->namedLock = lock;
@@ -125,6 +127,8 @@ static int lockFileAtPath(SQLUH_HANDLE* handle, const char* operation)
             rc = makeLockKey(handle, &lock);
         }
     }
+    if (rc == 0)
+        sqloNLCKKeepFile(&handle->namedLock, handle->historyPath);
     return rc;
 }
 

@@ -12,8 +12,8 @@
 //   a call's code   is what the OS-services call returned (sqo/sqlo.h), unchanged;
 //   transfer code   is that of a failed or short read or write as sqlzGetZRCInfo maps it,
 //                   HISTORY_FILE_DAMAGED where it maps it to 0;
-//   lock code       is sqloNLCKKeyFailure, sqloNLCKKeyConflict, sqloNLCKOwnerDied, or
-//                   sqloSystemError with the errno (sqo/sqlonlck.h).
+//   lock code       is sqloNLCKKeyFailure, sqloNLCKKeyConflict, sqloNLCKOwnerDied,
+//                   sqloNLCKDeadlock, or sqloSystemError with the errno (sqo/sqlonlck.h).
 #pragma once
 
 #include <cstddef>

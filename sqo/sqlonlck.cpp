@@ -10,6 +10,10 @@
 //
 // Only the creator ever holds the lock. Whoever manages to take the semaphore of an existing set
 // has taken it from the dead: it is given back, so that everybody else is told too.
+//
+// Anybody may operate on the semaphore or remove the set. So a holder also keeps the file locked
+// that the key was made from, by a lock that neither a child shares nor another descriptor of the
+// same process ends, and looks at its set before it relies on it.
 
 #include "sqo/sqlonlck.h"
 
@@ -18,7 +22,11 @@
 
 #include <cerrno>
 #include <csignal>
+#include <cstdio>
+#include <cstring>
 #include <ctime>
+#include <fcntl.h>
+#include <pthread.h>
 #include <unistd.h>
 
 #include "sqo/sqlo.h"
@@ -28,7 +36,7 @@
 union semun {
     int val;
     semid_ds* buf;
-    unsigned short* array;
+    seminfo* info;
 };
 
 enum : int { projectIdentifier = 'n' };
@@ -37,7 +45,7 @@ enum : unsigned int {
     readyBit = 0020,      // added once the creator holds the lock
     foreignBit = 0010,    // never part of a named-lock set
 };
-enum : unsigned int { pollMicroseconds = 1000 };
+enum : unsigned int { pollMicroseconds = 1000, pollsUntilTold = 3000 };
 // Far more than a living creator needs for its four system calls.
 static constexpr time_t setupSeconds = 2;
 
@@ -51,6 +59,98 @@ static int systemError(const char* systemCall)
     pdLogSysRC("sqloNLCK", systemCall, failed, code);
     return code;
 }
+
+// --- What this process holds ---------------------------------------------------------------------
+
+struct heldLock {
+    SQLO_NLCK lock;
+    pid_t thread; // that took it; 0: the slot is free
+    int file;     // descriptor that keeps the file locked; -1: none
+};
+
+// A lock that finds no slot is held all the same, only without what the table is for.
+static heldLock heldLocks[256];
+static pthread_mutex_t heldLocksMutex = PTHREAD_MUTEX_INITIALIZER;
+
+static void beforeFork()
+{
+    pthread_mutex_lock(&heldLocksMutex);
+}
+
+static void afterForkInParent()
+{
+    pthread_mutex_unlock(&heldLocksMutex);
+}
+
+// A child holds nothing: the file must not stay locked when the parent dies before it.
+static void afterForkInChild()
+{
+    for (heldLock& held : heldLocks) {
+        if (held.thread != 0 && held.file != -1)
+            close(held.file);
+        held.thread = 0;
+    }
+    pthread_mutex_unlock(&heldLocksMutex);
+}
+
+__attribute__((constructor)) static void watchForks()
+{
+    pthread_atfork(beforeFork, afterForkInParent, afterForkInChild);
+}
+
+// The lock's slot; with a null lock a free one. Null when there is none. The mutex is held.
+static heldLock* findHeld(const SQLO_NLCK* lock)
+{
+    for (heldLock& held : heldLocks)
+        if (lock == nullptr ? held.thread == 0 : held.thread != 0 && held.lock.id == lock->id)
+            return &held;
+    return nullptr;
+}
+
+static void enterHeld(const SQLO_NLCK* lock)
+{
+    pthread_mutex_lock(&heldLocksMutex);
+    heldLock* held = findHeld(nullptr);
+    if (held != nullptr)
+        *held = {*lock, gettid(), -1};
+    pthread_mutex_unlock(&heldLocksMutex);
+}
+
+static void forgetHeld(const SQLO_NLCK* lock)
+{
+    pthread_mutex_lock(&heldLocksMutex);
+    heldLock* held = findHeld(lock);
+    if (held != nullptr && held->file != -1)
+        close(held->file);
+    if (held != nullptr)
+        held->thread = 0;
+    pthread_mutex_unlock(&heldLocksMutex);
+}
+
+void sqloNLCKKeepFile(const SQLO_NLCK* lock, const char* path)
+{
+    pdtEntry();
+
+    struct flock whole = {};
+    whole.l_type = F_RDLCK;
+    int file = open(path, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
+    if (file != -1 && fcntl(file, F_OFD_SETLK, &whole) == -1) {
+        close(file);
+        file = -1;
+    }
+    pthread_mutex_lock(&heldLocksMutex);
+    heldLock* held = findHeld(lock);
+    const int unused = held == nullptr ? file : held->file;
+    if (held != nullptr)
+        held->file = file;
+    pthread_mutex_unlock(&heldLocksMutex);
+    if (unused != -1)
+        close(unused);
+
+    pdtExit(0);
+}
+
+// --- The protocol --------------------------------------------------------------------------------
 
 static int semaphoreStep(int id, short step, short flags)
 {
@@ -139,12 +239,21 @@ static int openSet(SQLO_NLCK* lock)
     return errno == EACCES ? keyConflict() : systemError("semget");
 }
 
+static void tellUnready(int id)
+{
+    const pdItem items[] = {
+        {pdKindText, "Still waiting for a lock that is being set up; its maker may have died.", 0,
+         nullptr, 0},
+        {pdKindNumber, "Semaphore set:", id, nullptr, 0}};
+    pdLog("sqloNLCKLock", pdLevelWarning, items, 2);
+}
+
 static int waitUntilReady(int id)
 {
     semid_ds info = {};
     semun argument;
     argument.buf = &info;
-    for (;;) {
+    for (unsigned int polls = 0;; polls++) {
         if (semctl(id, 0, IPC_STAT, argument) == -1) {
             if (setRemoved())
                 return lockCompete;
@@ -154,6 +263,8 @@ static int waitUntilReady(int id)
             return keyConflict();
         if ((info.sem_perm.mode & readyBit) != 0)
             return lockNext;
+        if (polls == pollsUntilTold)
+            tellUnready(id);
         usleep(pollMicroseconds);
     }
 }
@@ -195,6 +306,8 @@ int sqloNLCKLock(SQLO_NLCK* lock, unsigned int options, int wait)
         if (rc == lockNext)
             rc = waitForHolder(lock->id, options, wait);
     }
+    if (rc == 0)
+        enterHeld(lock);
 
     pdtExit(rc);
     return rc;
@@ -205,6 +318,32 @@ int sqloNLCKUnlock(SQLO_NLCK* lock)
     pdtEntry();
 
     int rc = semctl(lock->id, 0, IPC_RMID, 0) == -1 ? systemError("semctl") : 0;
+    forgetHeld(lock);
+
+    pdtExit(rc);
+    return rc;
+}
+
+// Identifiers are not used again soon, and every operation leaves its process's number.
+int sqloNLCKCheckHeld(const SQLO_NLCK* lock)
+{
+    pdtEntry();
+    int rc = semctl(lock->id, 0, GETPID) == getpid() ? 0 : sqloNLCKLost;
+    pdtExit(rc);
+    return rc;
+}
+
+int sqloNLCKCheckDeadlock(const SQLO_NLCK* lock)
+{
+    pdtEntry();
+
+    int rc = 0;
+    const pid_t me = gettid();
+    pthread_mutex_lock(&heldLocksMutex);
+    for (const heldLock& held : heldLocks)
+        if (held.thread == me && held.lock.key == lock->key && sqloNLCKCheckHeld(&held.lock) == 0)
+            rc = sqloNLCKDeadlock;
+    pthread_mutex_unlock(&heldLocksMutex);
 
     pdtExit(rc);
     return rc;
@@ -217,16 +356,68 @@ int sqloNLCKTerm(SQLO_NLCK*)
     return 0;
 }
 
+// --- Looking at a set ----------------------------------------------------------------------------
+
+// Reads the process's state letter and the time of its start, in seconds of the wall clock.
+static bool readProcess(int pid, char* letter, time_t* started)
+{
+    char text[512] = {};
+    unsigned long long ticks = 0;
+    snprintf(text, sizeof text, "/proc/%d/stat", pid);
+    int file = open(text, O_RDONLY | O_CLOEXEC);
+    ssize_t length = file == -1 ? -1 : read(file, text, sizeof text - 1);
+    if (file != -1)
+        close(file);
+    text[length > 0 ? length : 0] = '\0';
+    // The name, which may hold anything, stands in parentheses; the start is field 22.
+    const char* rest = strrchr(text, ')');
+    if (rest == nullptr || sscanf(rest,
+                                  ") %c %*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %*s "
+                                  "%*s %*s %*s %*s %llu",
+                                  letter, &ticks) != 2)
+        return false;
+    timespec boot;
+    clock_gettime(CLOCK_BOOTTIME, &boot);
+    *started = time(nullptr) - boot.tv_sec +
+               static_cast<time_t>(ticks / static_cast<unsigned long long>(sysconf(_SC_CLK_TCK)));
+    return true;
+}
+
+// Whether the process that operated on a set at the time is no more. All times are whole seconds,
+// hence the two of tolerance.
+static bool isGone(int pid, time_t then)
+{
+    char letter;
+    time_t started;
+    if (!readProcess(pid, &letter, &started))
+        return kill(pid, 0) == -1 && errno == ESRCH;
+    return letter == 'Z' || started > then + 2;
+}
+
 // The creator is known by the pid that SETVAL left on the semaphore; before that only by the set's
 // age.
 static bool creatorGone(int pid, const semid_ds* info)
 {
-    if (pid > 0)
-        return kill(pid, 0) == -1 && errno == ESRCH;
-    return time(nullptr) - info->sem_ctime > setupSeconds;
+    return pid > 0 ? isGone(pid, info->sem_ctime) : time(nullptr) - info->sem_ctime > setupSeconds;
 }
 
-static int lookAtSet(SQLO_NLCKSTATE* state)
+// Whether somebody keeps a file locked from which such a key is made: the key has the low bits of
+// its inode number. A lock on another file with the same bits only makes an administrator wait.
+static bool isFileKept(int32_t key)
+{
+    char line[256];
+    unsigned long inode = 0;
+    bool kept = false;
+    FILE* locks = fopen("/proc/locks", "re");
+    while (locks != nullptr && !kept && fgets(line, sizeof line, locks) != nullptr)
+        kept = sscanf(line, "%*d: OFDLCK %*s READ %*d %*x:%*x:%lu", &inode) == 1 &&
+               (inode & 0xFFFF) == (static_cast<uint32_t>(key) & 0xFFFF);
+    if (locks != nullptr)
+        fclose(locks);
+    return kept;
+}
+
+static int lookAtSet(int32_t key, SQLO_NLCKSTATE* state)
 {
     semid_ds info = {};
     semun argument;
@@ -241,10 +432,12 @@ static int lookAtSet(SQLO_NLCKSTATE* state)
     state->pid = value == -1 ? -1 : semctl(state->id, 0, GETPID);
     if (state->pid == -1)
         return -1;
-    if ((info.sem_perm.mode & readyBit) != 0)
-        state->state = value == 0 ? sqloNLCKHeld : sqloNLCKStale;
-    else
+    if ((info.sem_perm.mode & readyBit) == 0)
         state->state = creatorGone(state->pid, &info) ? sqloNLCKSetupDied : sqloNLCKSettingUp;
+    else if (value == 0 && !(state->pid > 0 && isGone(state->pid, info.sem_otime)))
+        state->state = sqloNLCKHeld;
+    else
+        state->state = isFileKept(key) ? sqloNLCKFaked : sqloNLCKStale;
     return 0;
 }
 
@@ -254,7 +447,7 @@ int sqloNLCKQuery(const SQLO_NLCK* lock, SQLO_NLCKSTATE* state)
 
     int rc = 0;
     *state = {sqloNLCKAbsent, 0, semget(lock->key, 1, 0)};
-    if (state->id == -1 || lookAtSet(state) == -1) {
+    if (state->id == -1 || lookAtSet(lock->key, state) == -1) {
         state->pid = 0;
         if (errno == EACCES || errno == EPERM)
             state->state = sqloNLCKForeign;
@@ -262,6 +455,31 @@ int sqloNLCKQuery(const SQLO_NLCK* lock, SQLO_NLCKSTATE* state)
             *state = {sqloNLCKAbsent, 0, -1};
         else
             rc = systemError(state->id == -1 ? "semget" : "semctl");
+    }
+
+    pdtExit(rc);
+    return rc;
+}
+
+int sqloNLCKNext(int* index, SQLO_NLCK* lock, SQLO_NLCKSTATE* state)
+{
+    pdtEntry();
+
+    struct seminfo table = {};
+    semid_ds info = {};
+    semun argument;
+    argument.info = &table;
+    const int last = semctl(0, 0, SEM_INFO, argument);
+    int rc = last == -1 ? systemError("semctl") : END_OF_FILE;
+    argument.buf = &info;
+    while (rc == END_OF_FILE && *index <= last) {
+        const unsigned int project = static_cast<unsigned int>(sqlz_krcbp->nodeNumber) + 1;
+        lock->id = semctl((*index)++, 0, SEM_STAT, argument);
+        lock->key = info.sem_perm.__key;
+        if (lock->id != -1 && isNamedLock(info.sem_perm.mode) && info.sem_nsems == 1 &&
+            static_cast<uint32_t>(lock->key) >> 24 == (project & 0xFF)) {
+            rc = sqloNLCKQuery(lock, state);
+        }
     }
 
     pdtExit(rc);
