@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstring>
+#include <ctime>
 #include <initializer_list>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -73,15 +74,24 @@ static int checkRights(const historyPlace* place, int rights)
     return 0;
 }
 
+static long long milliseconds(void)
+{
+    timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return now.tv_sec * 1000LL + now.tv_nsec / 1000000;
+}
+
 int awaitLock(const historyPlace* place, int rights)
 {
     SQLO_NLCK lock = {};
     SQLO_NLCKSTATE state = {};
     bool told = false;
+    const long long start = milliseconds();
     if (!hasHistoryFile(place) && !ossPathExists(place->shadowPath))
         return failInPlace(HISTORY_FILE_MISSING, "open the history", place);
-    if (checkRights(place, rights) != 0)
-        return exitFailed;
+    int rc = checkRights(place, rights);
+    if (rc != 0)
+        return rc;
     while (queryLock(place, &lock, &state)) {
         if (state.state == sqloNLCKSetupDied || state.state == sqloNLCKStale)
             return failInPlace(sqloNLCKOwnerDied, "take the lock", place);
@@ -89,6 +99,10 @@ int awaitLock(const historyPlace* place, int rights)
             return failInPlace(sqloNLCKKeyConflict, "take the lock", place);
         if (state.state == sqloNLCKAbsent)
             break;
+        if (place->wait >= 0 && milliseconds() - start >= place->wait * 1000LL) {
+            fail(place->directory, "the lock is held by process %d", state.pid);
+            return exitLocked;
+        }
         if (!told)
             fprintf(stderr, "zq3hist: waiting for the lock, which process %d holds\n", state.pid);
         told = true;
@@ -102,10 +116,11 @@ int failOpening(int code, const char* what, const historyPlace* place)
 {
     if (code != HISTORY_FILE_DAMAGED || repairDueIn(place) == sqluhRepairAnew)
         return failInPlace(code, what, place);
-    return fail(place->directory,
-                "cannot %s: the history needs a repair that failed; the diagnostic log tells why "
-                "(a full disk, for one), and nothing is lost",
-                what);
+    fail(place->directory,
+         "cannot %s: the history needs a repair that failed; the diagnostic log tells why (a full "
+         "disk, for one), and nothing is lost",
+         what);
+    return exitDamaged;
 }
 
 int openHistory(historyPlace* place, unsigned int accessMode, SQLUH_HANDLE** handle)
@@ -149,10 +164,11 @@ int createIfMissing(historyPlace* place)
     // The lock is made from the history file and needs an empty one. It is filled, not replaced, so
     // whoever waits for the lock waits for the right one; and only if nobody else did it meanwhile.
     SQLUH_HANDLE* handle = nullptr;
-    if (hasHistoryFile(place) && awaitLock(place, R_OK | W_OK) != 0)
-        return exitFailed;
+    int rc = hasHistoryFile(place) ? awaitLock(place, R_OK | W_OK) : 0;
+    if (rc != 0)
+        return rc;
     holdSignals();
-    int rc = sqluhHandleAllocAndInit(place->directory, &handle);
+    rc = sqluhHandleAllocAndInit(place->directory, &handle);
     if (rc == 0)
         rc = sqluhLock(handle);
     if (rc == 0 && isEmptyFile(place->historyPath) && !ossPathExists(place->shadowPath))

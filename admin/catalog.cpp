@@ -1,10 +1,12 @@
-// Planning with the planner's own stages, so that its plans and these cannot differ.
+// Reading a history for questions about its images, and planning with the planner's own stages.
 #include "admin/catalog.h"
 
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <unistd.h>
+
+#include "zq3.h"
 
 // --- Reading -------------------------------------------------------------------------------------
 
@@ -41,27 +43,77 @@ static int fetchThroughFolder(const historyPlace* place, historyData* history)
     return rc;
 }
 
-bool isImage(const historyEntry* entry)
+static int orderOfTimestamps(const void* first, const void* second)
 {
-    return entry->operation == 'B';
+    return memcmp(first, second, timestampLength);
 }
 
-int readCatalog(historyPlace* place, imageCatalog* catalog)
+// Takes one line of the list of images on hand: a timestamp, a comment, or nothing.
+static int takeOnHand(imageCatalog* catalog, const char* name, int number, char* line)
+{
+    char* text = line + strspn(line, " \t");
+    text[strcspn(text, "\r\n")] = '\0';
+    for (size_t length = strlen(text); length > 0 && strchr(" \t", text[length - 1]); length--)
+        text[length - 1] = '\0';
+    if (text[0] == '\0' || text[0] == '#')
+        return 0;
+    if ((catalog->numOnHand & (catalog->numOnHand + 1)) == 0) { // one less than a power of two
+        void* grown =
+            reallocarray(catalog->onHand, catalog->numOnHand * 2 + 2, sizeof *catalog->onHand);
+        if (grown == nullptr)
+            return failWithCode(sqloSystemError | ENOMEM, "read the list of images", name);
+        catalog->onHand = static_cast<char(*)[timestampLength + 1]>(grown);
+    }
+    if (!parseTimestamp(text, catalog->onHand[catalog->numOnHand]))
+        return fail(name, "found \"%.40s\" in line %d but expected a timestamp", text, number);
+    catalog->numOnHand++;
+    return 0;
+}
+
+static int readOnHand(imageCatalog* catalog, const char* name)
+{
+    bool isInput = strcmp(name, "-") == 0;
+    const char* title = isInput ? "standard input" : name;
+    FILE* in = isInput ? stdin : fopen(name, "re");
+    if (in == nullptr)
+        return failWithCode(sqloSystemError | errno, "read the list of images", title);
+    // An empty list is one, too.
+    catalog->onHand = static_cast<char(*)[timestampLength + 1]>(malloc(sizeof *catalog->onHand));
+    char* line = nullptr;
+    size_t capacity = 0;
+    int rc = catalog->onHand != nullptr
+                 ? 0
+                 : failWithCode(sqloSystemError | ENOMEM, "read the list of images", title);
+    for (int number = 1; rc == 0 && getline(&line, &capacity, in) >= 0; number++)
+        rc = takeOnHand(catalog, title, number, line);
+    if (rc == 0 && ferror(in))
+        rc = failWithCode(sqloSystemError | errno, "read the list of images", title);
+    if (rc == 0)
+        qsort(catalog->onHand, catalog->numOnHand, sizeof *catalog->onHand, orderOfTimestamps);
+    free(line);
+    if (!isInput)
+        fclose(in);
+    return rc;
+}
+
+int readCatalog(historyPlace* place, const char* have, imageCatalog* catalog)
 {
     *catalog = {};
-    catalog->oldestImage = catalog->firstRename = -1;
     catalog->history.backupIndex = catalog->history.renameIndex = -1;
-    int rc = awaitLock(place, R_OK);
+    int rc = have != nullptr ? readOnHand(catalog, have) : 0;
+    if (rc == 0)
+        rc = awaitLock(place, R_OK);
     if (rc == 0)
         rc = fetchThroughFolder(place, &catalog->history);
     releaseSignals();
+    const historyEntry *image = nullptr, *rename = nullptr;
     for (int i = catalog->history.numEntries - 1; i >= 0; i--) {
-        if (isImage(&catalog->history.entries[i]))
-            catalog->oldestImage = i;
-        if (catalog->history.entries[i].operation == 'N')
-            catalog->firstRename = i;
+        const historyEntry* entry = &catalog->history.entries[i];
+        image = isImage(entry) ? entry : image;
+        rename = entry->operation == zq3OperationRename ? entry : rename;
     }
-    catalog->renamedUpTo = catalog->firstRename;
+    catalog->renamesCount = image != nullptr && rename != nullptr &&
+                            orderOfTimestamps(rename->timestamp, image->timestamp) >= 0;
     return rc;
 }
 
@@ -70,7 +122,25 @@ void freeCatalog(imageCatalog* catalog)
     restorePlan all = {};
     all.histData = catalog->history;
     freePlan(&all);
+    free(catalog->facts);
+    free(catalog->gaps);
+    free(catalog->unused);
+    free(catalog->onHand);
     *catalog = {};
+}
+
+// --- Images --------------------------------------------------------------------------------------
+
+bool isImage(const historyEntry* entry)
+{
+    return entry->operation == zq3OperationBackup;
+}
+
+bool isOnHand(const imageCatalog* catalog, const historyEntry* image)
+{
+    return catalog->onHand == nullptr ||
+           bsearch(image->timestamp, catalog->onHand, catalog->numOnHand, sizeof *catalog->onHand,
+                   orderOfTimestamps) != nullptr;
 }
 
 const char* kindOfImage(const historyEntry* image)
@@ -82,128 +152,84 @@ const char* kindOfImage(const historyEntry* image)
 
 const char* scopeOfImage(const historyEntry* image)
 {
-    return image->object == 'P' ? "tablespace" : "database";
+    return image->object == zq3ObjectTablespace ? "tablespace" : "database";
+}
+
+int findImage(const imageCatalog* catalog, const char* timestamp)
+{
+    for (int i = 0; i < catalog->history.numEntries; i++)
+        if (isImage(&catalog->history.entries[i]) &&
+            orderOfTimestamps(catalog->history.entries[i].timestamp, timestamp) == 0)
+            return i;
+    return -1;
+}
+
+int failNoImage(const historyPlace* place, const char* timestamp)
+{
+    fail(place->directory, "no image has the timestamp %s", timestamp);
+    hint(place, "zq3hist images DIR lists all");
+    return exitNoImage;
+}
+
+const numberGap* gapBetween(const imageCatalog* catalog, int oldest, int newest)
+{
+    if (catalog->facts == nullptr)
+        return nullptr;
+    int before = catalog->facts[catalog->history.entries[oldest].index].numGaps;
+    int after = catalog->facts[catalog->history.entries[newest].index].numGaps;
+    return after > before ? &catalog->gaps[before] : nullptr;
 }
 
 // --- Planning ------------------------------------------------------------------------------------
 
-// Applies the renames that lie before the target and were not applied for an earlier one. They act
-// from the oldest to the newest, so that they can be applied in several goes.
-static int applyRenames(imageCatalog* catalog, int target)
-{
-    int rc = 0;
-    restorePlan due = {};
-    backupImage oldest = {};
-    if (catalog->firstRename < 0 || catalog->renamedUpTo >= target)
-        return 0;
-    memcpy(oldest.timestamp, catalog->history.entries[catalog->oldestImage].timestamp,
-           timestampLength);
-    due.images = &oldest;
-    due.histData = catalog->history;
-    due.histData.renameIndex = catalog->firstRename;
-    if (isRenamePassDue(&due)) {
-        due.histData.renameIndex = catalog->renamedUpTo;
-        due.histData.backupIndex = target;
-        rc = updateHistoryEntriesforRename(&due.histData);
-    }
-    if (rc == 0)
-        catalog->renamedUpTo = target;
-    return rc;
-}
-
-// Sets the plan on the entries from first to the target.
-static void viewEntries(const imageCatalog* catalog, int target, int first, imagePlan* plan)
-{
-    plan->firstEntry = first;
-    plan->stages.histData.entries = catalog->history.entries + first;
-    plan->stages.histData.numEntries = target - first + 1;
-    plan->stages.histData.backupIndex = target - first;
-    plan->stages.histData.renameIndex = -1;
-    plan->stages.numBackups = 0;
-    for (int i = first; i <= target; i++)
-        plan->stages.numBackups += isImage(&catalog->history.entries[i]);
-}
-
-static bool allComplete(const restorePlan* stages)
-{
-    for (int i = 0; i < stages->numTablespaces; i++)
-        if (stages->list[i].lastImageType != chainComplete)
-            return false;
-    return true;
-}
-
-// Fills and prunes the matrix. Most chains are short, so the plan begins with the entries just
-// before the target and takes older ones only while a chain is open: what an image costs does not
-// grow with the history.
-static int fillPlan(const imageCatalog* catalog, int target, bool allRows, imagePlan* plan)
-{
-    restorePlan* stages = &plan->stages;
-    int first = target;
-    int rc = 0;
-    for (int reach = allRows ? target : 32;
-         rc == 0 && (stages->matrix == nullptr || !allComplete(stages)); reach *= 2) {
-        if (stages->matrix != nullptr && first == 0)
-            break;
-        free(stages->matrix);
-        stages->matrix = nullptr;
-        first = reach > 0 && reach < target ? target - reach : 0;
-        viewEntries(catalog, target, first, plan);
-        rc = allocateTimelineMatrix(stages);
-        if (rc == 0 && stages->numTablespaces == 0)
-            break;
-        if (rc == 0)
-            fillColumns(stages->matrix, &stages->histData, stages->list, stages->numTablespaces,
-                        stages->numBackups);
-    }
-    if (rc == 0)
-        scanColumns(stages->matrix, stages->numTablespaces, stages->numBackups);
-    return rc;
-}
-
-// Counts the images without tablespaces up to the target: the planner puts them into every plan.
-static int countEmptyImages(imageCatalog* catalog, int target)
-{
-    for (; catalog->countedUpTo <= target; catalog->countedUpTo++) {
-        const historyEntry* entry = &catalog->history.entries[catalog->countedUpTo];
-        catalog->numEmptyImages += isImage(entry) && entry->numTablespaces == 0;
-    }
-    return catalog->numEmptyImages;
-}
-
 static int listRows(imagePlan* plan)
 {
+    restorePlan* stages = &plan->stages;
     plan->rows = static_cast<const historyEntry**>(
-        reallocarray(nullptr, static_cast<size_t>(plan->stages.numBackups), sizeof *plan->rows));
+        reallocarray(nullptr, static_cast<size_t>(stages->numBackups), sizeof *plan->rows));
     if (plan->rows == nullptr)
         return reportError(msgNoMemoryImages);
-    const historyEntry* entry = plan->stages.histData.entries;
-    for (int row = 0; row < plan->stages.numBackups; entry++)
+    const historyEntry* entry = stages->histData.entries;
+    for (int row = 0; row < stages->numBackups; entry++)
         if (isImage(entry))
             plan->rows[row++] = entry;
     return 0;
 }
 
-int planImage(imageCatalog* catalog, int target, const planScope* scope, imagePlan* plan)
+static void countPlan(const imageCatalog* catalog, imagePlan* plan)
+{
+    const char* image;
+    for (int row = 0; row < plan->stages.numBackups; row++)
+        plan->numImages += isNeeded(plan, row);
+    for (int column = 0; column < plan->stages.numTablespaces; column++)
+        plan->numIncomplete += lackOfColumn(catalog, plan, column, &image) != planLacksNothing;
+}
+
+int planImage(imageCatalog* catalog, int target, char** names, int numNames, imagePlan* plan)
 {
     *plan = {};
-    int rc = applyRenames(catalog, target);
-    viewEntries(catalog, target, target, plan);
+    restorePlan* stages = &plan->stages;
+    historyData* history = &stages->histData;
+    *history = catalog->history;
+    history->backupIndex = target;
+    for (int i = 0; i <= target; i++) {
+        stages->numBackups += isImage(&history->entries[i]);
+        if (history->renameIndex < 0 && history->entries[i].operation == zq3OperationRename)
+            history->renameIndex = i;
+    }
+    int rc = catalog->renamesCount ? updateHistoryEntriesforRename(history) : 0;
     if (rc == 0)
-        rc = scope->numNames == 0
-                 ? listTargetTablespaces(&plan->stages)
-                 : listNamedTablespaces(&plan->stages, scope->names, scope->numNames);
-    if (rc == 0)
-        rc = fillPlan(catalog, target, scope->allRows, plan);
+        rc = numNames == 0 ? listTargetTablespaces(stages)
+                           : listNamedTablespaces(stages, names, numNames);
     if (rc == 0)
         rc = listRows(plan);
+    if (rc == 0)
+        rc = allocateTimelineMatrix(stages);
     if (rc != 0)
         return exitFailed; // the stage has told
-    const char* image;
-    plan->numImages = countEmptyImages(catalog, target);
-    for (int row = 0; row < plan->stages.numBackups; row++)
-        plan->numImages += countNeeded(plan, row) != 0;
-    for (int column = 0; column < plan->stages.numTablespaces; column++)
-        plan->numIncomplete += !isChainComplete(plan, column, &image);
+    fillColumns(stages->matrix, history, stages->list, stages->numTablespaces, stages->numBackups);
+    scanColumns(stages->matrix, stages->numTablespaces, stages->numBackups);
+    countPlan(catalog, plan);
     return 0;
 }
 
@@ -217,11 +243,6 @@ void freeImagePlan(imagePlan* plan)
 
 // --- Cells ---------------------------------------------------------------------------------------
 
-const historyEntry* imageOfRow(const imagePlan* plan, int row)
-{
-    return plan->rows[row];
-}
-
 char cellAt(const imagePlan* plan, int row, int column)
 {
     size_t columns = static_cast<size_t>(plan->stages.numTablespaces);
@@ -230,7 +251,7 @@ char cellAt(const imagePlan* plan, int row, int column)
 
 bool isNeeded(const imagePlan* plan, int row)
 {
-    return countNeeded(plan, row) != 0 || imageOfRow(plan, row)->numTablespaces == 0;
+    return countNeeded(plan, row) != 0 || plan->rows[row]->numTablespaces == 0;
 }
 
 int countNeeded(const imagePlan* plan, int row)
@@ -241,14 +262,24 @@ int countNeeded(const imagePlan* plan, int row)
     return count;
 }
 
-bool isChainComplete(const imagePlan* plan, int column, const char** image)
+planLack lackOfColumn(const imageCatalog* catalog, const imagePlan* plan, int column,
+                      const char** image)
 {
     const tablespaceInfo* tablespace = &plan->stages.list[column];
+    bool hasFull = false;
     *image = nullptr;
-    for (int row = 0; row < plan->stages.numBackups; row++)
-        if (cellAt(plan, row, column) == cellFull)
-            return true;
-    if (!tablespace->tracking && tablespace->lastImageType != chainComplete)
-        *image = tablespace->restoredImage;
-    return false;
+    for (int row = plan->stages.numBackups - 1; row >= 0; row--) {
+        char cell = cellAt(plan, row, column);
+        hasFull = hasFull || cell == cellFull;
+        if (cell != cellUnused && !isOnHand(catalog, plan->rows[row])) {
+            *image = plan->rows[row]->timestamp;
+            return planLacksOnHand;
+        }
+    }
+    if (hasFull)
+        return planLacksNothing;
+    if (tablespace->tracking || tablespace->lastImageType == chainComplete)
+        return planLacksFullImage;
+    *image = tablespace->restoredImage;
+    return planLacksRestored;
 }

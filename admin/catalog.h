@@ -1,56 +1,90 @@
-// The backup images of a history and what a restore to each needs, found with the planner's stages.
+// The entries of a history that matter for restores, and what a restore to one image needs.
 #pragma once
 
+#include "admin/json.h"
 #include "admin/zq3hist.h"
 #include "tool/zq3ckrst.h"
 
-struct imageCatalog {
-    historyData history; // every entry that matters, by time
-    int oldestImage;     // positions in it; -1: none
-    int firstRename;
-    int renamedUpTo;    // renames before this position have been applied to what is older
-    int countedUpTo;    // images without tablespaces before this position have been counted
-    int numEmptyImages; // their number
+// What the history holds of a kept entry beside what the planner keeps of it.
+struct entryFacts {
+    int numGaps; // in the entry numbers before it
 };
 
-// Reads the history. Complains on failure and returns exitFailed, else 0.
-int readCatalog(historyPlace* place, imageCatalog* catalog);
+// Entry numbers that no entry has, between those of two that follow each other.
+struct numberGap {
+    uint32_t first, last;
+};
+
+// An image that no plan uses.
+struct unusedImage {
+    historyEntry image;
+    int32_t sqlcode;
+    char status;
+};
+
+struct imageCatalog {
+    historyData history; // every entry that matters, by time
+    entryFacts* facts;   // by their index
+    numberGap* gaps;     // oldest first
+    int numGaps;
+    unusedImage* unused; // by time
+    int numUnused;
+    uint32_t numEntries;                 // of the history, those that do not matter included
+    bool renamesCount;                   // the planner looks at renames
+    char (*onHand)[timestampLength + 1]; // the images that are there, sorted; null: all are
+    size_t numOnHand;
+};
+
+// Reads the history and, unless have is null, the list of the images on hand ("-": from standard
+// input). Complains on failure and returns an exit status, else 0. freeCatalog accepts what a
+// failed call left.
+int readCatalog(historyPlace* place, const char* have, imageCatalog* catalog);
 void freeCatalog(imageCatalog* catalog);
 
 bool isImage(const historyEntry* entry);
+bool isOnHand(const imageCatalog* catalog, const historyEntry* image);
 const char* kindOfImage(const historyEntry* image);  // full, incremental, delta
 const char* scopeOfImage(const historyEntry* image); // database, tablespace
 
-// What a restore to one image needs.
+// The position of the newest image with that timestamp; -1: none.
+int findImage(const imageCatalog* catalog, const char* timestamp);
+
+// Complains that there is none and returns exitNoImage.
+int failNoImage(const historyPlace* place, const char* timestamp);
+
+// The first gap in the entry numbers after the oldest and before the newest position; null: none.
+const numberGap* gapBetween(const imageCatalog* catalog, int oldest, int newest);
+
+// Put the members of an image's object, one of a list of what tablespaces lack, and the gap
+// (images.cpp).
+void putJsonImage(jsonWriter* json, const historyEntry* image);
+void putJsonLack(jsonWriter* json, const char* tablespace, const char* image);
+void putJsonGap(jsonWriter* json, const numberGap* gap);
+
+// What a restore to one image needs, found with the planner's stages, so that its plans and this
+// cannot differ. A row is an image up to the target, a column a tablespace.
 struct imagePlan {
-    int firstEntry;            // the plan's entries are the catalog's from here to the target
-    restorePlan stages;        // its list is the plan's columns, its matrix is pruned
+    restorePlan stages;        // its entries are the catalog's; its matrix is pruned
     const historyEntry** rows; // the images of the matrix's rows
     int numImages;             // that are needed, the target included
     int numIncomplete;         // tablespaces that lack an image
 };
 
-// What is to be planned.
-struct planScope {
-    char** names; // the tablespaces, upper-cased in place; none: all of the target
-    int numNames;
-    bool allRows; // rows for all images up to the target, not only as far back as chains reach
-};
-
-// Plans a restore to the image at a position of the catalog. Targets are planned in ascending
-// order. Returns 0, or exitFailed after a complaint. freeImagePlan accepts a zero-filled record.
-int planImage(imageCatalog* catalog, int target, const planScope* scope, imagePlan* plan);
+// Plans a restore to the image at a position of the catalog, whose older entries get the names of
+// that time. names: the tablespaces, upper-cased, which the image holds; none: all of it. Returns
+// 0, or exitFailed after a complaint. freeImagePlan accepts a zero-filled record.
+int planImage(imageCatalog* catalog, int target, char** names, int numNames, imagePlan* plan);
 void freeImagePlan(imagePlan* plan);
 
-// Calls about a plan's cells; rows count from the plan's first image.
-const historyEntry* imageOfRow(const imagePlan* plan, int row);
+// Calls about a plan's cells.
 char cellAt(const imagePlan* plan, int row, int column);
 int countNeeded(const imagePlan* plan, int row); // tablespaces needed from the image
 bool isNeeded(const imagePlan* plan, int row);   // whether the plan holds the image
 
-// Whether nothing is missing for the tablespace; if something is, *image receives the timestamp of
-// the image that is, or null where that is any full image.
-bool isChainComplete(const imagePlan* plan, int column, const char** image);
+// What a column lacks.
+enum planLack { planLacksNothing, planLacksFullImage, planLacksRestored, planLacksOnHand };
 
-// Prints the "missing" member of a plan's JSON object (images.cpp).
-void putJsonMissing(const imagePlan* plan);
+// What is missing for a tablespace; *image receives the timestamp of the image, or null where that
+// is any full image.
+planLack lackOfColumn(const imageCatalog* catalog, const imagePlan* plan, int column,
+                      const char** image);

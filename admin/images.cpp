@@ -1,91 +1,262 @@
 // zq3hist images: every backup image, and whether a restore to it is possible.
-#include "admin/catalog.h"
-
 #include <cstring>
 
+#include "admin/chains.h"
 #include "admin/json.h"
 
-static void showMissing(const imagePlan* plan)
+// --- What is missing -----------------------------------------------------------------------------
+
+// The names are those of the image's own time.
+static const char* nameOfLink(const chainWalk* walk, const chainLink* link)
 {
-    const char* separator = "incomplete: ";
-    for (int column = 0; column < plan->stages.numTablespaces; column++) {
-        const char* image;
-        if (isChainComplete(plan, column, &image))
+    return walk->history->entries[link->image].tablespaceNames[link->slot];
+}
+
+static void putLack(const chainWalk* walk, const chainLink* link, bool plural)
+{
+    const char* image = lackingImage(walk, link);
+    const char* verb = plural ? " lack" : " lacks";
+    printf(image == nullptr ? "%s a full image" : "%s the image ", verb);
+    if (image != nullptr)
+        putEscaped(stdout, image, strlen(image));
+}
+
+static void putMissing(const chainWalk* walk, const imageChains* chains)
+{
+    const chainLink* links = &walk->links[chains->firstLink];
+    int numAlike = 0;
+    while (numAlike < chains->numLinks && links[numAlike].lack == links->lack)
+        numAlike++;
+    fputs("incomplete: ", stdout);
+    if (numAlike == chains->numLinks && numAlike > 1) {
+        printf("all %d", numAlike);
+        putLack(walk, links, true);
+        return;
+    }
+    const char* separator = "";
+    for (int i = 0; i < chains->numLinks; i++) {
+        if (links[i].lack == lacksNothing)
             continue;
-        const char* name = plan->stages.list[column].name;
+        const char* name = nameOfLink(walk, &links[i]);
         fputs(separator, stdout);
         putEscaped(stdout, name, strlen(name));
-        fputs(image == nullptr ? " lacks a full image" : " lacks the image ", stdout);
-        if (image != nullptr)
-            putEscaped(stdout, image, strlen(image));
+        putLack(walk, &links[i], false);
         separator = ", ";
+    }
+}
+
+void putJsonLack(jsonWriter* json, const char* tablespace, const char* image)
+{
+    beginJson(json, nullptr, '{');
+    putJsonText(json, "tablespace", tablespace);
+    putJsonText(json, "image", image);
+    endJson(json, '}');
+}
+
+void putJsonGap(jsonWriter* json, const numberGap* gap)
+{
+    if (gap == nullptr) {
+        putJsonText(json, "gap", nullptr);
+        return;
+    }
+    beginJson(json, "gap", '{');
+    putJsonNumber(json, "first", gap->first);
+    putJsonNumber(json, "last", gap->last);
+    endJson(json, '}');
+}
+
+void putJsonImage(jsonWriter* json, const historyEntry* image)
+{
+    putJsonText(json, "timestamp", image->timestamp);
+    putJsonText(json, "kind", kindOfImage(image));
+    putJsonText(json, "scope", scopeOfImage(image));
+    putJsonNumber(json, "tablespaceCount", image->numTablespaces);
+}
+
+// --- The list ------------------------------------------------------------------------------------
+
+// A row of the list: an image that plans use, or one that none does.
+struct imageRow {
+    const historyEntry* image;
+    const imageChains* chains; // null: none uses it
+    const numberGap* gap;
+    const unusedImage* unused;
+};
+
+struct imageList {
+    imageCatalog catalog;
+    chainWalk walk;
+    const commandLine* line;
+    jsonWriter json;
+    long skipped, shown;
+};
+
+static void putHead(void)
+{
+    puts("TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE");
+}
+
+// Why no plan uses an image.
+static void putUnused(const unusedImage* unused)
+{
+    if (unused->sqlcode < 0)
+        printf("failed: SQLCODE %d", unused->sqlcode);
+    else
+        fputs("not active", stdout);
+}
+
+static void showRow(const imageList* list, const imageRow* row)
+{
+    const historyEntry* image = row->image;
+    putEscaped(stdout, image->timestamp, strlen(image->timestamp));
+    printf("%*s%-11s  %-10s  %11u  ",
+           static_cast<int>(timestampLength - strlen(image->timestamp)) + 2, "", kindOfImage(image),
+           scopeOfImage(image), image->numTablespaces);
+    if (row->chains == nullptr) {
+        printf("%6s  ", "-");
+        putUnused(row->unused);
+    } else {
+        printf("%6d  ", row->chains->numImages);
+        if (row->chains->numIncomplete != 0)
+            putMissing(&list->walk, row->chains);
+        else if (row->gap != nullptr)
+            printf("chain found; the history lacks entries %u to %u", row->gap->first,
+                   row->gap->last);
+        else
+            fputs("complete", stdout);
     }
     putchar('\n');
 }
 
-void putJsonMissing(const imagePlan* plan)
+static void showJsonRow(imageList* list, const imageRow* row)
 {
-    bool first = true;
-    fputs("\"missing\":[", stdout);
-    for (int column = 0; column < plan->stages.numTablespaces; column++) {
-        const char* image;
-        if (isChainComplete(plan, column, &image))
-            continue;
-        const char* name = plan->stages.list[column].name;
-        fputs(first ? "{\"tablespace\":" : ",{\"tablespace\":", stdout);
-        putJsonText(stdout, name, strlen(name));
-        fputs(",\"image\":", stdout);
-        if (image != nullptr)
-            putJsonText(stdout, image, strlen(image));
-        else
-            fputs("null", stdout);
-        putchar('}');
-        first = false;
+    jsonWriter* json = &list->json;
+    const chainWalk* walk = &list->walk;
+    beginJson(json, nullptr, '{');
+    putJsonImage(json, row->image);
+    putJsonBool(json, "used", row->chains != nullptr);
+    if (row->chains == nullptr) {
+        putJsonNumber(json, "sqlcode", row->unused->sqlcode);
+        putJsonBytes(json, "status", &row->unused->status, 1);
+    } else {
+        putJsonNumber(json, "imageCount", row->chains->numImages);
+        putJsonBool(json, "complete", row->chains->numIncomplete == 0);
+        beginJson(json, "missing", '[');
+        for (int i = 0; i < row->chains->numLinks; i++) {
+            const chainLink* link = &walk->links[row->chains->firstLink + i];
+            if (link->lack != lacksNothing)
+                putJsonLack(json, nameOfLink(walk, link), lackingImage(walk, link));
+        }
+        endJson(json, ']');
+        putJsonGap(json, row->gap);
     }
-    putchar(']');
+    endJson(json, '}');
 }
 
-static void showImage(const historyEntry* image, const imagePlan* plan)
+static bool isWanted(const imageList* list, const imageRow* row)
 {
-    putEscaped(stdout, image->timestamp, strlen(image->timestamp));
-    printf("%*s%-11s  %-10s  %4u tablespace%s  %4d image%s  ",
-           static_cast<int>(timestampLength - strlen(image->timestamp)) + 2, "", kindOfImage(image),
-           scopeOfImage(image), image->numTablespaces, image->numTablespaces == 1 ? " " : "s",
-           plan->numImages, plan->numImages == 1 ? " " : "s");
-    if (plan->numIncomplete == 0)
-        puts("complete");
+    return strcmp(row->image->timestamp, list->line->since) >= 0 &&
+           (!list->line->incomplete || row->chains == nullptr || row->chains->numIncomplete != 0);
+}
+
+// Calls visit for each row that is wanted, oldest first.
+static void visitRows(imageList* list, void (*visit)(imageList*, const imageRow*))
+{
+    const imageCatalog* catalog = &list->catalog;
+    int numUnused = list->line->all ? catalog->numUnused : 0;
+    int unused = 0;
+    for (int i = 0; i <= catalog->history.numEntries; i++) {
+        const historyEntry* entry =
+            i < catalog->history.numEntries ? &catalog->history.entries[i] : nullptr;
+        if (entry != nullptr && !isImage(entry))
+            continue;
+        for (; unused < numUnused &&
+               (entry == nullptr || sortHistoryEntries(&catalog->unused[unused].image, entry) < 0);
+             unused++) {
+            imageRow row = {&catalog->unused[unused].image, nullptr, nullptr,
+                            &catalog->unused[unused]};
+            if (isWanted(list, &row))
+                visit(list, &row);
+        }
+        if (entry == nullptr)
+            break;
+        const imageChains* chains = &list->walk.images[i];
+        imageRow row = {entry, chains, gapBetween(catalog, chains->oldest, i), nullptr};
+        if (isWanted(list, &row))
+            visit(list, &row);
+    }
+}
+
+static void countRow(imageList* list, const imageRow*)
+{
+    list->skipped++;
+}
+
+static void visitRow(imageList* list, const imageRow* row)
+{
+    if (list->skipped > 0) {
+        list->skipped--;
+        return;
+    }
+    list->shown++;
+    if (list->line->json)
+        showJsonRow(list, row);
     else
-        showMissing(plan);
+        showRow(list, row);
 }
 
-static void showJsonImage(const historyEntry* image, const imagePlan* plan)
+static void putSummary(const imageList* list)
 {
-    fputs("{\"timestamp\":", stdout);
-    putJsonText(stdout, image->timestamp, strlen(image->timestamp));
-    printf(",\"kind\":\"%s\",\"scope\":\"%s\",\"tablespaces\":%u,\"images\":%d,\"complete\":%s,",
-           kindOfImage(image), scopeOfImage(image), image->numTablespaces, plan->numImages,
-           plan->numIncomplete == 0 ? "true" : "false");
-    putJsonMissing(plan);
-    puts("}");
+    const chainWalk* walk = &list->walk;
+    printf("%d image%s", walk->numImages, walk->numImages == 1 ? "" : "s");
+    if (list->shown != walk->numImages)
+        printf(", %ld shown", list->shown);
+    printf(", %d incomplete", walk->numIncomplete);
+    if (walk->newestComplete >= 0) {
+        fputs("; newest that can be restored: ", stdout);
+        const char* newest = walk->history->entries[walk->newestComplete].timestamp;
+        putEscaped(stdout, newest, strlen(newest));
+    }
+    putchar('\n');
+}
+
+static void putJsonSummary(imageList* list)
+{
+    const chainWalk* walk = &list->walk;
+    endJson(&list->json, ']');
+    putJsonNumber(&list->json, "imageCount", walk->numImages);
+    putJsonNumber(&list->json, "incompleteCount", walk->numIncomplete);
+    putJsonText(&list->json, "newestRestorable",
+                walk->newestComplete < 0 ? nullptr
+                                         : walk->history->entries[walk->newestComplete].timestamp);
+    endJsonLine(&list->json);
 }
 
 int imagesMain(commandLine* line)
 {
-    imageCatalog catalog = {};
-    const planScope scope = {nullptr, 0, false};
-    int rc = readCatalog(&line->place, &catalog);
-    for (int i = 0; rc == 0 && i < catalog.history.numEntries; i++) {
-        const historyEntry* image = &catalog.history.entries[i];
-        imagePlan plan = {};
-        if (!isImage(image))
-            continue;
-        rc = planImage(&catalog, i, &scope, &plan);
-        if (rc == 0 && line->json)
-            showJsonImage(image, &plan);
-        else if (rc == 0)
-            showImage(image, &plan);
-        freeImagePlan(&plan);
+    imageList list = {};
+    list.line = line;
+    int rc = readCatalog(&line->place, line->have, &list.catalog);
+    if (rc == 0)
+        rc = walkChains(&list.catalog, list.catalog.history.numEntries - 1, &list.walk);
+    if (rc == 0) {
+        if (line->last >= 0) {
+            visitRows(&list, countRow);
+            list.skipped -= line->last;
+        }
+        if (line->json)
+            beginAnswer(&list.json);
+        if (line->json)
+            beginJson(&list.json, "images", '[');
+        else
+            putHead();
+        visitRows(&list, visitRow);
+        if (line->json)
+            putJsonSummary(&list);
+        else
+            putSummary(&list);
     }
-    freeCatalog(&catalog);
+    freeChains(&list.walk);
+    freeCatalog(&list.catalog);
     return rc;
 }

@@ -44,6 +44,13 @@ void endJson(jsonWriter* json, char bracket)
     json->comma = true;
 }
 
+void beginAnswer(jsonWriter* json)
+{
+    *json = {stdout, false};
+    beginJson(json, nullptr, '{');
+    putJsonNumber(json, "format", 1);
+}
+
 void endJsonLine(jsonWriter* json)
 {
     fputs("}\n", json->out);

@@ -17,6 +17,9 @@ struct jsonWriter {
 void beginJson(jsonWriter* json, const char* key, char bracket);
 void endJson(jsonWriter* json, char bracket);
 
+// Begins the object that answers a question, on standard output, with the version of its form.
+void beginAnswer(jsonWriter* json);
+
 // Ends the outermost object and its line; the next one stands for itself.
 void endJsonLine(jsonWriter* json);
 

@@ -5,6 +5,7 @@
 #include <csignal>
 #include <cstring>
 #include <fcntl.h>
+#include <poll.h>
 #include <unistd.h>
 
 // A standard stream that the program was started without must not become a file that it opens:
@@ -16,6 +17,13 @@ static void fillStandardStreams(void)
             open("/dev/null", stream == STDIN_FILENO ? O_WRONLY : O_RDONLY);
 }
 
+// Whoever reads only the beginning of a list does so on purpose.
+static bool isReaderGone(void)
+{
+    pollfd out = {STDOUT_FILENO, POLLOUT, 0};
+    return errno == EPIPE || (poll(&out, 1, 0) > 0 && (out.revents & POLLERR) != 0);
+}
+
 int main(int argc, char** argv)
 {
     fillStandardStreams();
@@ -25,7 +33,8 @@ int main(int argc, char** argv)
     // A report that did not reach its reader must not end like one that did.
     bool written = ferror(stdout) == 0 && fflush(stdout) == 0;
     if (!written || (close(STDOUT_FILENO) != 0 && errno != EBADF)) {
-        fail("standard output", "cannot write: %s", strerror(errno));
+        if (!isReaderGone())
+            fail("standard output", "cannot write: %s", strerror(errno));
         rc = rc != exitDone ? rc : exitFailed;
     }
     return rc;

@@ -110,29 +110,30 @@ void hint(const historyPlace* place, const char* advice)
 // What a code means, and what an administrator does about it.
 struct explanation {
     int code;
+    int status;
     const char* words;
     const char* advice;
 };
 static constexpr explanation explanations[] = {
-    {HISTORY_FILE_DAMAGED, "the history is damaged",
+    {HISTORY_FILE_DAMAGED, exitDamaged, "the history is damaged",
      "zq3hist verify DIR names the damage; zq3hist repair DIR and zq3hist restore DIR FILE mend "
      "it"},
-    {HISTORY_FILE_MISSING, "the directory holds no history file",
+    {HISTORY_FILE_MISSING, exitDamaged, "the directory holds no history file",
      "zq3hist load DIR FILE makes one"},
-    {HISTORY_FILE_RECREATED,
+    {HISTORY_FILE_RECREATED, exitDamaged,
      "neither file could be used; both were moved aside and an empty history was made",
      "zq3hist restore DIR FILE puts a backup in its place; the old files "
      "are " SQLUH_SAVED_HISTORY_NAME " and " SQLUH_SAVED_SHADOW_NAME},
-    {sqloNLCKKeyFailure, "no lock key can be made of the history file",
+    {sqloNLCKKeyFailure, exitFailed, "no lock key can be made of the history file",
      "it may be missing, or in a directory that may not be searched"},
-    {sqloNLCKKeyConflict, "another program's semaphore set has the lock's key",
+    {sqloNLCKKeyConflict, exitLocked, "another program's semaphore set has the lock's key",
      "zq3hist status DIR shows the key, ipcs -s the set's owner; a copy of the directory has "
      "another key"},
-    {sqloNLCKOwnerDied, "a process died while it held the lock",
+    {sqloNLCKOwnerDied, exitLocked, "a process died while it held the lock",
      "zq3hist unlock DIR removes the lock; the next open settles what the process left unfinished"},
-    {sqloNLCKBusy, "the lock is held by another process", nullptr},
-    {END_OF_FILE, "the file is empty", nullptr},
-    {DISK_FULL, "no space is left on the device", nullptr},
+    {sqloNLCKBusy, exitLocked, "the lock is held by another process", nullptr},
+    {END_OF_FILE, exitDamaged, "the file is empty", nullptr},
+    {DISK_FULL, exitFailed, "no space is left on the device", nullptr},
 };
 
 static const explanation* explanationOf(int code)
@@ -160,9 +161,31 @@ const char* wordsForCode(int code)
     return text;
 }
 
+int statusForCode(int code)
+{
+    const explanation* known = explanationOf(code);
+    return known != nullptr ? known->status : exitFailed;
+}
+
+const char* wordsForStatus(int status)
+{
+    static const char* const words[] = {
+        "done",
+        "failed for a reason that has no number here",
+        "wrong use",
+        "the history is damaged or missing",
+        "the lock: its owner died, or it is busy",
+        "no such image",
+        "a chain is incomplete",
+    };
+    static_assert(sizeof words / sizeof *words == exitIncomplete + 1);
+    return words[status];
+}
+
 int failWithCode(int code, const char* what, const char* where)
 {
-    return fail(where, "cannot %s: %s", what, wordsForCode(code));
+    fail(where, "cannot %s: %s", what, wordsForCode(code));
+    return statusForCode(code);
 }
 
 int failInPlace(int code, const char* what, const historyPlace* place)
@@ -171,5 +194,5 @@ int failInPlace(int code, const char* what, const historyPlace* place)
     const explanation* known = explanationOf(code);
     if (known != nullptr && known->advice != nullptr)
         hint(place, known->advice);
-    return exitFailed;
+    return statusForCode(code);
 }

@@ -10,8 +10,12 @@
 // Exit statuses, which the subcommands return.
 enum : int {
     exitDone = 0,
-    exitFailed = 1, // the history is not sound, or what was asked for could not be done
-    exitUsage = 2,  // the command line is wrong
+    exitFailed = 1,     // what was asked for could not be done, for a reason without a number
+    exitUsage = 2,      // the command line is wrong
+    exitDamaged = 3,    // the history is damaged or missing
+    exitLocked = 4,     // the lock's owner died, it stayed busy, or another's set has its key
+    exitNoImage = 5,    // no image has the timestamp, or holds the tablespace
+    exitIncomplete = 6, // a chain lacks an image
 };
 
 // A history directory as the library takes it, and its two files.
@@ -19,33 +23,66 @@ struct historyPlace {
     char directory[pathCapacity]; // ends with the separator
     char historyPath[pathCapacity];
     char shadowPath[pathCapacity];
+    long wait; // seconds that awaitLock waits; -1: without end
 };
 
-// A call of a subcommand.
-struct commandLine {
-    historyPlace place;  // the directory; the first of two
-    historyPlace target; // the second
-    char** arguments;    // those after the directories, null after the last
-    int numArguments;
-    bool json;
-};
+// --- The command line (subcommand.cpp) -----------------------------------------------------------
+
+struct commandLine;
 
 // What there is to know about a subcommand. run returns an exit status.
 struct subcommand {
     const char* name;
     int (*run)(commandLine* line);
     int numDirectories;
-    int least, most; // arguments after the directories; most -1: any number
-    unsigned int options;
-    const char* form; // all of them as the usage line shows them
+    int least, most;      // arguments after the directories; most -1: any number
+    unsigned int options; // that it takes
+    const char* form;     // the arguments as the usage line shows them
     const char* help;
 };
-enum : unsigned int { optionJson = 1 };
 
-int loadMain(commandLine* line);
-int dumpMain(commandLine* line);
+enum : unsigned int {
+    optionJson = 1,
+    optionLast = 2,
+    optionSince = 4,
+    optionKeep = 8,
+    optionBefore = 16,
+    optionIncomplete = 32,
+    optionAll = 64,
+    optionHave = 128,
+    optionMaxAge = 256,
+    optionColor = 512,
+    optionSvg = 1024,
+    optionWait = 2048,
+    optionDryRun = 4096,
+    optionForce = 8192,
+    optionSkipExisting = 16384,
+};
+
+// A call of a subcommand.
+struct commandLine {
+    const subcommand* command;
+    historyPlace place;  // the directory; the first of two
+    historyPlace target; // the second
+    char** arguments;    // those after the directories, null after the last
+    int numArguments;
+    bool json, incomplete, all, dryRun, force, skipExisting;
+    char before[timestampWidth + 1]; // empty: not given; so are the others, null or -1
+    char since[timestampWidth + 1];
+    long last, keep, maxAge, wait;
+    const char *have, *color, *svg;
+    char aliasPaths[2][pathCapacity]; // of directories given as aliases
+    int numAliases;
+};
+
 int imagesMain(commandLine* line);
 int planMain(commandLine* line);
+int chartMain(commandLine* line);
+int checkMain(commandLine* line);
+int unneededMain(commandLine* line);
+int neededByMain(commandLine* line);
+int loadMain(commandLine* line);
+int dumpMain(commandLine* line);
 int statusMain(commandLine* line);
 int verifyMain(commandLine* line);
 int repairMain(commandLine* line);
@@ -54,17 +91,26 @@ int backupMain(commandLine* line);
 int restoreMain(commandLine* line);
 int unlockMain(commandLine* line);
 
-// --- The command line (subcommand.cpp) -----------------------------------------------------------
-
 // Runs the subcommand that argv[1] names and returns its exit status.
 int runProgram(int argc, char** argv);
+
+// Complains with the subcommand's usage line and returns exitUsage.
+int failForm(const commandLine* line);
+
+// Takes a timestamp as histories hold it, 14 digits, or as people write it: 2025-01-11 01:00:00,
+// with a blank or T in the middle. timestamp: room for 15 characters. False: neither.
+bool parseTimestamp(const char* text, char* timestamp);
+
+// Takes a timestamp from the command line: complains and returns exitUsage when it is none, else 0.
+int takeInstant(const char* what, const char* text, char* timestamp);
 
 // --- Messages (message.cpp) ----------------------------------------------------------------------
 
 // Says "zq3hist: what, where" on standard error, what being formatted, and returns exitFailed.
 int fail(const char* where, const char* format, ...) __attribute__((format(printf, 2, 3)));
 
-// Says the same in the words for a code of the library: "zq3hist: cannot WHAT: reason, where".
+// Says the same in the words for a code of the library, "zq3hist: cannot WHAT: reason, where", and
+// returns the code's exit status.
 int failWithCode(int code, const char* what, const char* where);
 
 // Says "zq3hist: hint: advice" on standard error. DIR in the advice stands for the directory, and
@@ -79,6 +125,10 @@ int failUsage(const char* format, ...) __attribute__((format(printf, 1, 2)));
 
 // The words for a code of the library. They live until the next call.
 const char* wordsForCode(int code);
+
+// The words for an exit status, and the exit status for a code of the library.
+const char* wordsForStatus(int status);
+int statusForCode(int code);
 
 // Whether a code is that of a system call that failed, its errno included.
 bool isSystemCode(int code);
@@ -98,16 +148,16 @@ bool hasHistoryFile(const historyPlace* place);
 // file to make a key of, or the system does not tell.
 bool queryLock(const historyPlace* place, SQLO_NLCK* lock, SQLO_NLCKSTATE* state);
 
-// Waits until no living process holds the lock, and says so when it has to; from then on the
-// signals that would end the process are held back until releaseSignals, since dying with the lock
-// leaves it to an administrator. rights: what access(2) must grant for the two files. Complains and
-// returns exitFailed when there is no history, when a right is missing, or when the wait would
-// never end; else 0.
+// Waits, as long as the place allows, until no living process holds the lock, and says so when it
+// has to; from then on the signals that would end the process are held back until releaseSignals,
+// since dying with the lock leaves it to an administrator. rights: what access(2) must grant for
+// the two files. Complains and returns an exit status when there is no history, when a right is
+// missing, when the lock stays busy, or when the wait would never end; else 0.
 int awaitLock(const historyPlace* place, int rights);
 void releaseSignals(void);
 
 // Says why an open failed, telling a repair that failed from a history that is beyond one, and
-// returns exitFailed.
+// returns the code's exit status.
 int failOpening(int code, const char* what, const historyPlace* place);
 
 // Opens the history, which repairs it if it must. Complains on failure and returns exitFailed. A

@@ -1,0 +1,5 @@
+#include "admin/zq3hist.h"
+int chartMain(commandLine*)
+{
+    return 1;
+}

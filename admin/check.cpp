@@ -1,0 +1,5 @@
+#include "admin/zq3hist.h"
+int checkMain(commandLine*)
+{
+    return 1;
+}
