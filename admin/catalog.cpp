@@ -35,7 +35,7 @@ static int fetchThroughFolder(const historyPlace* place, historyData* history)
                  : failWithCode(sqloSystemError | errno, "read the history", place->directory);
     if (rc == 0 && fetchHistoryEntries(alias, nullptr, history, &numBackups) != 0) {
         rc = fail(place->directory, "cannot read the history");
-        hint(place, "zq3hist verify DIR may tell more");
+        hint(place, "zq3hist verify DIR  # may tell more");
     }
     unlink(link);
     rmdir(folder);
@@ -167,7 +167,7 @@ int findImage(const imageCatalog* catalog, const char* timestamp)
 int failNoImage(const historyPlace* place, const char* timestamp)
 {
     fail(place->directory, "no image has the timestamp %s", timestamp);
-    hint(place, "zq3hist images DIR lists all");
+    hint(place, "zq3hist images DIR  # lists all");
     return exitNoImage;
 }
 

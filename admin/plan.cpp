@@ -98,7 +98,7 @@ static int findTarget(planRequest* request)
         fail(request->place->directory, "no image%s is there%s%s",
              request->numNames == 0 ? "" : " with these tablespaces",
              request->before[0] == '\0' ? "" : " up to ", request->before);
-        hint(request->place, "zq3hist images DIR lists all");
+        hint(request->place, "zq3hist images DIR  # lists all");
         return exitNoImage;
     }
     const historyEntry* target = &request->catalog.history.entries[request->target];
@@ -239,11 +239,10 @@ static int failIncomplete(const planRequest* request)
         else if (lack == planLacksOnHand)
             fail(timestamp, "tablespace %s lacks the image %s, which is not on hand", name, image);
     }
-    char advice[128] = "no image of this scope can be restored";
+    char advice[128] = "zq3hist images DIR  # no image of this scope can be restored";
     if (request->restorable >= 0)
         snprintf(advice, sizeof advice,
-                 "the newest image that can be restored is %s: zq3hist plan DIR %s",
-                 timestampAt(request, request->restorable),
+                 "zq3hist plan DIR %s  # the newest image that can be restored",
                  timestampAt(request, request->restorable));
     hint(request->place, advice);
     return exitIncomplete;
