@@ -229,6 +229,8 @@ static void countImages(chainWalk* walk, int last)
         walk->numIncomplete += image->numIncomplete != 0;
         if (image->numIncomplete == 0)
             walk->newestComplete = i;
+        if (walk->history->entries[i].object != zq3ObjectTablespace)
+            walk->newestWhole = i;
     }
 }
 
@@ -289,6 +291,13 @@ void freeChains(chainWalk* walk)
     free(walk->images);
     free(walk->tablespaces);
     *walk = {};
+}
+
+bool isAlive(const chainWalk* walk, int tablespace)
+{
+    const chainTablespace* asked = &walk->tablespaces[tablespace];
+    return asked->name[0] != '\0' && asked->head >= 0 &&
+           walk->links[asked->head].image >= walk->newestWhole;
 }
 
 const char* lackingImage(const chainWalk* walk, const chainLink* link)

@@ -44,12 +44,16 @@ struct chainWalk {
     int numTablespaces;
     int numImages, numIncomplete;
     int newestComplete; // position of the newest image that can be restored; -1: none
+    int newestWhole;    // of the newest image of the whole database; 0 if there is none
 };
 
 // Walks from the oldest entry to that at the position last. Complains and returns exitFailed for
 // want of memory, else 0. freeChains accepts what a failed walk left.
 int walkChains(const imageCatalog* catalog, int last, chainWalk* walk);
 void freeChains(chainWalk* walk);
+
+// Whether the newest image of the whole database, or a later one, holds the tablespace.
+bool isAlive(const chainWalk* walk, int tablespace);
 
 // The next older place that a restore to the link needs; negative after a full version.
 int nextNeeded(const chainWalk* walk, int link);

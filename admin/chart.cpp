@@ -87,13 +87,6 @@ static void markChain(chartBuilder* builder, int link)
             placeMissing(walk, lack, walk->links[oldest].image);
 }
 
-// Whether a tablespace is in the newest image of the whole database, or in a later one.
-static bool isAlive(const chainWalk* walk, const chainTablespace* tablespace, int newestWhole)
-{
-    return tablespace->name[0] != '\0' && tablespace->head >= 0 &&
-           walk->links[tablespace->head].image >= newestWhole;
-}
-
 static void markNeededChains(chartBuilder* builder)
 {
     const imageChart* chart = builder->chart;
@@ -104,12 +97,8 @@ static void markNeededChains(chartBuilder* builder)
             markChain(builder, chains->firstLink + i);
         return;
     }
-    int newestWhole = walk->history->numEntries - 1;
-    while (newestWhole > 0 && (!isImage(&walk->history->entries[newestWhole]) ||
-                               walk->history->entries[newestWhole].object == zq3ObjectTablespace))
-        newestWhole--;
     for (int i = 0; i < walk->numTablespaces; i++)
-        if (isAlive(walk, &walk->tablespaces[i], newestWhole))
+        if (isAlive(walk, i))
             markChain(builder, walk->tablespaces[i].head);
 }
 
