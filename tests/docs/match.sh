@@ -53,13 +53,17 @@ same "exit statuses in zq3ckrst(1)" \
 # zq3hist: the commands with their arguments as the help text gives them, and the fields of stanzas.
 help=$("$zq3hist" --help)
 same "commands of zq3hist(1)" \
-  "$(grep -oP '^  \K[a-z]+ +(\[--json\] )?[A-Z. \[\]]+(?= )' <<<"$help" | tr -s ' ' | sed 's/ $//' |
+  "$(grep -oP '^  \K[a-z-]+ +[A-Z. \[\]]+(?= )' <<<"$help" | tr -s ' ' | sed 's/ $//' |
     tr a-z A-Z)" \
   "$(mandoc -Tascii -Owidth=1000 man/zq3hist.1 | sed "s,.\x08,,g" | sed '/^DESCRIPTION/q' |
-    grep -oP '^ {5}zq3hist \K[a-z]+.*' | sed 's/ \.\.\./.../' | tr a-z A-Z)"
-mapfile -t words < <(grep -oP '^  \K(--)?[a-z]+' <<<"$help"; grep -oP '\[\K--[a-z]+' <<<"$help")
+    grep -oP '^ {5}zq3hist \K[a-z-]+ \[option \.\.\.\].*' | sed 's/ \[option \.\.\.\]//; s/ \.\.\./.../' |
+    tr a-z A-Z)"
+commands=$(grep -oP '^  \K[a-z-]+(?= +[A-Z])' <<<"$help")
+mapfile -t words < <(echo "$commands"; echo "$help" | grep -oP '^  \K--[a-z-]+'
+  for command in $commands; do "$zq3hist" help "$command" | grep -oP '^  \K--[a-z-]+'; done | sort -u)
 holds man/zq3hist.1 "${words[@]}"
-holds completion/zq3hist.bash "${words[@]}"
+mapfile -t words <<<"$commands"
+holds completion/zq3hist.bash "${words[@]}" # options it takes from the help
 mapfile -t texts < <(grep -ohP '(^ *\{"|#define FIELD_\w+ ")\K[A-Z][^"]*' admin/fields.*)
 holds man/zq3hist.1 "${texts[@]}"
 

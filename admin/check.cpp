@@ -1,5 +1,0 @@
-#include "admin/zq3hist.h"
-int checkMain(commandLine*)
-{
-    return 1;
-}
