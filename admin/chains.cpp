@@ -9,11 +9,18 @@
 #include "tool/nameindex.h"
 #include "zq3.h"
 
+// A name that the history holds, and the tablespace that it stands for now.
+struct chainName {
+    char name[nameSize];
+    nameLinks links;
+    int number;
+};
+
 // What the walk needs beside what it leaves.
 struct chainWalker {
     const imageCatalog* catalog;
     chainWalk* walk;
-    nameIndex index; // numbers of the tablespaces that bear a name now
+    chainName* names;
     size_t numNames, nameCapacity;
     int tablespaceCapacity;
     int* countedFor; // by position: the image that it was counted for last
@@ -21,18 +28,17 @@ struct chainWalker {
 
 // --- Tablespaces and their names -----------------------------------------------------------------
 
-static bool growIndex(chainWalker* walker)
+static bool growNames(chainWalker* walker)
 {
-    nameIndex grown;
     size_t capacity = walker->nameCapacity * 2 + 64;
-    if (!initNameIndex(&grown, capacity))
+    void* grown = reallocarray(walker->names, capacity, sizeof *walker->names);
+    if (grown == nullptr)
         return false;
-    for (size_t i = 0; walker->index.slots != nullptr && i <= walker->index.mask; i++)
-        if (walker->index.slots[i].used)
-            *findNameSlot(&grown, walker->index.slots[i].key) = walker->index.slots[i];
-    freeNameIndex(&walker->index);
-    walker->index = grown;
+    walker->names = static_cast<chainName*>(grown);
     walker->nameCapacity = capacity;
+    clearNames(walker->names, capacity);
+    for (size_t i = 0; i < walker->numNames; i++)
+        enterName(walker->names, capacity, i);
     return true;
 }
 
@@ -55,21 +61,28 @@ static int addTablespace(chainWalker* walker, const char* name)
     return walk->numTablespaces++;
 }
 
-// The number that a name stands for now, a new one if need be; -1 for want of memory.
+// What the walk knows of a name; one that is new stands for a new tablespace. Null: no memory. It
+// is valid until the next call.
+static chainName* takeName(chainWalker* walker, const char* name)
+{
+    int found = walker->numNames == 0 ? -1 : findName(walker->names, walker->nameCapacity, name);
+    if (found >= 0)
+        return &walker->names[found];
+    if (walker->numNames == walker->nameCapacity && !growNames(walker))
+        return nullptr;
+    chainName* added = &walker->names[walker->numNames];
+    copyName(added->name, name);
+    added->number = addTablespace(walker, name);
+    if (added->number < 0)
+        return nullptr;
+    enterName(walker->names, walker->nameCapacity, walker->numNames++);
+    return added;
+}
+
 static int numberOf(chainWalker* walker, const char* name)
 {
-    if (walker->numNames == walker->nameCapacity && !growIndex(walker))
-        return -1;
-    nameKey key = makeNameKey(name);
-    nameIndexSlot* slot = findNameSlot(&walker->index, key);
-    if (slot->used)
-        return slot->number;
-    int number = addTablespace(walker, name);
-    if (number >= 0) {
-        *slot = {key, number, true};
-        walker->numNames++;
-    }
-    return number;
+    const chainName* taken = takeName(walker, name);
+    return taken != nullptr ? taken->number : -1;
 }
 
 // --- Entries -------------------------------------------------------------------------------------
@@ -161,8 +174,8 @@ static int takeRename(chainWalker* walker, const historyEntry* entry)
     chainTablespace* tablespaces = walker->walk->tablespaces;
     tablespaces[replaced].name[0] = '\0';
     copyName(tablespaces[renamed].name, replaced == renamed ? "" : newName);
-    findNameSlot(&walker->index, makeNameKey(newName))->number = renamed;
-    findNameSlot(&walker->index, makeNameKey(oldName))->number = fresh;
+    takeName(walker, newName)->number = renamed; // both are known by now
+    takeName(walker, oldName)->number = fresh;
     return 0;
 }
 
@@ -272,7 +285,9 @@ static int takeEntry(chainWalker* walker, int position)
 
 int walkChains(const imageCatalog* catalog, int last, chainWalk* walk)
 {
-    chainWalker walker = {catalog, walk, {}, 0, 0, 0, nullptr};
+    chainWalker walker = {};
+    walker.catalog = catalog;
+    walker.walk = walk;
     *walk = {};
     walk->history = &catalog->history;
     int rc = allocateWalk(&walker, last) ? 0 : -1;
@@ -280,7 +295,7 @@ int walkChains(const imageCatalog* catalog, int last, chainWalk* walk)
         rc = takeEntry(&walker, i);
     if (rc == 0)
         countImages(walk, last);
-    freeNameIndex(&walker.index);
+    free(walker.names);
     free(walker.countedFor);
     return rc == 0 ? 0 : failWithCode(sqloSystemError | ENOMEM, "plan", "all images");
 }

@@ -14,11 +14,12 @@ static const char dumped[] = "Operation: backup\nTimestamp: 20250105010000\nNode
                              "Operation: backup\nType: delta\nTimestamp: 20250106010000\n"
                              "Note: second\\n\\x07\nNode: 0\nNumber: 2\n"
                              "Tablespace: A\nTablespace: B\nSQLCODE: 2\n\n[0]";
+#define HEAD "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
 #define SOUND "zq3rhist.asc: sound, 2 entries\nzq3rhist.bak: sound, 2 entries\n[0]"
 #define DAMAGED                                                                                    \
     "zq3hist: cannot append to the history: the history is damaged, h/\n"                          \
     "zq3hist: hint: zq3hist verify h/ names the damage; zq3hist repair h/ and zq3hist restore h/ " \
-    "FILE mend it\n[1]"
+    "FILE mend it\n[3]"
 #define SPOIL(file, at)                                                                            \
     "printf '\\377' | dd of=h/zq3rhist." file " seek=" at " bs=1 conv=notrunc status=none; "
 
@@ -34,7 +35,7 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
     } steps[] = {
         {"", "dump h/",
          "zq3hist: cannot open the history: the directory holds no history file, h/\n"
-         "zq3hist: hint: zq3hist load h/ FILE makes one\n[1]"},
+         "zq3hist: hint: zq3hist load h/ FILE makes one\n[3]"},
         {": >h/zq3rhist.asc; ", "load h/", "2 entries appended\n[0]"},
         {"", "status h/",
          "history   zq3rhist.asc: 2798 bytes, status ' ' (consistent), 2 entries, newest "
@@ -43,18 +44,20 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
          "entries, newest 20250106010000 at offset 1814, node 0\n"
          "lock      free (key KEY)\n          usable; both files are in step\n[0]"},
         {"", "images h/",
-         "20250105010000  full         database       2 tablespaces     1 image   complete\n"
-         "20250106010000  delta        database       2 tablespaces     2 images  complete\n[0]"},
+         HEAD "20250105010000  full         database              2       1  complete\n"
+              "20250106010000  delta        database              2       2  complete\n"
+              "2 images, 0 incomplete; newest that can be restored: 20250106010000\n[0]"},
         {"", "plan h/ 20250106010000 b",
          "1/2  full         20250105010000  B  for 20250106010000\n"
          "2/2  delta        20250106010000  B  target\n[0]"},
         {"", "plan --json h/ 20250106010000",
-         "{\"target\":\"20250106010000\",\"complete\":true,\"images\":["
-         "{\"position\":1,\"kind\":\"full\",\"scope\":\"database\",\"timestamp\":"
-         "\"20250105010000\",\"tablespaces\":[\"A\",\"B\"],\"whole\":true,\"neededBy\":["
-         "\"20250106010000\"]},{\"position\":2,\"kind\":\"delta\",\"scope\":\"database\","
-         "\"timestamp\":\"20250106010000\",\"tablespaces\":[\"A\",\"B\"],\"whole\":true,"
-         "\"neededBy\":[]}],\"missing\":[]}\n[0]"},
+         "{\"format\":1,\"target\":\"20250106010000\",\"complete\":true,\"images\":["
+         "{\"position\":1,\"timestamp\":\"20250105010000\",\"kind\":\"full\",\"scope\":"
+         "\"database\",\"tablespaceCount\":2,\"tablespaces\":[\"A\",\"B\"],\"whole\":true,"
+         "\"neededBy\":[\"20250106010000\"]},{\"position\":2,\"timestamp\":"
+         "\"20250106010000\",\"kind\":\"delta\",\"scope\":\"database\",\"tablespaceCount\":"
+         "2,\"tablespaces\":[\"A\",\"B\"],\"whole\":true,\"neededBy\":[]}],\"imageCount\":2,"
+         "\"missing\":[],\"gap\":null,\"newestRestorable\":\"20250106010000\"}\n[0]"},
         {"", "backup h/ image", "The history was backed up.\n[0]"},
         {"", "copy h/ copy", "The history was copied.\n[0]"},
         {"", "verify copy/", SOUND},
@@ -92,12 +95,13 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
          "zq3hist: the backup would replace the history itself, h/zq3rhist.bak\n[1]"},
         {"", "status \"it's\"",
          "zq3hist: cannot show the history: the directory holds no history file, it's/\n"
-         "zq3hist: hint: zq3hist load $'it\\'s/' FILE makes one\n[1]"},
-        {"", "verify", "zq3hist: usage: zq3hist verify DIR\nTry 'zq3hist --help'.\n[2]"},
+         "zq3hist: hint: zq3hist load $'it\\'s/' FILE makes one\n[3]"},
+        {"", "verify",
+         "zq3hist: usage: zq3hist verify [OPTION...] DIR\nTry 'zq3hist --help'.\n[2]"},
         {"", "dump --xml h/", "zq3hist: dump: unknown option --xml\nTry 'zq3hist --help'.\n[2]"},
         {"", "plan h/ 20250107000000",
          "zq3hist: no image has the timestamp 20250107000000, h/\n"
-         "zq3hist: hint: zq3hist images h/ lists all\n[1]"},
+         "zq3hist: hint: zq3hist images h/  # lists all\n[5]"},
         {"", "--version", "zq3hist 1.0.0\n[0]"},
         {"", "dump h/ >/dev/full",
          "zq3hist: cannot write: No space left on device, standard output\n[1]"},
@@ -124,18 +128,21 @@ TEST_F(ProgramTest, PlansTellWhatIsMissing)
                stanza("restore", 15, "Id: 20240101000000\nTablespace: NEW\n") +
                stanza("backup", 16, "Type: delta\nTablespace: NEW\nTablespace: X\n");
     EXPECT_EQ("46 entries appended\n[0]", run("load h/", history));
-    EXPECT_EQ("20250110000000  full         database       1 tablespace      1 image   complete\n"
-              "20250113000000  full         database       0 tablespaces     1 image   complete\n"
-              "20250114000000  delta        database       1 tablespace      3 images  complete\n"
-              "20250116000000  delta        database       2 tablespaces     2 images  incomplete: "
-              "NEW lacks the image 20240101000000, X lacks a full image\n[0]",
+    EXPECT_EQ(HEAD "20250110000000  full         database              1       1  complete\n"
+                   "20250113000000  full         database              0       1  complete\n"
+                   "20250114000000  delta        database              1       3  complete\n"
+                   "20250116000000  delta        database              2       2  incomplete: NEW "
+                   "lacks the image 20240101000000, X lacks a full image\n"
+                   "4 images, 1 incomplete; newest that can be restored: 20250114000000\n[0]",
               run("images h/"));
     EXPECT_EQ("1/3  full         20250110000000  NEW  for 20250114000000\n"
-              "2/3  full         20250113000000  \n"
+              "2/3  full         20250113000000\n"
               "3/3  delta        20250114000000  NEW  target\n[0]",
               run("plan h/ 20250114000000"));
     EXPECT_EQ("zq3hist: tablespace NEW lacks the image 20240101000000 that was restored, "
-              "20250116000000\nzq3hist: tablespace X lacks a full image, 20250116000000\n[1]",
+              "20250116000000\nzq3hist: tablespace X lacks a full image, 20250116000000\n"
+              "zq3hist: hint: zq3hist plan h/ 20250114000000  # the newest image that can be "
+              "restored\n[6]",
               run("plan h/ 20250116000000"));
 }
 
@@ -272,7 +279,7 @@ TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)
         waitpid(child, nullptr, 0);
         EXPECT_EQ("zq3hist: cannot take the lock: a process died while it held the lock, h/\n"
                   "zq3hist: hint: zq3hist unlock h/ removes the lock; the next open settles what "
-                  "the process left unfinished\n[1]",
+                  "the process left unfinished\n[4]",
                   run("load h/", week));
         EXPECT_EQ(std::string("Removed the lock of a process that died while it ") +
                       (isReady ? "held it.\n[0]" : "took it.\n[0]"),

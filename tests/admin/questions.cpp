@@ -49,11 +49,12 @@ static std::string anyHistory(std::mt19937& random, std::string* onHand)
             text += stanza("create tablespace", time, "", {names[random() % 4]});
             break;
         case 2:
-            text += stanza("rename tablespace", time, "",
-                           {names[random() % 4], names[random() % 4]});
+            text +=
+                stanza("rename tablespace", time, "", {names[random() % 4], names[random() % 4]});
             break;
         default:
-            text += stanza("backup", time, std::string("Type: ") + types[random() % 4] + "\n", some);
+            text +=
+                stanza("backup", time, std::string("Type: ") + types[random() % 4] + "\n", some);
         }
         *onHand += random() % 20 != 0 ? std::to_string(time) + "\n" : "";
     }

@@ -53,12 +53,12 @@ same "exit statuses in zq3ckrst(1)" \
 # zq3hist: the commands with their arguments as the help text gives them, and the fields of stanzas.
 help=$("$zq3hist" --help)
 same "commands of zq3hist(1)" \
-  "$(grep -oP '^  \K[a-z-]+ +[A-Z. \[\]]+(?= )' <<<"$help" | tr -s ' ' | sed 's/ $//' |
+  "$(grep -oP '^  \K[a-z][a-z-]* +[A-Z. \[\]]+(?= )' <<<"$help" | tr -s ' ' | sed 's/ $//' |
     tr a-z A-Z)" \
   "$(mandoc -Tascii -Owidth=1000 man/zq3hist.1 | sed "s,.\x08,,g" | sed '/^DESCRIPTION/q' |
     grep -oP '^ {5}zq3hist \K[a-z-]+ \[option \.\.\.\].*' | sed 's/ \[option \.\.\.\]//; s/ \.\.\./.../' |
     tr a-z A-Z)"
-commands=$(grep -oP '^  \K[a-z-]+(?= +[A-Z])' <<<"$help")
+commands=$(grep -oP '^  \K[a-z][a-z-]*(?= +[A-Z])' <<<"$help")
 mapfile -t words < <(echo "$commands"; echo "$help" | grep -oP '^  \K--[a-z-]+'
   for command in $commands; do "$zq3hist" help "$command" | grep -oP '^  \K--[a-z-]+'; done | sort -u)
 holds man/zq3hist.1 "${words[@]}"
