@@ -59,10 +59,9 @@ int sqluhSprintf(char* buffer, const char* format, ...)
     pdtEntry();
 
     // For this thread alone, where setlocale would switch the whole process and hand out a name
-    // that another thread may free: handles may be in use side by side. Nothing is allocated for
-    // "C".
-    static const locale_t formatLocale = newlocale(LC_ALL_MASK, "C", nullptr);
-    locale_t callers = uselocale(formatLocale);
+    // that another thread may free: handles may be in use side by side. For "C" the system hands
+    // out the one object that it has; nothing is allocated.
+    locale_t callers = uselocale(newlocale(LC_ALL_MASK, "C", nullptr));
     va_list arguments;
     va_start(arguments, format);
     int length = vsprintf(buffer, format, arguments);
