@@ -188,7 +188,7 @@ static int listRows(imagePlan* plan)
     plan->rows = static_cast<const historyEntry**>(
         reallocarray(nullptr, static_cast<size_t>(stages->numBackups), sizeof *plan->rows));
     if (plan->rows == nullptr)
-        return reportError(msgNoMemoryImages);
+        return failStage(msgNoMemoryImages);
     const historyEntry* entry = stages->histData.entries;
     for (int row = 0; row < stages->numBackups; entry++)
         if (isImage(entry))
@@ -203,6 +203,14 @@ static void countPlan(const imageCatalog* catalog, imagePlan* plan)
         plan->numImages += isNeeded(plan, row);
     for (int column = 0; column < plan->stages.numTablespaces; column++)
         plan->numIncomplete += lackOfColumn(catalog, plan, column, &image) != planLacksNothing;
+}
+
+// Says what a stage has to say.
+static int failPlanning(const char* timestamp)
+{
+    return lastFailure.message->code == outOfMemory
+               ? failWithCode(sqloSystemError | ENOMEM, "plan the restore", timestamp)
+               : fail(timestamp, "the image holds none of the tablespaces");
 }
 
 int planImage(imageCatalog* catalog, int target, char** names, int numNames, imagePlan* plan)
@@ -226,7 +234,7 @@ int planImage(imageCatalog* catalog, int target, char** names, int numNames, ima
     if (rc == 0)
         rc = allocateTimelineMatrix(stages);
     if (rc != 0)
-        return exitFailed; // the stage has told
+        return failPlanning(history->entries[target].timestamp);
     fillColumns(stages->matrix, history, stages->list, stages->numTablespaces, stages->numBackups);
     scanColumns(stages->matrix, stages->numTablespaces, stages->numBackups);
     countPlan(catalog, plan);

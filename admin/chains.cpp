@@ -36,9 +36,7 @@ static bool growNames(chainWalker* walker)
         return false;
     walker->names = static_cast<chainName*>(grown);
     walker->nameCapacity = capacity;
-    clearNames(walker->names, capacity);
-    for (size_t i = 0; i < walker->numNames; i++)
-        enterName(walker->names, capacity, i);
+    enterNames(walker->names, capacity, walker->numNames);
     return true;
 }
 

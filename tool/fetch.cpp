@@ -1,4 +1,4 @@
-// Fetching the history: the scan, the entries that are kept, their order, their listing.
+// Fetching the history: the calls, the entries that are kept, their order, their listing.
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
@@ -13,9 +13,10 @@ enum : uint32_t {
     commandTextCapacity = 2097152,
     objectPartLength = zq3ObjectPartCapacity - 1, // timestamp and sequence number
     commandPrefixLength = 35,                     // what isCreateTempspace looks at
+    recentLists = 256,
 };
 
-// The buffers that the scan fills, and what one get left in them.
+// The buffers that the gets fill, what one get left in them, and the lists made of such names.
 struct scanBuffers {
     char objectPart[zq3ObjectPartCapacity];
     char secondTimestamp[zq3SecondTimestampCapacity];
@@ -28,8 +29,10 @@ struct scanBuffers {
     char noteText[zq3NoteTextCapacity];
     char* commandText;
     textBuffer* tablespaceBuffers;
-    char (*names)[nameSize]; // the name block
-    uint32_t maxTablespaces; // slots in it
+    char (*names)[nameSize];       // the name block
+    uint32_t maxTablespaces;       // slots in it
+    nameList* last;                // list of the last entry with names
+    nameList* recent[recentLists]; // the last list for each remainder of its hash
     sqlca eventSQLCA;
     zq3HistoryData tempHistData;
 };
@@ -131,14 +134,14 @@ static bool isKept(scanBuffers* buffers)
 static int growEntries(historyData* data)
 {
     if (data->numEntries > INT_MAX - entryGrowth)
-        return reportError(msgNoMemoryEntries);
+        return failStage(msgNoMemoryEntries);
 
     size_t size = static_cast<size_t>(data->numEntries) + entryGrowth;
     if (size > SIZE_MAX / sizeof(historyEntry))
-        return reportError(msgNoMemoryEntries);
+        return failStage(msgNoMemoryEntries);
     void* grown = realloc(data->entries, size * sizeof(historyEntry));
     if (grown == nullptr)
-        return reportError(msgNoMemoryEntries);
+        return failStage(msgNoMemoryEntries);
 
     data->entries = static_cast<historyEntry*>(grown);
     memset(static_cast<void*>(data->entries + data->numEntries), 0,
@@ -150,6 +153,44 @@ static int growEntries(historyData* data)
 static void copyTimestamp(char* target, const char* text)
 {
     memcpy(target, text, strnlen(text, timestampLength));
+}
+
+static bool hasNames(const nameList* list, const char (*names)[nameSize], uint32_t count)
+{
+    return list != nullptr && list->count == count &&
+           memcmp(list + 1, names, static_cast<size_t>(count) * nameSize) == 0;
+}
+
+static uint32_t hashNames(const char (*names)[nameSize], uint32_t count)
+{
+    uint64_t hash = count;
+    for (uint32_t i = 0; i < count; i++) {
+        nameKey key = makeNameKey(names[i]);
+        hash = (std::rotl(hash, 5) ^ key.head ^ std::rotl(key.middle, 21) ^ key.tail) *
+               0x9E3779B97F4A7C15u;
+    }
+    return static_cast<uint32_t>(hash >> 32);
+}
+
+// The list for the names in the first count slots: that of a recent entry where one has the same
+// names, else a new one. Null: no memory.
+static nameList* takeNames(scanBuffers* buffers, uint32_t count)
+{
+    if (hasNames(buffers->last, buffers->names, count))
+        return buffers->last;
+
+    // What stands after the names in their slots is anything.
+    for (uint32_t i = 0; i < count; i++)
+        copyName(buffers->names[i], buffers->names[i]);
+    nameList** recent = &buffers->recent[hashNames(buffers->names, count) % recentLists];
+    if (!hasNames(*recent, buffers->names, count)) {
+        nameList* list = makeNameList(buffers->names, count);
+        if (list == nullptr)
+            return nullptr;
+        *recent = list;
+    }
+    buffers->last = *recent;
+    return buffers->last;
 }
 
 // Adds the entry in the buffers to the collection; it counts only once it is complete.
@@ -172,34 +213,32 @@ static int keepEntry(scanBuffers* buffers, historyData* data)
     // The record tells how many names the history's entry has; only so many have a slot.
     uint32_t numNames = record->numTablespaces < buffers->maxTablespaces ? record->numTablespaces
                                                                          : buffers->maxTablespaces;
-    if (numNames != 0) {
-        // Within the size of the name block, which was allocated; each slot is written in full.
-        entry->tablespaceNames = static_cast<char(*)[nameSize]>(malloc(nameSize * numNames));
-        if (entry->tablespaceNames == nullptr)
-            return reportError(msgNoMemoryNames);
-        for (uint32_t i = 0; i < numNames; i++)
-            copyName(entry->tablespaceNames[i], buffers->names[i]);
-    }
+    nameList* list = numNames != 0 ? takeNames(buffers, numNames) : nullptr;
+    if (numNames != 0 && list == nullptr)
+        return failStage(msgNoMemoryNames);
+    giveNames(entry, list);
     entry->numTablespaces = numNames;
     data->numEntries++;
     return 0;
 }
 
 // Gets all entries of the open scan. *targetFound: whether the target image is among those kept.
-static int readEntries(scanBuffers* buffers, const zq3HistoryOpenStruct* scan,
-                       const char* timestamp, historyData* data, bool* targetFound, sqlca* ca)
+static int readEntries(const historySource* source, const zq3HistoryOpenStruct* scan,
+                       const char* timestamp, scanBuffers* buffers, historyData* data,
+                       bool* targetFound)
 {
     const planMessage* failure = allocateBuffers(buffers, scan->maxTablespaces);
     if (failure != nullptr)
-        return reportError(*failure);
+        return failStage(*failure);
     setUpRecord(buffers);
 
     int rc = 0;
+    sqlca ca = {};
     zq3HistoryFetchStruct fetchStruct = {&buffers->tempHistData, scan->handle, 2};
     for (uint32_t row = 0; row < scan->numRows && rc == 0; row++) {
-        int result = zq3HistoryGetEntry(zq3Version, &fetchStruct, ca);
-        if (result != 0 || ca->sqlcode < 0)
-            return reportScanError(msgGetEntry, ca->sqlcode);
+        int result = source->getEntry(source->context, &fetchStruct, &ca);
+        if (result != 0 || ca.sqlcode < 0)
+            return failScan(msgGetEntry, ca.sqlcode);
         if (!isKept(buffers))
             continue;
 
@@ -212,9 +251,14 @@ static int readEntries(scanBuffers* buffers, const zq3HistoryOpenStruct* scan,
     return rc;
 }
 
+// Histories are mostly written in the order of time.
 static void sortEntries(historyData* data)
 {
-    if (data->numEntries > 0)
+    int inOrder = 1;
+    while (inOrder < data->numEntries &&
+           sortHistoryEntries(&data->entries[inOrder - 1], &data->entries[inOrder]) < 0)
+        inOrder++;
+    if (inOrder < data->numEntries)
         qsort(data->entries, static_cast<size_t>(data->numEntries), sizeof(historyEntry),
               sortHistoryEntries);
 }
@@ -236,31 +280,31 @@ static void locateTarget(historyData* data, const char* timestamp, int* numBacku
     }
 }
 
-int fetchHistoryEntries(char* alias, char* timestamp, historyData* data, int* numBackups)
+int fetchFromSource(const historySource* source, const char* timestamp, historyData* data,
+                    int* numBackups)
 {
     int rc = 0;
     bool targetFound = timestamp == nullptr;
     sqlca ca = {};
     scanBuffers buffers = {};
     zq3HistoryOpenStruct openStruct = {};
-    openStruct.databaseAlias = alias;
 
-    int result = zq3HistoryOpenScan(zq3Version, &openStruct, &ca);
+    int result = source->openScan(source->context, &openStruct, &ca);
     if (result != 0 || ca.sqlcode < 0)
-        rc = reportScanError(msgOpenScan, ca.sqlcode);
+        rc = failScan(msgOpenScan, ca.sqlcode);
     else if (openStruct.numRows != 0 && openStruct.maxTablespaces != 0)
-        rc = readEntries(&buffers, &openStruct, timestamp, data, &targetFound, &ca);
+        rc = readEntries(source, &openStruct, timestamp, &buffers, data, &targetFound);
 
     if (rc == 0 && targetFound)
         sortEntries(data);
     if (rc == 0 && targetFound && timestamp != nullptr)
         locateTarget(data, timestamp, numBackups);
 
-    zq3HistoryCloseScan(zq3Version, &openStruct.handle, &ca);
+    source->closeScan(source->context, &openStruct.handle, &ca);
     if (rc == 0 && ca.sqlcode < 0)
-        rc = reportScanError(msgCloseScan, ca.sqlcode);
+        rc = failScan(msgCloseScan, ca.sqlcode);
     if (rc == 0 && !targetFound)
-        rc = reportError(msgNoImage, timestamp);
+        rc = failStage(msgNoImage, timestamp);
 
     freeBuffers(&buffers);
     return rc;

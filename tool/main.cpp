@@ -66,6 +66,53 @@ static void getHelp()
           stderr);
 }
 
+// --- The error report ----------------------------------------------------------------------------
+
+const char errorString[] = "Error: zq3ckrst -";
+
+// Writes the error report of a failure and returns its code.
+static int reportFailure(const planFailure& failure)
+{
+    const planMessage& message = *failure.message;
+    char text[512];
+    snprintf(text, sizeof text, message.text, failure.argument);
+
+    fflush(stdout); // what was listed before the failure stands before it on a terminal, too
+    fprintf(stderr, "\n%s %s", errorString, text);
+    fprintf(stderr, "\nReturn code of %d seen at line %u\n\n", message.code, message.site);
+    return message.code;
+}
+
+static int reportError(const planMessage& message)
+{
+    return reportFailure({&message, "", 0});
+}
+
+// Reports a failed scan call, which has nothing to report when it failed without an SQLCODE.
+static void reportScanFailure(const planFailure& failure)
+{
+    if (failure.sqlcode == 0)
+        return;
+    fprintf(stderr, "\n%s ", errorString);
+    fprintf(stderr, "%s returned SQLCA Code %d at line %u\n\n", failure.message->text,
+            failure.sqlcode, failure.message->site);
+}
+
+// Reports the failure of a stage.
+static void reportStage(const planFailure& failure)
+{
+    switch (failure.message->code) {
+    case scanOpenFailed:
+    case scanGetFailed:
+    case scanCloseFailed:
+        reportScanFailure(failure);
+        break;
+    default:
+        reportFailure(failure);
+        break;
+    }
+}
+
 // --- The command line ----------------------------------------------------------------------------
 //
 // Each option's function takes the option's value at argv[*at + 1] and leaves *at at the last
@@ -172,7 +219,7 @@ static int refuseTablespaceImage(const restorePlan* plan, restoreKind kind)
 {
     bool tablespaceImage =
         plan->histData.entries[plan->histData.backupIndex].object == zq3ObjectTablespace;
-    return kind == restoreDatabase && tablespaceImage ? reportError(msgTablespaceImage) : 0;
+    return kind == restoreDatabase && tablespaceImage ? failStage(msgTablespaceImage) : 0;
 }
 
 static void listEntriesFound(restorePlan* plan)
@@ -193,6 +240,27 @@ static int renameTablespaces(restorePlan* plan)
         printf("\n\nAfter update for rename tablespaces ...\n");
         showEntries(&plan->histData);
     }
+    return rc;
+}
+
+static void warnNotInImage(const char* name)
+{
+    fflush(stdout);
+    fprintf(stderr, "\nWARNING:  zq3ckrst - Tablespace name \"%s\" is not in the\n", name);
+    fprintf(stderr, "                     image specified; will try to continue with\n");
+    fprintf(stderr, "                     remaining valid names.\n\n");
+}
+
+static int listTablespaces(restorePlan* plan, const planOptions* options, char** argv)
+{
+    if (options->kind == restoreDatabase || !options->namesGiven)
+        return listTargetTablespaces(plan);
+
+    char** names = argv + options->firstName;
+    int rc = listNamedTablespaces(plan, names, options->numNames);
+    for (int i = 0; i < options->numNames && rc != outOfMemory; i++)
+        if (!isNameListed(plan, names[i]))
+            warnNotInImage(names[i]);
     return rc;
 }
 
@@ -228,13 +296,8 @@ static int planRestore(restorePlan* plan, planOptions* options, char** argv)
     rc = listBackupImages(plan);
     if (rc == 0)
         rc = renameTablespaces(plan);
-    if (rc != 0)
-        return rc;
-
-    if (options->kind == restoreDatabase || !options->namesGiven)
-        rc = listTargetTablespaces(plan);
-    else
-        rc = listNamedTablespaces(plan, argv + options->firstName, options->numNames);
+    if (rc == 0)
+        rc = listTablespaces(plan, options, argv);
     if (rc == 0)
         rc = traceTimeline(plan);
     if (rc == 0)
@@ -256,6 +319,8 @@ int main(int argc, char** argv)
     settleRestoreKind(&options);
     restorePlan plan = {};
     rc = planRestore(&plan, &options, argv);
+    if (rc != 0)
+        reportStage(lastFailure);
     freePlan(&plan);
     return rc;
 }

@@ -70,13 +70,6 @@ inline size_t bucketOf(const nameKey& key, size_t buckets)
     return static_cast<size_t>((hash >> 32) * buckets >> 32);
 }
 
-// Forgets the names of all records; there are as many buckets as records.
-template <typename Record> void clearNames(Record* records, size_t buckets)
-{
-    for (size_t i = 0; i < buckets; i++)
-        records[i].links = {};
-}
-
 // The number of the record with the name in a slot, or -1.
 template <typename Record> int findName(const Record* records, size_t buckets, const char* slot)
 {
@@ -93,4 +86,14 @@ template <typename Record> void enterName(Record* records, size_t buckets, size_
     uint32_t* first = &records[bucketOf(makeNameKey(records[number].name), buckets)].links.first;
     records[number].links.next = *first;
     *first = static_cast<uint32_t>(number + 1);
+}
+
+// Forgets all names and enters those of the first count records; there are as many buckets as
+// records.
+template <typename Record> void enterNames(Record* records, size_t buckets, size_t count)
+{
+    for (size_t i = 0; i < buckets; i++)
+        records[i].links = {};
+    for (size_t i = 0; i < count; i++)
+        enterName(records, buckets, i);
 }

@@ -69,7 +69,7 @@ int printRestoreOrder(restorePlan* plan, const char* alias, const char* timestam
     if (plan->numTablespaces > 0) {
         plan->selected = static_cast<char*>(calloc(static_cast<size_t>(plan->numTablespaces), 1));
         if (plan->selected == nullptr)
-            return reportError(msgNoMemorySelected);
+            return failStage(msgNoMemorySelected);
     }
     for (int row = 0; row < plan->numBackups; row++)
         printRow(plan, alias, row);

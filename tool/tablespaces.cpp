@@ -22,10 +22,10 @@ int increaseTablespaceList(int current, int increment, tablespaceInfo** list)
 {
     size_t size = static_cast<size_t>(current) + static_cast<size_t>(increment);
     if (size > SIZE_MAX / sizeof(tablespaceInfo))
-        return reportError(msgNoMemoryList);
+        return failStage(msgNoMemoryList);
     void* grown = realloc(*list, size * sizeof(tablespaceInfo));
     if (grown == nullptr)
-        return reportError(msgNoMemoryList);
+        return failStage(msgNoMemoryList);
 
     *list = static_cast<tablespaceInfo*>(grown);
     memset(static_cast<void*>(*list + current), 0,
@@ -70,9 +70,7 @@ void addTablespacesFromHistEntryToList(tablespaceInfo* list, historyEntry* entry
 {
     size_t held = static_cast<size_t>(*count);
     size_t buckets = held + entry->numTablespaces;
-    clearNames(list, buckets);
-    for (size_t i = 0; i < held; i++)
-        enterName(list, buckets, i);
+    enterNames(list, buckets, held);
     for (uint32_t i = 0; i < entry->numTablespaces; i++)
         if (findName(list, buckets, entry->tablespaceNames[i]) < 0)
             appendTablespace(list, buckets, entry->tablespaceNames[i], count);
@@ -84,20 +82,12 @@ int listTargetTablespaces(restorePlan* plan)
     if (target->numTablespaces == 0)
         return 0;
     if (target->numTablespaces > INT_MAX)
-        return reportError(msgNoMemoryList);
+        return failStage(msgNoMemoryList);
 
     int rc = increaseTablespaceList(0, static_cast<int>(target->numTablespaces), &plan->list);
     if (rc == 0)
         addTablespacesFromHistEntryToList(plan->list, target, &plan->numTablespaces);
     return rc;
-}
-
-static void warnNotInImage(const char* name)
-{
-    fflush(stdout);
-    fprintf(stderr, "\nWARNING:  zq3ckrst - Tablespace name \"%s\" is not in the\n", name);
-    fprintf(stderr, "                     image specified; will try to continue with\n");
-    fprintf(stderr, "                     remaining valid names.\n\n");
 }
 
 // Puts a name of any length into a slot. False: no tablespace can have it.
@@ -130,6 +120,7 @@ static int keepMarked(tablespaceInfo* list, int count)
         copyName(list[kept].name, list[i].name);
         kept++;
     }
+    enterNames(list, static_cast<size_t>(kept), static_cast<size_t>(kept));
     return kept;
 }
 
@@ -148,11 +139,15 @@ int listNamedTablespaces(restorePlan* plan, char** names, int numNames)
             appendTablespace(plan->list, buckets, slot, &count);
     }
     markHeld(plan->list, buckets, &plan->histData.entries[plan->histData.backupIndex]);
-    for (int i = 0; i < numNames; i++)
-        if (!fillSlot(slot, names[i]) || !plan->list[findName(plan->list, buckets, slot)].tracking)
-            warnNotInImage(names[i]);
     plan->numTablespaces = keepMarked(plan->list, count);
-    return plan->numTablespaces == 0 ? reportError(msgNoValidNames) : 0;
+    return plan->numTablespaces == 0 ? failStage(msgNoValidNames) : 0;
+}
+
+bool isNameListed(const restorePlan* plan, const char* name)
+{
+    char slot[nameSize];
+    size_t buckets = static_cast<size_t>(plan->numTablespaces);
+    return buckets > 0 && fillSlot(slot, name) && findName(plan->list, buckets, slot) >= 0;
 }
 
 // --- Renames -------------------------------------------------------------------------------------
@@ -171,7 +166,7 @@ int listNamedTablespaces(restorePlan* plan, char** names, int numNames)
 // A rename, or what the table makes of a name.
 struct nameChange {
     nameLinks links;
-    int seenIn; // table: the last entry that was found to list the name
+    int seenIn; // table: the last list, in the order of the walk, that was found to hold the name
     char name[nameSize];
     char newName[nameSize];
 };
@@ -183,6 +178,7 @@ struct renameWalk {
     nameChange* effects;
     int numEffects;
     size_t buckets; // of effects
+    int numLists;   // looked at so far
     bool oneByOne;  // a rename concerns ***
 };
 
@@ -219,7 +215,7 @@ static void setEffect(renameWalk* walk, const char* name, const char* newName)
     int effect = findName(walk->effects, walk->buckets, name);
     if (effect < 0) {
         effect = walk->numEffects++;
-        walk->effects[effect].seenIn = -1;
+        walk->effects[effect].seenIn = 0;
         copyName(walk->effects[effect].name, name);
         enterName(walk->effects, walk->buckets, static_cast<size_t>(effect));
     }
@@ -243,24 +239,25 @@ static void addRename(renameWalk* walk, const historyEntry* entry)
 }
 
 // Tells how many of the entry's names the table changes; -1 when one of them is there twice.
-static int countChanges(renameWalk* walk, const historyEntry* entry, int position)
+static int countChanges(renameWalk* walk, const historyEntry* entry)
 {
     int changes = 0;
+    walk->numLists++;
     for (uint32_t i = 0; i < entry->numTablespaces; i++) {
         int effect = findName(walk->effects, walk->buckets, entry->tablespaceNames[i]);
         if (effect < 0)
             continue;
-        if (walk->effects[effect].seenIn == position)
+        if (walk->effects[effect].seenIn == walk->numLists)
             return -1;
-        walk->effects[effect].seenIn = position;
+        walk->effects[effect].seenIn = walk->numLists;
         changes++;
     }
     return changes;
 }
 
-static void renameInEntry(renameWalk* walk, historyEntry* entry, int position)
+// Makes the changes that were counted in the entry's list, which no other entry has.
+static void makeChanges(renameWalk* walk, historyEntry* entry, int changes)
 {
-    int changes = walk->oneByOne ? -1 : countChanges(walk, entry, position);
     if (changes < 0) {
         for (int i = walk->numRenames - 1; i >= 0; i--)
             applyRename(entry, walk->renames[i].name, walk->renames[i].newName);
@@ -275,83 +272,74 @@ static void renameInEntry(renameWalk* walk, historyEntry* entry, int position)
     }
 }
 
-// What the last entry listed before the renames, and the entry as they left it. Most entries list
-// what their neighbour lists, and the same renames make the same of it: a comparison then stands
-// for the look-up of every name.
-struct lastNames {
-    char (*before)[nameSize];  // room for the names of any entry
-    const historyEntry* after; // null: nothing to compare with
-};
-
-static void renameLikeLast(renameWalk* walk, lastNames* last, historyEntry* entry, int position)
+// The same renames make the same of a list, whichever entry has it: only the first entry looks up
+// its names. Entries before the next older rename may have the list, too, so it is left alone.
+static int renameInEntry(renameWalk* walk, historyEntry* entry)
 {
-    size_t size = sizeof *entry->tablespaceNames * entry->numTablespaces;
-    if (size == 0)
-        return;
-    if (last->after != nullptr && last->after->numTablespaces == entry->numTablespaces &&
-        memcmp(last->before, entry->tablespaceNames, size) == 0) {
-        memcpy(entry->tablespaceNames, last->after->tablespaceNames, size);
-    } else {
-        memcpy(last->before, entry->tablespaceNames, size);
-        renameInEntry(walk, entry, position);
-        last->after = entry;
+    nameList* list = namesOf(entry);
+    if (list == nullptr)
+        return 0;
+    if (list->renamedBy == walk->numRenames) {
+        giveNames(entry, list->renamed);
+        return 0;
     }
+    int changes = walk->oneByOne ? -1 : countChanges(walk, entry);
+    nameList* renamed = changes == 0 || list->uses == 1
+                            ? list
+                            : makeNameList(entry->tablespaceNames, entry->numTablespaces);
+    if (renamed == nullptr)
+        return failStage(msgNoMemoryNames);
+    list->renamedBy = walk->numRenames;
+    list->renamed = renamed;
+    giveNames(entry, renamed);
+    makeChanges(walk, entry, changes);
+    return 0;
 }
 
-// Counts the renames before the target, and the names of the longest entry.
-static size_t countRenames(const historyData* data, size_t* mostNames)
+// Counts the renames before the target.
+static size_t countRenames(const historyData* data)
 {
     size_t numRenames = 0;
-    *mostNames = 0;
-    for (int i = 0; i < data->backupIndex; i++) {
-        const historyEntry* entry = &data->entries[i];
-        if (i >= data->renameIndex && isRename(entry))
-            numRenames++;
-        if (entry->numTablespaces > *mostNames)
-            *mostNames = entry->numTablespaces;
-    }
+    for (int i = data->renameIndex; i >= 0 && i < data->backupIndex; i++)
+        numRenames += isRename(&data->entries[i]);
     return numRenames;
 }
 
-// Allocates a walk for so many renames, in one block that starts with walk->renames and has room
-// for so many names at its end. False: no memory.
-static bool initWalk(renameWalk* walk, size_t numRenames, size_t mostNames, lastNames* last)
+// Allocates a walk for so many renames, in one block that starts with walk->renames. False: no
+// memory.
+static bool initWalk(renameWalk* walk, size_t numRenames)
 {
     *walk = {};
-    *last = {};
-    size_t changes = 3 * numRenames;
-    size_t records = changes + mostNames * nameSize / sizeof(nameChange) + 1;
     if (numRenames > INT_MAX / 2)
         return false;
-    walk->renames = static_cast<nameChange*>(calloc(records, sizeof(nameChange)));
+    walk->renames = static_cast<nameChange*>(calloc(3 * numRenames, sizeof(nameChange)));
     if (walk->renames == nullptr)
         return false;
     walk->effects = walk->renames + numRenames;
     walk->buckets = 2 * numRenames;
-    last->before = reinterpret_cast<char(*)[nameSize]>(walk->renames + changes);
     return true;
 }
 
 int updateHistoryEntriesforRename(historyData* data)
 {
-    size_t mostNames = 0;
-    size_t numRenames = data->renameIndex < 0 ? 0 : countRenames(data, &mostNames);
+    size_t numRenames = countRenames(data);
     if (numRenames == 0)
         return 0;
 
     renameWalk walk;
-    lastNames last;
-    if (!initWalk(&walk, numRenames, mostNames, &last))
-        return reportError(msgNoMemoryImages);
-    for (int i = data->backupIndex - 1; i >= 0; i--) {
+    if (!initWalk(&walk, numRenames))
+        return failStage(msgNoMemoryImages);
+    for (int i = 0; i < data->backupIndex; i++)
+        if (data->entries[i].tablespaceNames != nullptr)
+            namesOf(&data->entries[i])->renamedBy = 0;
+    int rc = 0;
+    for (int i = data->backupIndex - 1; i >= 0 && rc == 0; i--) {
         historyEntry* entry = &data->entries[i];
-        if (i >= data->renameIndex && isRename(entry)) {
+        if (i >= data->renameIndex && isRename(entry))
             addRename(&walk, entry);
-            last.after = nullptr;
-        }
         if (walk.numRenames > 0)
-            renameLikeLast(&walk, &last, entry, i);
+            rc = renameInEntry(&walk, entry);
     }
     free(walk.renames);
-    return 0;
+    return rc;
 }

@@ -13,7 +13,7 @@ int listBackupImages(restorePlan* plan)
     plan->images = static_cast<backupImage*>(
         calloc(static_cast<size_t>(plan->numBackups), sizeof(backupImage)));
     if (plan->images == nullptr)
-        return reportError(msgNoMemoryImages);
+        return failStage(msgNoMemoryImages);
 
     backupImage* image = plan->images;
     for (int i = 0; i <= plan->histData.backupIndex; i++) {
@@ -34,10 +34,10 @@ int allocateTimelineMatrix(restorePlan* plan)
     if (columns == 0)
         return 0;
     if (rows > SIZE_MAX / columns)
-        return reportError(msgNoMemoryMatrix);
+        return failStage(msgNoMemoryMatrix);
     plan->matrix = static_cast<char*>(malloc(rows * columns));
     if (plan->matrix == nullptr)
-        return reportError(msgNoMemoryMatrix);
+        return failStage(msgNoMemoryMatrix);
     memset(plan->matrix, cellUnused, rows * columns);
     return 0;
 }
@@ -96,8 +96,10 @@ static bool visitEntry(tablespaceInfo* tablespace, historyEntry* entry, char let
 struct timelineWalk {
     int position;
     historyEntry* entry;
-    char* rowCells; // of the backup image met last
-    char letter;    // its kind
+    char* rowCells;  // of the backup image met last
+    char letter;     // its kind
+    int incomplete;  // columns on which older entries can act
+    int firstFailed; // column; -1: none
 };
 
 // Goes on to the next older entry that can act on a tablespace. False: there is none.
@@ -120,26 +122,46 @@ static bool stepBack(timelineWalk* walk, const historyData* data, int numTablesp
     return false;
 }
 
-// The column of a name, or -1. Most images list the same names in the same order, so the column
-// after the last one found is tried first.
-static int findColumn(const tablespaceInfo* list, int numTablespaces, int lastColumn,
-                      const char* name)
+// The column of a name, or -1. Most images list the same names in the same order, so *guess, the
+// column after the one for the name before, is tried first.
+static int findColumn(const tablespaceInfo* list, int numTablespaces, int* guess, const char* name)
 {
-    int guess = lastColumn + 1 < numTablespaces ? lastColumn + 1 : 0;
-    if (memcmp(list[guess].name, name, nameSize) == 0)
-        return guess;
-    return findName(list, static_cast<size_t>(numTablespaces), name);
+    int column = *guess;
+    if (memcmp(list[column].name, name, nameSize) != 0)
+        column = findName(list, static_cast<size_t>(numTablespaces), name);
+    int next = (column < 0 ? *guess : column) + 1;
+    *guess = next < numTablespaces ? next : 0;
+    return column;
+}
+
+// Lets the entry act on the columns that it lists. Returns whether older ones can act on any.
+static bool visitColumns(timelineWalk* walk, tablespaceInfo* list, int numTablespaces)
+{
+    bool someIncomplete = false;
+    int guess = 0;
+    for (uint32_t i = 0; i < walk->entry->numTablespaces; i++) {
+        int column = findColumn(list, numTablespaces, &guess, walk->entry->tablespaceNames[i]);
+        if (column < 0 || isComplete(&list[column]))
+            continue;
+        if (!visitEntry(&list[column], walk->entry, walk->letter, walk->rowCells) &&
+            (walk->firstFailed < 0 || column < walk->firstFailed))
+            walk->firstFailed = column;
+        if (isComplete(&list[column]))
+            walk->incomplete--;
+        else
+            someIncomplete = true;
+    }
+    return someIncomplete;
 }
 
 static void startColumns(tablespaceInfo* list, int numTablespaces)
 {
     size_t columns = static_cast<size_t>(numTablespaces);
-    clearNames(list, columns);
+    enterNames(list, columns, columns);
     for (size_t i = 0; i < columns; i++) {
         list[i].tracking = 1;
         list[i].restoredImage = nullptr;
         list[i].lastImageType = cellUnused;
-        enterName(list, columns, i);
     }
 }
 
@@ -151,31 +173,21 @@ int fillColumns(char* matrix, historyData* data, tablespaceInfo* list, int numTa
 
     startColumns(list, numTablespaces);
     char* end = matrix + static_cast<size_t>(numBackups) * static_cast<size_t>(numTablespaces);
-    timelineWalk walk = {data->backupIndex + 1, nullptr, end, cellUnused};
-    int firstFailed = -1;
-    int incomplete = numTablespaces;
-    while (incomplete > 0 && stepBack(&walk, data, numTablespaces)) {
-        int column = -1;
-        for (uint32_t i = 0; i < walk.entry->numTablespaces; i++) {
-            column = findColumn(list, numTablespaces, column, walk.entry->tablespaceNames[i]);
-            if (column < 0 || isComplete(&list[column]))
-                continue;
-            if (!visitEntry(&list[column], walk.entry, walk.letter, walk.rowCells)) {
-                if (firstFailed < 0 || column < firstFailed)
-                    firstFailed = column;
-            } else if (isComplete(&list[column])) {
-                incomplete--;
-            }
-        }
+    timelineWalk walk = {data->backupIndex + 1, nullptr, end, cellUnused, numTablespaces, -1};
+    const nameList* settled = nullptr; // its names are of no column, or of complete ones
+    while (walk.incomplete > 0 && stepBack(&walk, data, numTablespaces)) {
+        const nameList* names = namesOf(walk.entry);
+        if (names != nullptr && names != settled && !visitColumns(&walk, list, numTablespaces))
+            settled = names;
     }
-    return firstFailed;
+    return walk.firstFailed;
 }
 
 int fillTimelineMatrix(char* matrix, historyData* data, tablespaceInfo* list, int numTablespaces,
                        int numBackups)
 {
     int failed = fillColumns(matrix, data, list, numTablespaces, numBackups);
-    return failed < 0 ? 0 : reportError(msgMissingImage, list[failed].name);
+    return failed < 0 ? 0 : failStage(msgMissingImage, list[failed].name);
 }
 
 // --- The scan pass -------------------------------------------------------------------------------
@@ -261,7 +273,7 @@ int scanAndUpdateTimelineMatrix(char* matrix, tablespaceInfo* list, int numTable
                                 int numBackups)
 {
     int failed = scanColumns(matrix, numTablespaces, numBackups);
-    return failed < 0 ? 0 : reportError(msgMissingFullImage, list[failed].name);
+    return failed < 0 ? 0 : failStage(msgMissingFullImage, list[failed].name);
 }
 
 // --- The verbose listing -------------------------------------------------------------------------

@@ -1,7 +1,8 @@
 // The restore planner: its records, its messages, and the stages of a run in the order they run.
 //
-// A stage returns 0 or one of the negative codes below, and has reported its failure on standard
-// error when it returns. All memory of a run hangs on one restorePlan and is released by freePlan.
+// A stage returns 0 or one of the negative codes below; what there is to say of a failure it leaves
+// in lastFailure, for the program to say in its own way. All memory of a run hangs on one
+// restorePlan and is released by freePlan.
 #pragma once
 
 #include <cstddef>
@@ -25,9 +26,9 @@ enum : int {
     tablespaceImageRefused = -13,
 };
 
-// One message of the error report. The site number is part of the text that support asks for.
+// One message of a failure. The site number is part of the text that support asks for.
 struct planMessage {
-    const char* text; // at most one %s
+    const char* text; // at most one %s; of a scan call: its short name
     int code;
     unsigned int site;
 };
@@ -61,20 +62,21 @@ inline constexpr planMessage
     msgNoMemoryEntries = {"Memory allocation", outOfMemory, 1196},
     msgNoMemoryNames = {"Memory allocation", outOfMemory, 1224};
 
-// The scan calls' messages: text is the short name of the call.
 inline constexpr planMessage msgOpenScan = {"OpenScan", scanOpenFailed, 1064},
                              msgGetEntry = {"GetEntry", scanGetFailed, 1159},
                              msgCloseScan = {"CloseScan", scanCloseFailed, 1303};
 
-extern const char errorString[]; // the prefix of every error report
+// What a failed stage has to say.
+struct planFailure {
+    const planMessage* message;
+    const char* argument; // what %s stands for: a text of the plan's, or what the caller passed in
+    int sqlcode;          // of a scan call; 0: it failed without one
+};
+extern planFailure lastFailure;
 
-// Writes the error report on standard error and returns the message's code. argument: what %s
-// stands for.
-int reportError(const planMessage& message, const char* argument = "");
-
-// Reports a failed scan call and returns the message's code. A call that failed without an SQLCODE
-// has nothing to report.
-int reportScanError(const planMessage& message, int sqlcode);
+// Set lastFailure and return the message's code.
+int failStage(const planMessage& message, const char* argument = "");
+int failScan(const planMessage& message, int sqlcode);
 
 // --- Records -------------------------------------------------------------------------------------
 
@@ -82,6 +84,15 @@ enum : size_t {
     timestampLength = 14,
     aliasLength = 8,
     nameSize = zq3TablespaceNameCapacity, // a name's slot: the name, then zeros to the end
+};
+
+// The names of an entry. Most entries of a history list the same tablespaces, and share a list;
+// whoever wants other names in an entry gives it another list.
+struct nameList {
+    uint32_t uses; // entries that have the list; the last one to let go frees it
+    uint32_t count;
+    int renamedBy;     // of the pass under way: the renames that were applied last
+    nameList* renamed; // what they made of it: another list, or this one
 };
 
 // One kept entry of the history.
@@ -93,7 +104,7 @@ struct historyEntry {
     char object;                        // zq3Object...
     char operationType;                 // of a backup: full, incremental or delta
     uint32_t numTablespaces;
-    char (*tablespaceNames)[nameSize]; // numTablespaces slots, the entry's; null when it has none
+    char (*tablespaceNames)[nameSize]; // numTablespaces slots, after a nameList; null: none
 };
 
 // The kept entries, in ascending order of their timestamps after a successful fetch.
@@ -152,14 +163,40 @@ void freePlan(restorePlan* plan);
 // Stands in an entry for a name that another tablespace took; a slot like any other.
 extern const char DELETED_RENAMED[nameSize];
 
-// --- Fetching the history (fetch.cpp) ------------------------------------------------------------
+// --- Lists of names (names.cpp) ------------------------------------------------------------------
 
-// Reads the history of the database into *data: the entries that matter, sorted, with the target
-// image located. timestamp: of the target, 14 characters. *numBackups is 0 before and the number of
-// backup images up to and with the target afterwards; data->backupIndex and renameIndex are -1
-// before. Returns 0, scanOpenFailed, scanGetFailed, scanCloseFailed, outOfMemory or imageNotFound;
-// the entries read so far stay in *data after a failure, too. Without a timestamp (null) no target
-// is looked for: the entries are read and sorted.
+// Makes a list of names that no entry has yet. names: count slots with zeros after the names.
+// Returns null when there is no memory.
+nameList* makeNameList(const char (*names)[nameSize], uint32_t count);
+
+// Gives the entry a list, and lets go of the one that it had; list null: of none. Its number of
+// names is left alone.
+void giveNames(historyEntry* entry, nameList* list);
+
+// The entry's list; null when it has none.
+nameList* namesOf(const historyEntry* entry);
+
+// --- Fetching the history (fetch.cpp, scan.cpp) --------------------------------------------------
+
+// Where entries come from: calls like those of the scan interface (zq3.h), with the same results
+// and SQLCODEs. context is theirs.
+struct historySource {
+    void* context;
+    int (*openScan)(void* context, zq3HistoryOpenStruct* open, sqlca* ca);
+    int (*getEntry)(void* context, zq3HistoryFetchStruct* fetch, sqlca* ca);
+    int (*closeScan)(void* context, uint16_t* handle, sqlca* ca);
+};
+
+// Reads a history into *data: the entries that matter, sorted, with the target image located.
+// timestamp: of the target, 14 characters. *numBackups is 0 before and the number of backup images
+// up to and with the target afterwards; data->backupIndex and renameIndex are -1 before. Returns 0,
+// scanOpenFailed, scanGetFailed, scanCloseFailed, outOfMemory or imageNotFound; the entries read so
+// far stay in *data after a failure, too. Without a timestamp (null) no target is looked for: the
+// entries are read and sorted.
+int fetchFromSource(const historySource* source, const char* timestamp, historyData* data,
+                    int* numBackups);
+
+// The same with the scan interface's entries of a database.
 int fetchHistoryEntries(char* alias, char* timestamp, historyData* data, int* numBackups);
 
 // qsort's comparator of historyEntry records: by timestamp, then in the order of the scan.
@@ -194,15 +231,18 @@ void addTablespacesFromHistEntryToList(tablespaceInfo* list, historyEntry* entry
 // outOfMemory.
 int listTargetTablespaces(restorePlan* plan);
 
-// Makes the list of those of the given names that the target image holds, and warns of the others.
-// The names are upper-cased in place. Returns 0, outOfMemory, or argumentMissing when none is left.
+// Makes the list of those of the given names that the target image holds. The names are upper-cased
+// in place. Returns 0, outOfMemory, or argumentMissing when none is left.
 int listNamedTablespaces(restorePlan* plan, char** names, int numNames);
+
+// Tells, right after that, whether one of the names got into the list.
+bool isNameListed(const restorePlan* plan, const char* name);
 
 // Tells whether the first rename is young enough to concern a backup image of the plan.
 bool isRenamePassDue(restorePlan* plan);
 
 // Gives the tablespaces in all entries before the target the names that they have at the target.
-// Returns 0, or outOfMemory with the entries as they were.
+// Returns 0, or outOfMemory with some entries as they were.
 int updateHistoryEntriesforRename(historyData* data);
 
 // --- Timeline (timeline.cpp) ---------------------------------------------------------------------
@@ -224,7 +264,7 @@ int fillTimelineMatrix(char* matrix, historyData* data, tablespaceInfo* list, in
 int scanAndUpdateTimelineMatrix(char* matrix, tablespaceInfo* list, int numTablespaces,
                                 int numBackups);
 
-// The same two passes without a report: each returns the first column that fails, or -1. After the
+// The same two passes by column: each returns the first column that fails, or -1. After the
 // fill, a column that waits in vain has tracking 0, the timestamp of the missing image in
 // restoredImage, and a lastImageType other than
 // chainComplete.
