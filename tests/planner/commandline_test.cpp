@@ -166,14 +166,15 @@ TEST(Fetch, TargetsThatDoNotCount)
 TEST(Fetch, EachAllocationFailingInTurn)
 {
 #define NO_MEMORY ERROR "Memory allocation\nReturn code of -6 seen at line "
-    std::string history = "BDFA 20240101000000 OLD\nNT_A 20240102000000 OLD NEW\n";
-    for (int i = 0; i < 510; i++)
+    std::string history = "BDFA 20240101000000 OLD\nOD_A 20240101000000 OLD\n"
+                          "NT_A 20240102000000 OLD NEW\n";
+    for (int i = 0; i < 509; i++)
         history += "OD_A 20240103000000\n";
     history += "BDIA 20240104000000 NEW\n";
     const char* const sites[] = {
-        "1096", "1111", "1121", "1196", "1224", "1224", // buffers of the scan; entries, two's names
-        "1196", "1224", "627", "627",                   // the 513th entry; images; table of renames
-        "286", "782", "892", "",                        // list; matrix; selected
+        "1096", "1111", "1121", "1196", "1224", "1224", // buffers of the scan; entries, two lists
+        "1196", "1224", "627", "627", "1224",           // the 513th entry; images; renames, a list
+        "286", "782", "892", "",                        // tablespaces; matrix; selected
     };
     std::string begun = SUGGESTED TS("NEW", "04"), plan = begun + DB("01") DB("04") RULE "\n";
     int request = 0;
