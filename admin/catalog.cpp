@@ -4,42 +4,126 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
-#include <unistd.h>
 
 #include "zq3.h"
 
 // --- Reading -------------------------------------------------------------------------------------
 
-#define CATALOG_ALIAS "HISTORY"
+// A read of the history, which the planner takes its entries from; on the way past what the catalog
+// wants of each is noted.
+struct catalogRead {
+    imageCatalog* catalog;
+    SQLUH_COMMITTED* history;
+    uint32_t nextRow;
+    uint32_t* lastNumbers; // of the entries, by their node
+};
 
-// The planner knows histories by alias, in the folder of databases: it is shown a folder that has
-// this one history under a plain name.
-static int fetchThroughFolder(const historyPlace* place, historyData* history)
+static int openRead(void* context, zq3HistoryOpenStruct* open, sqlca*)
 {
-    char folder[pathCapacity];
-    char link[sizeof folder + sizeof "/" CATALOG_ALIAS];
-    const char* temporary = getenv("TMPDIR");
-    char alias[] = CATALOG_ALIAS;
+    catalogRead* read = static_cast<catalogRead*>(context);
+    open->numRows = read->history->numRows;
+    open->maxTablespaces = read->history->maxTablespaces;
+    return 0;
+}
+
+static bool isInactive(char status)
+{
+    return status == zq3StatusInactive || status == zq3StatusInactiveLower;
+}
+
+static bool isActive(char status)
+{
+    return status == zq3StatusActive || status == zq3StatusActiveLower || isInactive(status);
+}
+
+static void noteGap(catalogRead* read, const zq3HistoryData* record)
+{
+    imageCatalog* catalog = read->catalog;
+    uint32_t* last = &read->lastNumbers[record->entryNode];
+    if (*last != 0 && record->entryNumber > *last + 1)
+        catalog->gaps[catalog->numGaps++] = {*last + 1, record->entryNumber - 1};
+    *last = record->entryNumber;
+}
+
+// Notes a backup image that the planner passes over because it failed or was given up.
+static void noteUnused(imageCatalog* catalog, const zq3HistoryData* record)
+{
+    const char* objectPart = record->objectPart.data;
+    if (record->operation != zq3OperationBackup ||
+        strlen(objectPart) != zq3ObjectPartCapacity - 1 ||
+        strcmp(objectPart + timestampLength, "001") != 0 ||
+        (record->eventSqlca->sqlcode >= 0 && isActive(record->status)))
+        return;
+    unusedImage* unused = &catalog->unused[catalog->numUnused++];
+    *unused = {};
+    unused->sqlcode = record->eventSqlca->sqlcode;
+    unused->status = record->status;
+    unused->image.index = static_cast<uint32_t>(catalog->history.numEntries);
+    memcpy(unused->image.timestamp, objectPart, timestampLength);
+    unused->image.object = record->object;
+    unused->image.operationType = record->operationType;
+    unused->image.numTablespaces = record->numTablespaces;
+}
+
+static int getRow(void* context, zq3HistoryFetchStruct* fetch, sqlca* ca)
+{
+    catalogRead* read = static_cast<catalogRead*>(context);
+    imageCatalog* catalog = read->catalog;
+    const zq3HistoryData* record = fetch->historyRecord;
+    SQLUH_ENTRY entry = {};
+    entry.data = fetch->historyRecord;
+    ca->sqlcode = sqluhGetCommitted(read->history, read->nextRow++, &entry, false);
+    if (ca->sqlcode < 0)
+        return ca->sqlcode;
+    noteGap(read, record);
+    noteUnused(catalog, record);
+    // The next entry that is kept has this index, and those passed over before it are noted here.
+    catalog->facts[catalog->history.numEntries] = {catalog->numGaps, isInactive(record->status)};
+    return 0;
+}
+
+static int closeRead(void*, uint16_t*, sqlca*)
+{
+    return 0;
+}
+
+static bool allocateFacts(catalogRead* read)
+{
+    imageCatalog* catalog = read->catalog;
+    size_t count = static_cast<size_t>(read->history->numRows) + 1;
+    catalog->facts = static_cast<entryFacts*>(reallocarray(nullptr, count, sizeof(entryFacts)));
+    catalog->gaps = static_cast<numberGap*>(reallocarray(nullptr, count, sizeof(numberGap)));
+    catalog->unused = static_cast<unusedImage*>(reallocarray(nullptr, count, sizeof(unusedImage)));
+    read->lastNumbers = static_cast<uint32_t*>(calloc(UINT16_MAX + 1, sizeof(uint32_t)));
+    return catalog->facts != nullptr && catalog->gaps != nullptr && catalog->unused != nullptr &&
+           read->lastNumbers != nullptr;
+}
+
+static int orderOfUnused(const void* first, const void* second)
+{
+    return sortHistoryEntries(&static_cast<const unusedImage*>(first)->image,
+                              &static_cast<const unusedImage*>(second)->image);
+}
+
+// Reads the entries that matter, and notes what the planner does not keep.
+static int readEntries(const historyPlace* place, imageCatalog* catalog)
+{
+    catalogRead read = {catalog, nullptr, 0, nullptr};
+    const historySource source = {&read, openRead, getRow, closeRead};
     int numBackups = 0;
-    snprintf(folder, sizeof folder, "%s/zq3histXXXXXX",
-             temporary != nullptr && temporary[0] != '\0' ? temporary : "/tmp");
-    char* path = realpath(place->directory, nullptr);
-    if (path == nullptr || mkdtemp(folder) == nullptr) {
-        int failed = errno;
-        free(path);
-        return failWithCode(sqloSystemError | failed, "read the history", place->directory);
-    }
-    snprintf(link, sizeof link, "%s/" CATALOG_ALIAS, folder);
-    int rc = symlink(path, link) == 0 && setenv("ZQ3DBPATH", folder, 1) == 0
-                 ? 0
-                 : failWithCode(sqloSystemError | errno, "read the history", place->directory);
-    if (rc == 0 && fetchHistoryEntries(alias, nullptr, history, &numBackups) != 0) {
-        rc = fail(place->directory, "cannot read the history");
-        hint(place, "zq3hist verify DIR  # may tell more");
-    }
-    unlink(link);
-    rmdir(folder);
-    free(path);
+    int rc = readCommitted(place, &read.history);
+    if (rc == 0 && read.history->failure != 0)
+        rc = failDamaged(place, read.history, "read the history");
+    if (rc == 0)
+        catalog->numEntries = read.history->numRows;
+    if (rc == 0 && (!allocateFacts(&read) ||
+                    fetchFromSource(&source, nullptr, &catalog->history, &numBackups) != 0))
+        rc = failWithCode(sqloSystemError | ENOMEM, "read the history", place->directory);
+    if (rc == 0)
+        qsort(catalog->unused, static_cast<size_t>(catalog->numUnused), sizeof(unusedImage),
+              orderOfUnused);
+    free(read.lastNumbers);
+    sqluhFreeCommitted(&read.history);
     return rc;
 }
 
@@ -96,16 +180,13 @@ static int readOnHand(imageCatalog* catalog, const char* name)
     return rc;
 }
 
-int readCatalog(historyPlace* place, const char* have, imageCatalog* catalog)
+int readCatalog(const historyPlace* place, const char* have, imageCatalog* catalog)
 {
     *catalog = {};
     catalog->history.backupIndex = catalog->history.renameIndex = -1;
     int rc = have != nullptr ? readOnHand(catalog, have) : 0;
     if (rc == 0)
-        rc = awaitLock(place, R_OK);
-    if (rc == 0)
-        rc = fetchThroughFolder(place, &catalog->history);
-    releaseSignals();
+        rc = readEntries(place, catalog);
     const historyEntry *image = nullptr, *rename = nullptr;
     for (int i = catalog->history.numEntries - 1; i >= 0; i--) {
         const historyEntry* entry = &catalog->history.entries[i];
@@ -205,14 +286,6 @@ static void countPlan(const imageCatalog* catalog, imagePlan* plan)
         plan->numIncomplete += lackOfColumn(catalog, plan, column, &image) != planLacksNothing;
 }
 
-// Says what a stage has to say.
-static int failPlanning(const char* timestamp)
-{
-    return lastFailure.message->code == outOfMemory
-               ? failWithCode(sqloSystemError | ENOMEM, "plan the restore", timestamp)
-               : fail(timestamp, "the image holds none of the tablespaces");
-}
-
 int planImage(imageCatalog* catalog, int target, char** names, int numNames, imagePlan* plan)
 {
     *plan = {};
@@ -234,7 +307,8 @@ int planImage(imageCatalog* catalog, int target, char** names, int numNames, ima
     if (rc == 0)
         rc = allocateTimelineMatrix(stages);
     if (rc != 0)
-        return failPlanning(history->entries[target].timestamp);
+        return failWithCode(sqloSystemError | ENOMEM, "plan the restore",
+                            history->entries[target].timestamp);
     fillColumns(stages->matrix, history, stages->list, stages->numTablespaces, stages->numBackups);
     scanColumns(stages->matrix, stages->numTablespaces, stages->numBackups);
     countPlan(catalog, plan);

@@ -7,7 +7,8 @@
 
 // What the history holds of a kept entry beside what the planner keeps of it.
 struct entryFacts {
-    int numGaps; // in the entry numbers before it
+    int numGaps; // in the entry numbers up to it
+    bool inactive;
 };
 
 // Entry numbers that no entry has, between those of two that follow each other.
@@ -38,7 +39,7 @@ struct imageCatalog {
 // Reads the history and, unless have is null, the list of the images on hand ("-": from standard
 // input). Complains on failure and returns an exit status, else 0. freeCatalog accepts what a
 // failed call left.
-int readCatalog(historyPlace* place, const char* have, imageCatalog* catalog);
+int readCatalog(const historyPlace* place, const char* have, imageCatalog* catalog);
 void freeCatalog(imageCatalog* catalog);
 
 bool isImage(const historyEntry* entry);

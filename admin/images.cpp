@@ -124,6 +124,8 @@ static void showRow(const imageList* list, const imageRow* row)
                    row->gap->last);
         else
             fputs("complete", stdout);
+        if (list->line->all && list->catalog.facts[image->index].inactive)
+            fputs(", inactive", stdout);
     }
     putchar('\n');
 }
@@ -149,6 +151,7 @@ static void showJsonRow(imageList* list, const imageRow* row)
         }
         endJson(json, ']');
         putJsonGap(json, row->gap);
+        putJsonBool(json, "inactive", list->catalog.facts[row->image->index].inactive);
     }
     endJson(json, '}');
 }

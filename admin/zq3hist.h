@@ -170,6 +170,17 @@ int closeHistory(const historyPlace* place, SQLUH_HANDLE** handle, const char* w
 // and returns exitFailed, else 0.
 int createIfMissing(historyPlace* place);
 
+// --- Looking (committed.cpp) ---------------------------------------------------------------------
+
+// Reads the committed history, which changes nothing and waits for nobody, and says on standard
+// error what whoever goes on with the history should know: that it is the shadow's, that a batch is
+// unfinished, that a dead owner's lock is in the way. Complains and returns an exit status, else 0
+// with what sqluhFreeCommitted releases.
+int readCommitted(const historyPlace* place, SQLUH_COMMITTED** committed);
+
+// Says what ended early what was read, and returns an exit status. what: the job that fails.
+int failDamaged(const historyPlace* place, const SQLUH_COMMITTED* committed, const char* what);
+
 // --- The two files (files.cpp) -------------------------------------------------------------------
 
 // What one of the two files shows from outside.
