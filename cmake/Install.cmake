@@ -39,7 +39,7 @@ install(FILES ${PROJECT_BINARY_DIR}/sqluhistConfig.cmake
 install(FILES ${PROJECT_BINARY_DIR}/libsqluhist.pc DESTINATION ${pkgconfigDir})
 
 install(FILES man/zq3ckrst.1 man/zq3hist.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
-install(FILES man/zq3rhist.5 DESTINATION ${CMAKE_INSTALL_MANDIR}/man5)
+install(FILES man/zq3rhist.5 man/zq3hist-json.5 DESTINATION ${CMAKE_INSTALL_MANDIR}/man5)
 install(FILES README.md CONTRIBUTING.md DESTINATION ${CMAKE_INSTALL_DOCDIR})
 install(DIRECTORY docs examples DESTINATION ${CMAKE_INSTALL_DOCDIR})
 foreach(program zq3ckrst zq3hist)

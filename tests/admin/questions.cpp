@@ -3,6 +3,7 @@
 #include <random>
 
 #include "tests/admin/program.h"
+#include "tests/admin/schema.h"
 
 using nlohmann::json;
 
@@ -83,4 +84,184 @@ TEST_F(QuestionTest, TheListOfImagesSaysWhatThePlansSay)
     }
     EXPECT_GT(complete, 100);
     EXPECT_GT(incomplete, 100);
+}
+
+// Two tablespaces over ten days: a chain of every kind, an image of one tablespace alone, a failed
+// one, one that was pruned, a restore of a lost image, and a full image of A only.
+static std::string tenDays()
+{
+    const auto image = [](int day, const std::string& rest, const std::vector<std::string>& names) {
+        return stanza("backup", 20250100010000 + day * 1000000, rest, names);
+    };
+    return image(1, "Type: full\n", {"A", "B"}) + image(2, "Type: delta\n", {"A", "B"}) +
+           image(3, "Type: incremental\nNumber: 3\n", {"A", "B"}) +
+           image(4, "Object: tablespace\nStatus: inactive\n", {"B"}) +
+           image(5, "Type: delta\nNumber: 7\n", {"A", "B"}) +
+           image(6, "Type: delta\nSQLCODE: -5\nNumber: 8\n", {"A", "B"}) +
+           stanza("restore", 20250107010000, "Id: 20241201010000\nNumber: 9\n", {"B"}) +
+           image(8, "Type: delta\nNumber: 10\n", {"A", "B"}) +
+           image(9, "Type: full\nNumber: 11\n", {"A"});
+}
+
+TEST_F(QuestionTest, AnswersInFull)
+{
+    const struct {
+        const char* arguments;
+        const char* output;
+    } rows[] = {
+        {"images --all h/",
+         "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
+         "20250101010000  full         database              2       1  complete\n"
+         "20250102010000  delta        database              2       2  complete\n"
+         "20250103010000  incremental  database              2       2  complete\n"
+         "20250104010000  full         tablespace            1       1  complete, inactive\n"
+         "20250105010000  delta        database              2       4  chain found; the history "
+         "lacks entries 5 to 6\n"
+         "20250106010000  delta        database              2       -  failed: SQLCODE -5\n"
+         "20250108010000  delta        database              2       4  incomplete: B lacks the "
+         "image 20241201010000\n"
+         "20250109010000  full         database              1       1  complete\n"
+         "7 images, 8 shown, 1 incomplete; newest that can be restored: 20250109010000\n"
+         "[0]"},
+        {"images --since '2025-01-05T01:00:00' --incomplete h/",
+         "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
+         "20250108010000  delta        database              2       4  incomplete: B lacks the "
+         "image 20241201010000\n"
+         "7 images, 1 shown, 1 incomplete; newest that can be restored: 20250109010000\n"
+         "[0]"},
+        {"images e/", "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
+                      "0 images, 0 incomplete\n"
+                      "[0]"},
+        {"images --have have --last 3 h/",
+         "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
+         "20250105010000  delta        database              2       4  incomplete: all 2 lack the "
+         "image 20250105010000\n"
+         "20250108010000  delta        database              2       4  incomplete: all 2 lack the "
+         "image 20250108010000\n"
+         "20250109010000  full         database              1       1  complete\n"
+         "7 images, 3 shown, 4 incomplete; newest that can be restored: 20250109010000\n"
+         "[0]"},
+        {"plan h/ '2025-01-05 01:00:00'",
+         "1/4  full         20250101010000  A  for 20250103010000\n"
+         "2/4  incremental  20250103010000  A  for 20250105010000\n"
+         "3/4  full         20250104010000  B  for 20250105010000\n"
+         "4/4  delta        20250105010000  all 2  target\n"
+         "zq3hist: warning: a chain was found, but the history lacks entries 5 to 6, and an image "
+         "may have been among them\n"
+         "[0]"},
+        {"plan h/ latest b",
+         "zq3hist: tablespace B lacks the image 20241201010000 that was restored, 20250108010000\n"
+         "zq3hist: hint: zq3hist plan h/ 20250105010000  # the newest image that can be restored\n"
+         "[6]"},
+        {"plan --before 20250107000000 -- h/ A",
+         "1/3  full         20250101010000  A  for 20250103010000\n"
+         "2/3  incremental  20250103010000  A  for 20250105010000\n"
+         "3/3  delta        20250105010000  A  target\n"
+         "zq3hist: warning: a chain was found, but the history lacks entries 5 to 6, and an image "
+         "may have been among them\n"
+         "[0]"},
+        {"plan --before 20250104020000 h/",
+         "1/1  full         20250104010000  B  target\n"
+         "zq3hist: note: 20250104010000 is an image of single tablespaces; the newest one of the "
+         "whole database before it is 20250103010000\n"
+         "[0]"},
+        {"plan h/ --before 20241231000000", "zq3hist: no image is there up to 20241231000000, h/\n"
+                                            "zq3hist: hint: zq3hist images h/  # lists all\n"
+                                            "[5]"},
+        {"plan --have have h/ 20250105010000 a",
+         "zq3hist: tablespace A lacks the image 20250105010000, which is not on hand, "
+         "20250105010000\n"
+         "zq3hist: hint: zq3hist plan h/ 20250109010000  # the newest image that can be restored\n"
+         "[6]"},
+        {"plan h/ 20250109010000 A C",
+         "zq3hist: the image does not hold the tablespace C, 20250109010000\n"
+         "[5]"},
+        {"plan h/ 2025-13", "zq3hist: plan takes a timestamp such as 20250111010000 or '2025-01-11 "
+                            "01:00:00', not 2025-13\n"
+                            "Try 'zq3hist --help'.\n"
+                            "[2]"},
+        {"chart h/", "What the newest state needs\n"
+                     "\n"
+                     "   2025-01-01  01-05 01-09\n"
+                     "   |           |     |\n"
+                     "A  f  d  i  .  d  d  F\n"
+                     "B  x  x  x  x  x  d  .\n"
+                     "\n"
+                     "F I D  needed: full, incremental, delta\n"
+                     "f i d  not needed\n"
+                     "x      discarded by a restore\n"
+                     ".      not in the image\n"
+                     "[0]"},
+        {"chart h/ 20250105010000", "What 2025-01-05 01:00:00 needs\n"
+                                    "\n"
+                                    "   2025-01-01  01-05\n"
+                                    "   |           |\n"
+                                    "A  F  d  I  .  D\n"
+                                    "B  f  d  i  F  D\n"
+                                    "\n"
+                                    "F I D  needed: full, incremental, delta\n"
+                                    "f i d  not needed\n"
+                                    ".      not in the image\n"
+                                    "[0]"},
+        {"unneeded --since 20250108000000 h/",
+         "20250102010000  delta        database\n"
+         "20250104010000  full         tablespace\n"
+         "2 of 7 images are not needed by restores from 20250108000000\n"
+         "[0]"},
+        {"unneeded --keep 2 h/", "20250102010000  delta        database\n"
+                                 "1 of 7 images are not needed by restores from 20250105010000\n"
+                                 "[0]"},
+        {"unneeded --since 20260101000000 h/",
+         "zq3hist: no image is there from then on: 20260101000000, h/\n"
+         "[5]"},
+        {"needed-by h/ 20250103010000", "20250105010000  delta        database\n"
+                                        "1 of 7 images need 20250103010000\n"
+                                        "[0]"},
+        {"needed-by h/ 20250107010000", "zq3hist: no image has the timestamp 20250107010000, h/\n"
+                                        "zq3hist: hint: zq3hist images h/  # lists all\n"
+                                        "[5]"},
+        {"images --last x h/", "zq3hist: --last takes a number, not x\n"
+                               "Try 'zq3hist --help'.\n"
+                               "[2]"},
+        {"help needed-by",
+         "Usage: zq3hist needed-by [OPTION...] DIR TIMESTAMP\n"
+         "\n"
+         "List the restores that break without this image.\n"
+         "\n"
+         "  --json                   print JSON: see zq3hist-json(5)\n"
+         "  -d ALIAS                 in place of DIR: the database's directory in $ZQ3DBPATH\n"
+         "[0]"},
+    };
+    run("load h/", tenDays());
+    run("load e/", "", "mkdir e; ");
+    spill(root + "have", "# on hand\n 20250101010000\n\n2025-01-02 01:00:00\r\n20250109010000\n");
+    for (const auto& row : rows)
+        EXPECT_EQ(row.output, run(row.arguments)) << row.arguments;
+}
+
+TEST_F(QuestionTest, TheManualListsEveryMember)
+{
+    const struct {
+        const char* command;
+        std::vector<std::pair<const char*, int>> calls;
+    } rows[] = {
+        {"images", {{"--all h/", 0}, {"--last 1 h/", 0}, {"e/", 0}}},
+        {"plan",
+         {{"h/ latest", 0},
+          {"h/ 20250108010000", 6},
+          {"h/ 20250105010000", 0},
+          {"--have have h/ 20250102010000", 6}}},
+        {"chart", {{"h/", 0}, {"h/ 20250102010000", 0}, {"s/", 0}}},
+        {"unneeded", {{"--keep 1 h/", 0}}},
+        {"needed-by", {{"h/ 20250101010000", 0}}},
+    };
+    run("load h/", tenDays());
+    run("load e/", "", "mkdir e; ");
+    run("load s/", stanza("backup", 20250101000000, "Type: delta\n", {"A"}), "mkdir s; ");
+    spill(root + "have", "");
+    for (const auto& row : rows) {
+        manualSection manual(row.command);
+        for (const auto& [arguments, status] : row.calls)
+            manual.check(ask(std::string(row.command) + " --json " + arguments, status));
+    }
 }
