@@ -197,6 +197,7 @@ static int readRows(const lookedFile* file, SQLUH_WORKAREA* workArea, SQLUH_COMM
     SQLUH_ENTRY entry = {};
     entry.data = &data;
     sqluhProvenEntry proven;
+    sqluhBeginProving(&proven, true);
     long long offset = headerLength;
     int rc = sqloseek(file->fh, offset, sqloFromStart, nullptr);
     while (rc == 0) {
@@ -422,12 +423,14 @@ static void logDamage(const pairRead* read, int rc)
     bool inShadow = read->result->fromShadow && read->result->failure != 0;
     SQLO_FHANDLE fh = inShadow ? read->shadow.fh : read->history.fh;
     SQLUH_WORKAREA workArea = {};
+    sqluhProvenEntry proven;
     zq3HistoryData data = {};
     SQLUH_ENTRY entry = {};
     entry.data = &data;
     if (sqloseek(fh, read->result->damagedAt, sqloFromStart, nullptr) == 0 &&
         sqluhInitWorkArea(&workArea, defaultWorkAreaSize) == 0) {
-        sqluhCheckEntry(fh, &entry, &workArea);
+        sqluhBeginProving(&proven, false);
+        sqluhCheckEntry(fh, &entry, &workArea, &proven);
         sqlofmblkEx(workArea.buffer);
     }
 }

@@ -55,29 +55,44 @@ static inline auto targetOf(SQLUH_ENTRY* entry, sqluhFixedWords* words)
 
 // --- By column -----------------------------------------------------------------------------------
 
-// Takes a number aside, or a word; tells whether the field stands as the writer writes it.
+// The columns that neighbouring entries have most alike: from the version to the end of line 1.
+enum : uint32_t { likelyAt = entryFields[fieldVersion].at, likelyLength = lineLength - likelyAt };
+static constexpr bool isLikely(unsigned int field)
+{
+    return field >= fieldVersion && field <= fieldCommandLength;
+}
+
+// Takes a word; tells whether it stands as the writer writes it.
+static inline bool takeWord(const char* from, uint32_t width, char* word)
+{
+    uint32_t length = wordLength(from, width);
+    memcpy(word, from, width);
+    word[length] = '\0';
+    return length != 0;
+}
+
+// Takes a number aside, or a word, unless it is kept; tells whether the field stands as the writer
+// writes it.
 template <unsigned int field>
-static inline bool takeColumn(const char* text, uint32_t* numbers, sqluhFixedWords* words)
+static inline bool takeColumn(const char* text, sqluhFixedPart* part, bool isKept, bool isLine1Kept)
 {
     constexpr sqluhEntryField row = entryFields[field];
     const char* from = text + row.at;
+    if (isLikely(field) && isLine1Kept)
+        return true;
     if (from[row.width] != ':')
         return false;
-    if constexpr (row.kind == kindHex) {
-        return hexColumns(from, &numbers[field]);
-    } else if constexpr (row.kind == kindHex16) {
-        return hexDigitsAt(from, row.width, &numbers[field]);
-    } else if constexpr (row.kind == kindDecimal) {
-        return decimalColumns(from, &numbers[field]);
-    } else if constexpr (isLetter(row.kind)) {
+    if constexpr (row.kind == kindHex)
+        return hexColumns(from, &part->numbers[field]);
+    else if constexpr (row.kind == kindHex16)
+        return hexDigitsAt(from, row.width, &part->numbers[field]);
+    else if constexpr (row.kind == kindDecimal)
+        return decimalColumns(from, &part->numbers[field]);
+    else if constexpr (isLetter(row.kind))
         return *from != '\0'; // which ends the text for the scanning format
-    } else {
-        char* word = words->text[field - fieldObjectPart];
-        uint32_t length = wordLength(from, row.width);
-        memcpy(word, from, row.width);
-        word[length] = '\0';
-        return length != 0;
-    }
+    else
+        return (isKept && memcmp(from, part->text + row.at, row.width) == 0) ||
+               takeWord(from, row.width, part->words.text[field - fieldObjectPart]);
 }
 
 template <unsigned int field>
@@ -92,19 +107,36 @@ static inline void storeColumn(const char* text, const uint32_t* numbers, SQLUH_
     }
 }
 
+// Whether line 1 ends as the writer ends it: with blanks, each like the one before it.
+static bool isLine1Ended(const char* text)
+{
+    const char* reserved = text + entryReserved1At;
+    return reserved[0] == ' ' && memcmp(reserved, reserved + 1, entryReserved1Length - 1) == 0 &&
+           text[lineTextLength] == '\n';
+}
+
+// Whether line 2 begins as the writer begins it; its end is not looked at, here or by the scanning
+// format.
+static bool isLine2Begun(const char* text)
+{
+    char operation = text[entryFields[fieldOperation].at];
+    return operation > ' ' && operation < 0x7F;
+}
+
 template <unsigned int... fields>
-static bool takeCanonical(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* words,
+static bool takeCanonical(const char* text, SQLUH_ENTRY* entry, sqluhFixedPart* part,
                           std::integer_sequence<unsigned int, fields...>)
 {
-    uint32_t numbers[entryFieldCount];
-    const char* reserved = text + entryReserved1At; // blanks, each like the one before it
-    char operation = text[entryFields[fieldOperation].at];
-    // What is after field 23 is not looked at, here or by the scanning format.
-    if (reserved[0] != ' ' || memcmp(reserved, reserved + 1, entryReserved1Length - 1) != 0 ||
-        text[lineTextLength] != '\n' || operation <= ' ' || operation >= 0x7F ||
-        !(takeColumn<fields>(text, numbers, words) && ...))
+    bool isKept = part->isKept;
+    bool isLine1Kept = isKept && memcmp(text + likelyAt, part->text + likelyAt, likelyLength) == 0;
+    part->isKept = false;
+    if (!(isLine1Kept || isLine1Ended(text)) || !isLine2Begun(text) ||
+        !(takeColumn<fields>(text, part, isKept, isLine1Kept) && ...))
         return false;
-    (storeColumn<fields>(text, numbers, entry), ...);
+    (storeColumn<fields>(text, part->numbers, entry), ...);
+    if (part->forNeighbours)
+        memcpy(part->text, text, entryFixedLength);
+    part->isKept = part->forNeighbours;
     return true;
 }
 
@@ -122,10 +154,10 @@ static int scanFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* 
     return found < 0 ? 0 : found;
 }
 
-int sqluhTakeFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedWords* words)
+int sqluhTakeFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhFixedPart* part)
 {
     using allFields = std::make_integer_sequence<unsigned int, entryFieldCount>;
-    if (takeCanonical(text, entry, words, allFields()))
+    if (takeCanonical(text, entry, part, allFields()))
         return entryFieldCount;
-    return scanFixedPart(text, entry, words, allFields());
+    return scanFixedPart(text, entry, &part->words, allFields());
 }

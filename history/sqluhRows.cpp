@@ -206,7 +206,7 @@ static void packNumbers(sqluhRow* row, const SQLUH_ENTRY* entry, const sqluhProv
     row->status = data->status;
     row->operation = data->operation;
     memcpy(row->optional, proven->optional, sizeof row->optional);
-    sqluhParseLogPosition(wordOfField(&proven->words, fieldLogPosition), row->logPosition);
+    sqluhParseLogPosition(wordOfField(&proven->fixed.words, fieldLogPosition), row->logPosition);
 }
 
 // Packs the texts of the record after the row. Returns where they end.
@@ -217,7 +217,7 @@ static char* packTexts(sqluhRow* row, const char* record, const sqluhProvenEntry
     const char* name = qualifier + row->entry.qualifierLength + 1;
     bool named = row->entry.qualifierLength != 0 || row->entry.nameLength != 0;
     for (unsigned int field = fieldObjectPart; field < fieldAuxCode; field++) {
-        const char* word = wordOfField(&proven->words, field);
+        const char* word = wordOfField(&proven->fixed.words, field);
         size_t length = field == fieldLogPosition ? 0 : strlen(word);
         row->wordLength[field - fieldObjectPart] = static_cast<uint8_t>(length);
         memcpy(at, word, length);

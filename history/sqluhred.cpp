@@ -50,7 +50,7 @@ static int readFixedPart(SQLO_FHANDLE fh, SQLUH_WORKAREA* workArea, bool* begun,
 static int parseFixedPart(const char* text, SQLUH_ENTRY* entry, sqluhProvenEntry* proven,
                           const char* operation)
 {
-    int found = sqluhTakeFixedPart(text, entry, &proven->words);
+    int found = sqluhTakeFixedPart(text, entry, &proven->fixed);
     if (found < static_cast<int>(entryFieldCount)) {
         logRecord({textItem(TEXT_ENTRY_FIELDS), numberItem(TEXT_ENTRY_FIELDS_READ, found),
                    dataItem("", text, entryFixedLength)},
@@ -287,19 +287,39 @@ static char* takeTablespaces(char* at, const char* end, uint32_t count, textBuff
     return at;
 }
 
+// Whether the entry's lines are those of a neighbour, which were proven.
+static bool linesAreKept(const sqluhProvenEntry* proven, const char* lines, uint32_t count)
+{
+    return count == proven->keptCount &&
+           proven->keptLength <= proven->tablespacesEnd - proven->tablespacesAt &&
+           memcmp(lines, proven->keptLines, proven->keptLength) == 0;
+}
+
 int sqluhPassTablespaces(const SQLUH_ENTRY* entry, const SQLUH_WORKAREA* workArea,
                          sqluhProvenEntry* proven, const char* operation)
 {
-    const char* at = workArea->buffer + proven->tablespacesAt;
+    uint32_t count = entry->data->numTablespaces;
+    const char* lines = workArea->buffer + proven->tablespacesAt;
+    const char* at = lines;
     const char* end = workArea->buffer + proven->tablespacesEnd;
     uint64_t head = 0;
     uint64_t length = noTablespaceLength;
-    for (uint32_t i = 0; i < entry->data->numTablespaces; i++) {
+    if (linesAreKept(proven, lines, count)) {
+        proven->tailAt = proven->tablespacesAt + proven->keptLength;
+        return 0;
+    }
+    for (uint32_t i = 0; i < count; i++) {
         if (!tablespaceFits(at, end, &head, &length))
             return damagedLengths(entry, operation);
         at += length + tablespaceLineExtra;
     }
     proven->tailAt = static_cast<uint32_t>(at - workArea->buffer);
+    uint32_t whole = static_cast<uint32_t>(at - lines);
+    if (proven->fixed.forNeighbours && whole <= sizeof proven->keptLines) {
+        memcpy(proven->keptLines, lines, whole);
+        proven->keptLength = whole;
+        proven->keptCount = count;
+    }
     return 0;
 }
 
@@ -384,10 +404,10 @@ static int takeSections(SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea, sqluhProve
     const char* end = record + proven->tablespacesEnd;
     uint32_t stored = data->tablespaceBuffers != nullptr ? maxTablespaces : 0;
     if (filters->timestamp != nullptr)
-        *flags |=
-            compareTimestamp(filters->timestamp, wordOfField(&proven->words, fieldObjectPart));
+        *flags |= compareTimestamp(filters->timestamp,
+                                   wordOfField(&proven->fixed.words, fieldObjectPart));
     takeNoteAndLongText(entry, record);
-    takeLine2(data, &proven->words);
+    takeLine2(data, &proven->fixed.words);
     *flags |=
         takeObjectNames(entry, record + proven->objectNamesAt, filters->qualifier, filters->name);
     char* at = takeTablespaces(record + proven->tablespacesAt, end, data->numTablespaces,
@@ -416,14 +436,14 @@ static void logUnreadable(int rc, long long offset, const SQLUH_WORKAREA* workAr
         sqlt_logerr_data(readEntry, TEXT_ENTRY_DUMP, workArea->buffer, workArea->size);
 }
 
-int sqluhCheckEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea)
+int sqluhCheckEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
+                    sqluhProvenEntry* proven)
 {
-    sqluhProvenEntry proven;
     long long offset = 0;
     sqloseek(fh, 0, sqloFromCurrent, &offset);
-    int rc = sqluhProveEntry(fh, entry, workArea, &proven, readEntry);
+    int rc = sqluhProveEntry(fh, entry, workArea, proven, readEntry);
     if (rc == 0)
-        rc = sqluhPassTablespaces(entry, workArea, &proven, readEntry);
+        rc = sqluhPassTablespaces(entry, workArea, proven, readEntry);
     logUnreadable(rc, offset, workArea);
     return rc;
 }
@@ -436,6 +456,7 @@ static int readWholeEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* w
 {
     uint32_t maxTablespaces = entry->data->maxTablespaces;
     sqluhProvenEntry proven;
+    sqluhBeginProving(&proven, false);
     *flags = 0;
     // For the message: a file that cannot tell its position fails the read that follows.
     sqloseek(fh, 0, sqloFromCurrent, offset);

@@ -16,12 +16,24 @@ enum : unsigned int { optionalLetterCount = 3 };
 struct sqluhProvenEntry {
     bool begun;                         // the file held something at its position
     char optional[optionalLetterCount]; // object, operation type and aux code, "-" as it stands
-    sqluhFixedWords words;
+    sqluhFixedPart fixed;
     uint32_t objectNamesAt; // both lines, if the entry has any
     uint32_t tablespacesAt;
     uint32_t tablespacesEnd; // at most: what comes after them still fits
     uint32_t tailAt;         // the sqlca line; set by sqluhPassTablespaces
+    // The tablespace lines of a neighbour, proven, if they are not too many.
+    uint32_t keptCount;
+    uint32_t keptLength;
+    char keptLines[16 * 1024];
 };
+
+// Prepares a record for one entry or, forNeighbours, for entries read one after the other.
+static inline void sqluhBeginProving(sqluhProvenEntry* proven, bool forNeighbours)
+{
+    proven->fixed.isKept = false;
+    proven->fixed.forNeighbours = forNeighbours;
+    proven->keptCount = proven->keptLength = 0;
+}
 
 // Reads the entry at the file's position and proves its checksum, and that its sections lie inside
 // it: the tablespace lines only by their number. *entry, and the numbers and letters of its data,
@@ -36,7 +48,8 @@ int sqluhPassTablespaces(const SQLUH_ENTRY* entry, const SQLUH_WORKAREA* workAre
 
 // Reads and proves the whole entry at the file's position, and takes nothing out. Returns what
 // sqluhReadEntry without filters does, but for TABLESPACE_LIST_TRUNCATED, and logs the same.
-int sqluhCheckEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea);
+int sqluhCheckEntry(SQLO_FHANDLE fh, SQLUH_ENTRY* entry, SQLUH_WORKAREA* workArea,
+                    sqluhProvenEntry* proven);
 
 // --- Taking texts out ----------------------------------------------------------------------------
 

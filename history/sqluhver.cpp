@@ -3,16 +3,25 @@
 #include "history/sqluhDiagnostics.h"
 #include "history/sqluhred.h"
 
+// Checks one entry for the operation that verifies it.
+static int verifyEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea, sqluhProvenEntry* proven)
+{
+    zq3HistoryData data = {};
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    int rc = sqluhCheckEntry(fileHandle, &entry, workArea, proven);
+    if (rc != END_OF_FILE)
+        loggedPlain(rc, "sqluhVerifyOneEntry");
+    return rc;
+}
+
 int sqluhVerifyOneEntry(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea)
 {
     pdtEntry();
 
-    zq3HistoryData data = {};
-    SQLUH_ENTRY entry = {};
-    entry.data = &data;
-    int rc = sqluhCheckEntry(fileHandle, &entry, workArea);
-    if (rc != END_OF_FILE)
-        loggedPlain(rc);
+    sqluhProvenEntry proven;
+    sqluhBeginProving(&proven, false);
+    int rc = verifyEntry(fileHandle, workArea, &proven);
 
     pdtExit(rc);
     return rc;
@@ -22,9 +31,11 @@ int sqluhVerifyHistoryEntries(SQLO_FHANDLE fileHandle, SQLUH_WORKAREA* workArea)
 {
     pdtEntry();
 
+    sqluhProvenEntry proven;
+    sqluhBeginProving(&proven, true);
     int rc = 0;
     while (rc == 0)
-        rc = sqluhVerifyOneEntry(fileHandle, workArea);
+        rc = verifyEntry(fileHandle, workArea, &proven);
     if (rc == END_OF_FILE)
         rc = 0;
 
