@@ -42,12 +42,16 @@ bool queryLock(const historyPlace* place, SQLO_NLCK* lock, SQLO_NLCKSTATE* state
            sqloNLCKQuery(lock, state) == 0;
 }
 
+// Those that would end the process.
 static void fatalSignals(sigset_t* set)
 {
     sigemptyset(set);
     static constexpr int numbers[] = {SIGINT, SIGTERM, SIGHUP, SIGQUIT};
-    for (int number : numbers)
-        sigaddset(set, number);
+    for (int number : numbers) {
+        struct sigaction action;
+        if (sigaction(number, nullptr, &action) == 0 && action.sa_handler != SIG_IGN)
+            sigaddset(set, number);
+    }
 }
 
 static void holdSignals(void)
@@ -62,6 +66,14 @@ void releaseSignals(void)
     sigset_t set;
     fatalSignals(&set);
     sigprocmask(SIG_UNBLOCK, &set, nullptr);
+}
+
+bool isSignalHeld(void)
+{
+    sigset_t fatal, pending, both;
+    fatalSignals(&fatal);
+    return sigpending(&pending) == 0 && sigandset(&both, &fatal, &pending) == 0 &&
+           sigisemptyset(&both) == 0;
 }
 
 // A file that may not be read counts as unusable for the library, which would move it aside where
@@ -121,26 +133,6 @@ int failOpening(int code, const char* what, const historyPlace* place)
          "disk, for one), and nothing is lost",
          what);
     return exitDamaged;
-}
-
-int openHistory(historyPlace* place, unsigned int accessMode, SQLUH_HANDLE** handle)
-{
-    int rc = awaitLock(place, accessMode == SQLUH_OPEN_READ ? R_OK : R_OK | W_OK);
-    if (rc != 0)
-        return rc;
-    rc = sqluhOpen(handle, place->directory, accessMode);
-    if (rc == HISTORY_FILE_RECREATED)
-        sqluhClose(handle);
-    if (rc != 0)
-        releaseSignals();
-    return rc == 0 ? 0 : failOpening(rc, "open the history", place);
-}
-
-int closeHistory(const historyPlace* place, SQLUH_HANDLE** handle, const char* what)
-{
-    int rc = sqluhClose(handle);
-    releaseSignals();
-    return rc == 0 ? 0 : failInPlace(rc, what, place);
 }
 
 static bool isEmptyFile(const char* path)

@@ -57,9 +57,36 @@ bool isWhite(char c)
     return c == ' ' || (c >= '\t' && c <= '\r');
 }
 
-static bool isTimestamp(const char* text, size_t length)
+static bool isDigits(const char* text, size_t length)
 {
     return length == timestampWidth && strspn(text, "0123456789") >= timestampWidth;
+}
+
+static int twoDigits(const char* text)
+{
+    return 10 * (text[0] - '0') + (text[1] - '0');
+}
+
+// 14 digits that are a date and a time.
+static bool isTimestamp(const char* text, size_t length)
+{
+    static constexpr int days[] = {31, 29, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
+    if (!isDigits(text, length))
+        return false;
+    int century = twoDigits(text), year = twoDigits(text + 2), month = twoDigits(text + 4);
+    int day = twoDigits(text + 6);
+    bool leap = year % 4 == 0 && (year != 0 || century % 4 == 0);
+    return month >= 1 && month <= 12 && day >= 1 && day <= days[month - 1] &&
+           (month != 2 || day < 29 || leap) && twoDigits(text + 8) < 24 &&
+           twoDigits(text + 10) < 60 && twoDigits(text + 12) < 60;
+}
+
+// Whether a value would be refused if it had no escape; with one any can be given, since a history
+// may hold it.
+static bool isOdd(const recordField* field, const char* text, size_t length)
+{
+    return (field->rule == oneTimestamp && !isTimestamp(text, length)) ||
+           (field->rule == shortName && length >= zq3TablespaceNameCapacity);
 }
 
 // A text must be one that the entry's terminated strings can hold; a word must be one for whoever
@@ -71,15 +98,16 @@ static int checkText(const recordField* field, fieldValue* value)
     for (size_t i = 0; field->rule != anyBytes && i < value->length; i++) {
         if (value->text[i] == '\0')
             return refuse(value, "a text without zero bytes");
-        if (field->rule != anyText && isWhite(value->text[i]))
+        if ((field->rule == oneWord || field->rule == oneTimestamp) && isWhite(value->text[i]))
             return refuse(value, "one word without white space");
     }
-    // With an escape any word can be given.
-    bool mayBeEmpty = field->form == formBuffer;
-    if (field->rule == oneTimestamp && value->isPlain && !(mayBeEmpty && value->length == 0) &&
-        !isTimestamp(value->text, value->length))
-        return refuse(value, "a timestamp of 14 digits");
-    return 0;
+    bool isLeftEmpty = field->form == formBuffer && value->length == 0;
+    if (!value->isPlain || isLeftEmpty || !isOdd(field, value->text, value->length))
+        return 0;
+    return field->rule == shortName
+               ? refuse(value, "a name of at most %u characters", zq3TablespaceNameCapacity - 1)
+           : isDigits(value->text, value->length) ? refuse(value, "a date and a time that exist")
+                                                  : refuse(value, "a timestamp of 14 digits");
 }
 
 static int takeTextValue(const recordField* field, historyRecord* record, fieldValue* value)
@@ -301,13 +329,11 @@ static const char* textIn(const recordField* field, const historyRecord* record,
     return field->form == formBuffer ? text->data : field->form == formBytes ? digits : member;
 }
 
-// Escapes blanks at the ends, which would be lost, and the first character of a timestamp that is
-// none.
+// Escapes blanks at the ends, which would be lost, and the first character of an odd value.
 static void putValue(const recordField* field, const char* text, size_t length, FILE* out)
 {
     fprintf(out, "%s: ", field->name);
-    if (length != 0 &&
-        (text[0] == ' ' || (field->rule == oneTimestamp && !isTimestamp(text, length)))) {
+    if (length != 0 && (text[0] == ' ' || isOdd(field, text, length))) {
         fprintf(out, "\\x%02X", static_cast<unsigned char>(text[0]));
         text++, length--;
     }
@@ -442,7 +468,7 @@ const recordField recordFields[numRecordFields] = {
      settleEmpty, nullptr, nullptr},
     NUMBER("Node", "node", data.entryNode, 2, 1, 0, UINT16_MAX, takeNumbers, nullptr),
     NUMBER("Number", "number", data.entryNumber, 4, 1, 0, UINT32_MAX, takeEntryNumber, nullptr),
-    {"Tablespace", "tablespaces", formNames, anyText, 1,
+    {"Tablespace", "tablespaces", formNames, shortName, 1,
      offsetof(historyRecord, data.tablespaceBuffers), INT32_MAX, 0, 0, takeTextValue, nullptr,
      nullptr, nullptr},
     NUMBER("SQLCODE", "sqlcode", event.sqlcode, 4, 1, INT32_MIN, INT32_MAX, takeNumbers, nullptr),

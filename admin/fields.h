@@ -27,7 +27,7 @@ enum fieldForm : uint8_t {
 };
 
 // What a text must be beyond one without zero bytes.
-enum textRule : uint8_t { anyText, oneWord, oneTimestamp, anyBytes };
+enum textRule : uint8_t { anyText, oneWord, oneTimestamp, shortName, anyBytes };
 
 struct letterWord {
     const char* word;

@@ -126,46 +126,14 @@ void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* pro
     report->rc = walk.cutShort ? HISTORY_FILE_DAMAGED : rc == END_OF_FILE ? 0 : rc;
 }
 
-static bool isSoundFile(SQLO_FHANDLE file, const char* name, const char* what)
+void setTotals(SQLUH_HEADER* header, const entriesReport* totals)
 {
-    SQLUH_HEADER header;
-    SQLUH_WORKAREA workArea = {};
-    entriesReport entries = {};
-    int rc = sqluhReadHeader(file, &header);
-    if (rc != 0) {
-        failWithCode(rc, what, name);
-        return false;
-    }
-    if (header.status != statusConsistent && header.status != statusCommitted) {
-        fail(name,
-             header.status == statusPending
-                 ? "cannot %s: a batch is unfinished in the history (status 'P')"
-                 : "cannot %s: the file is no history",
-             what);
-        return false;
-    }
-    rc = sqluhInitWorkArea(&workArea, defaultWorkAreaSize);
-    if (rc == 0) {
-        readAllEntries(file, &workArea, what, &entries);
-        sqlofmblkEx(workArea.buffer);
-        rc = entries.rc;
-    }
-    if (rc == HISTORY_FILE_DAMAGED)
-        fail(name, "cannot %s: the entry at offset %lld is damaged", what, entries.offset);
-    else if (rc != 0)
-        failWithCode(rc, what, name);
-    return rc == 0;
-}
-
-bool isSoundImage(const char* path, const char* name, const char* what)
-{
-    SQLO_FHANDLE file = sqloNoFile;
-    int rc = sqloopenp(path, sqloOpenRead, sqloPermissions, &file);
-    if (rc != 0) {
-        failWithCode(rc, what, name);
-        return false;
-    }
-    bool sound = isSoundFile(file, name, what);
-    sqloclose(file);
-    return sound;
+    // offset3 is where the newest entry begins, timestamp is that entry's; old readers take the one
+    // from the other.
+    header->entryCount = totals->count;
+    header->number8 = totals->maxTablespaces;
+    header->maxCommandLength = totals->maxCommandLength;
+    header->offset3 = static_cast<uint64_t>(totals->newestAt);
+    memcpy(header->timestamp, totals->newestAt != 0 ? totals->newest : SQLUH_EMPTY_TIMESTAMP,
+           timestampWidth);
 }

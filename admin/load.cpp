@@ -1,11 +1,10 @@
 // zq3hist load: appends entries in one batch.
-#include "admin/zq3hist.h"
-
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <unistd.h>
 
+#include "admin/pair.h"
 #include "admin/stanza.h"
 #include "sqo/sqlzkrcb.h"
 
@@ -74,6 +73,104 @@ static int parseInput(const char* path, historyList* list)
     return rc == 0 ? 0 : failWithCode(rc, "read the entries", name);
 }
 
+// --- Entries that are there ----------------------------------------------------------------------
+
+// What entries say, their numbers aside: a checksum of 64 bits for each, sorted.
+struct knownEntries {
+    uint64_t* sums;
+    size_t count, capacity;
+};
+
+static int compareSums(const void* a, const void* b)
+{
+    uint64_t first, second;
+    memcpy(&first, a, sizeof first);
+    memcpy(&second, b, sizeof second);
+    return first < second ? -1 : first > second;
+}
+
+// FNV-1a of the stanza without its number. 0: no memory.
+static uint64_t sumOf(const historyRecord* record)
+{
+    char* text = nullptr;
+    size_t length = 0;
+    uint64_t sum = 0xCBF29CE484222325;
+    FILE* out = open_memstream(&text, &length);
+    if (out == nullptr)
+        return 0;
+    writeUnnumbered(out, record);
+    if (fclose(out) != 0)
+        sum = 0;
+    for (size_t i = 0; sum != 0 && i < length; i++)
+        sum = (sum ^ static_cast<unsigned char>(text[i])) * 0x100000001B3;
+    free(text);
+    return sum;
+}
+
+static int addKnown(knownEntries* known, uint64_t sum)
+{
+    if (known->count == known->capacity) {
+        size_t capacity = known->capacity * 2 + 64;
+        void* grown = reallocarray(known->sums, capacity, sizeof *known->sums);
+        if (grown == nullptr)
+            return sqloSystemError | ENOMEM;
+        known->sums = static_cast<uint64_t*>(grown);
+        known->capacity = capacity;
+    }
+    known->sums[known->count++] = sum;
+    return sum != 0 ? 0 : sqloSystemError | ENOMEM;
+}
+
+static int readKnown(const SQLUH_COMMITTED* committed, knownEntries* known)
+{
+    historyRecord* record = newRecord();
+    int rc = record == nullptr ? sqloSystemError | ENOMEM : 0;
+    for (uint32_t row = 0; rc == 0; row++) {
+        rc = takeRow(committed, row, record);
+        if (rc == 0)
+            rc = addKnown(known, sumOf(record));
+    }
+    freeRecord(record);
+    if (known->count != 0)
+        qsort(known->sums, known->count, sizeof *known->sums, compareSums);
+    return rc == END_OF_FILE ? 0 : rc;
+}
+
+// Takes the records out of the list that the history holds already; *there receives the number of
+// its entries.
+static int skipKnown(const historyPlace* place, historyList* list, uint32_t* there)
+{
+    SQLUH_COMMITTED* committed = nullptr;
+    knownEntries known = {};
+    size_t kept = 0;
+    int rc = sqluhReadCommitted(place->directory, &committed);
+    if (rc >= 0)
+        rc = readKnown(committed, &known);
+    for (size_t i = 0; rc == 0 && i < list->count; i++) {
+        historyRecord* record = list->records[i];
+        uint64_t sum = sumOf(record);
+        bool isKnown = known.count != 0 &&
+                       bsearch(&sum, known.sums, known.count, sizeof sum, compareSums) != nullptr;
+        list->records[i] = nullptr;
+        if (isKnown)
+            freeRecord(record);
+        else
+            list->records[kept++] = record;
+        if (sum == 0)
+            rc = sqloSystemError | ENOMEM;
+    }
+    if (rc == 0)
+        list->count = kept;
+    *there = static_cast<uint32_t>(known.count);
+    free(known.sums);
+    sqluhFreeCommitted(&committed);
+    return rc == 0 ? 0 : failInPlace(rc, "read the history", place);
+}
+
+// --- The batch -----------------------------------------------------------------------------------
+
+enum : int { loadInterrupted = 1, loadOutdated = 2 }; // instead of a code
+
 // Writes the records after the entries that are there, and brings the header up to date. What the
 // header says of the old entries is counted anew: it may come from a writer that did not keep it.
 static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport* totals)
@@ -89,76 +186,141 @@ static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport*
         addToReport(totals, &record->entry);
         header->entryCount = totals->count;
         totals->offset += record->entry.size;
+        if (isSignalHeld())
+            rc = loadInterrupted;
     }
-    // offset3 is where the newest entry begins, timestamp is that entry's; old readers take the one
-    // from the other.
-    header->number8 = totals->maxTablespaces;
-    header->maxCommandLength = totals->maxCommandLength;
-    header->offset3 = static_cast<uint64_t>(totals->newestAt);
-    memcpy(header->timestamp, totals->newestAt != 0 ? totals->newest : SQLUH_EMPTY_TIMESTAMP,
-           timestampWidth);
+    setTotals(header, totals);
     return rc;
 }
 
-// Undoes the batch; the two opens do now what the next two would do, so that both files are whole.
-static void abandon(historyPlace* place, SQLUH_HANDLE** handle)
+// Takes back what was appended and the mark of the batch. The shadow, which the next open would
+// otherwise copy over the history, need not be as good as the entries that are there.
+static void undoBatch(SQLUH_HANDLE** handle, SQLUH_HEADER header, long long end)
 {
+    SQLO_FHANDLE file = (*handle)->fileHandle;
+    header.status = statusConsistent;
+    if (ftruncate(file.descriptor, end) == 0 && sqlosync(file) == 0 &&
+        sqluhWriteHeader(file, &header) == 0)
+        sqlosync(file);
     sqluhEndBatch(handle, sqluhAbandon);
-    for (int i = 0; i < 2; i++)
-        if (sqluhOpen(handle, place->directory, SQLUH_OPEN_READ) >= 0)
-            sqluhClose(handle);
 }
 
-static int runBatch(historyPlace* place, historyList* list)
+// Reads what is there, known entries if a number is given, and appends the others. Returns 0,
+// loadInterrupted, loadOutdated or a code.
+static int fillBatch(SQLUH_HANDLE* handle, historyList* list, const uint32_t* known)
+{
+    entriesReport totals = {};
+    readAllEntries(handle->fileHandle, &handle->workArea, "Reading the history", &totals);
+    int rc = totals.rc;
+    if (rc == 0 && totals.count < handle->header.entryCount)
+        rc = HISTORY_FILE_DAMAGED;
+    if (rc == 0 && known != nullptr && totals.count != *known)
+        rc = loadOutdated;
+    return rc == 0 ? appendRecords(handle, list, &totals) : rc;
+}
+
+static int failBatch(const historyPlace* place, int rc)
+{
+    if (rc == loadInterrupted)
+        return fail(place->directory, "interrupted; nothing was appended");
+    if (rc == loadOutdated)
+        return fail(place->directory, "the history changed meanwhile; load the file again");
+    return rc == 0 ? 0 : failInPlace(rc, "append to the history", place);
+}
+
+static int runBatch(historyPlace* place, historyList* list, const uint32_t* known)
 {
     SQLUH_HANDLE* handle = nullptr;
-    entriesReport totals = {};
+    long long end = 0;
     int rc = sqluhBeginBatch(&handle, place->directory);
     if (rc != 0)
         return failOpening(rc, "begin the batch", place);
-    readAllEntries(handle->fileHandle, &handle->workArea, "Reading the history", &totals);
-    if (totals.rc != 0) {
-        abandon(place, &handle);
-        return failInPlace(totals.rc, "append to the history", place);
-    }
-    rc = appendRecords(handle, list, &totals);
+    const SQLUH_HEADER header = handle->header;
+    rc = sqloseek(handle->fileHandle, 0, sqloFromEnd, &end);
+    if (rc == 0)
+        rc = fillBatch(handle, list, known);
     if (rc != 0) {
-        abandon(place, &handle);
-        return failInPlace(rc, "write the entries", place);
+        undoBatch(&handle, header, end);
+        return failBatch(place, rc);
     }
     rc = sqluhEndBatch(&handle, sqluhCommit);
     if (rc != 0) {
-        failInPlace(rc, "commit the batch", place);
-        hint(place, "the next open settles whether the entries are in; zq3hist dump DIR shows them "
-                    "before they are loaded again");
+        rc = failInPlace(rc, "commit the batch", place);
+        hint(place, "zq3hist dump DIR  # shows whether the entries are in, before they are loaded "
+                    "again");
     }
-    return rc == 0 ? 0 : exitFailed;
+    return rc;
 }
 
-// A history that no file of the pair holds would silently be begun anew by the batch.
-static int checkUsable(historyPlace* place)
+// A batch opens the history, which repairs it if it must, and not always from the better file: that
+// is left to whoever has looked.
+static int checkPair(const historyPlace* place)
 {
-    return repairDueIn(place) == sqluhRepairAnew
-               ? failInPlace(HISTORY_FILE_DAMAGED, "append to the history", place)
-               : 0;
+    pairFinding pair;
+    sqluhRepair due = repairDueIn(place);
+    if (due == sqluhRepairNone)
+        return 0;
+    int rc = examinePair(place, true, &pair);
+    bool isMended = pair.due == due && due != sqluhRepairAnew && !pair.refused;
+    return rc != 0 || isMended ? rc : failPair(place, &pair, "append to the history");
+}
+
+static int appendList(commandLine* line, historyList* list)
+{
+    historyPlace* place = &line->place;
+    uint32_t known = 0;
+    int rc = createIfMissing(place);
+    if (rc == 0)
+        rc = awaitLock(place, R_OK | W_OK);
+    if (rc == 0)
+        rc = checkPair(place);
+    if (rc == 0 && line->skipExisting)
+        rc = skipKnown(place, list, &known);
+    return rc != 0 || list->count == 0
+               ? rc
+               : runBatch(place, list, line->skipExisting ? &known : nullptr);
+}
+
+// Does all but the batch.
+static int rehearse(const commandLine* line, historyList* list)
+{
+    const historyPlace* place = &line->place;
+    uint32_t known;
+    if (!ossPathExists(place->historyPath) && !ossPathExists(place->shadowPath))
+        return 0;
+    int rc = checkPair(place);
+    return rc == 0 && line->skipExisting ? skipKnown(place, list, &known) : rc;
+}
+
+static void tellLoaded(const commandLine* line, size_t appended, size_t given)
+{
+    if (line->json) {
+        jsonWriter json = {};
+        beginAnswer(&json);
+        putJsonText(&json, "directory", line->place.directory);
+        putJsonBool(&json, "dryRun", line->dryRun);
+        putJsonNumber(&json, "appendedCount", static_cast<long long>(appended));
+        putJsonNumber(&json, "skippedCount", static_cast<long long>(given - appended));
+        endJsonLine(&json);
+        return;
+    }
+    printf("%zu entries %sappended", appended, line->dryRun ? "would be " : "");
+    if (line->skipExisting)
+        printf(", %zu that %s there left out", given - appended, line->dryRun ? "are" : "were");
+    puts("");
 }
 
 int loadMain(commandLine* line)
 {
-    historyPlace* place = &line->place;
     historyList list = {};
     int rc = parseInput(line->arguments[0], &list);
+    size_t given = list.count;
     if (rc == 0)
-        rc = createIfMissing(place);
+        rc = line->dryRun ? rehearse(line, &list) : appendList(line, &list);
     if (rc == 0)
-        rc = awaitLock(place, R_OK | W_OK);
-    if (rc == 0)
-        rc = checkUsable(place);
-    if (rc == 0)
-        rc = runBatch(place, &list);
+        tellLoaded(line, list.count, given);
+    fflush(stdout); // what was done is told, whatever signal comes now
     releaseSignals();
-    if (rc == 0)
-        printf("%zu entries appended\n", list.count);
     freeList(&list);
     return rc;
 }

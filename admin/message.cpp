@@ -116,21 +116,19 @@ struct explanation {
 };
 static constexpr explanation explanations[] = {
     {HISTORY_FILE_DAMAGED, exitDamaged, "the history is damaged",
-     "zq3hist verify DIR names the damage; zq3hist repair DIR and zq3hist restore DIR FILE mend "
-     "it"},
+     "zq3hist verify DIR  # names the damage and what mends it"},
     {HISTORY_FILE_MISSING, exitDamaged, "the directory holds no history file",
-     "zq3hist load DIR FILE makes one"},
+     "zq3hist restore DIR FILE  # FILE: a backup; without one, zq3hist load DIR FILE begins anew"},
     {HISTORY_FILE_RECREATED, exitDamaged,
      "neither file could be used; both were moved aside and an empty history was made",
-     "zq3hist restore DIR FILE puts a backup in its place; the old files "
-     "are " SQLUH_SAVED_HISTORY_NAME " and " SQLUH_SAVED_SHADOW_NAME},
+     "zq3hist restore DIR FILE  # FILE: a backup, if DIR/" SQLUH_SAVED_HISTORY_NAME
+     " or DIR/" SQLUH_SAVED_SHADOW_NAME " is of no use"},
     {sqloNLCKKeyFailure, exitFailed, "no lock key can be made of the history file",
-     "it may be missing, or in a directory that may not be searched"},
+     "ls -ld DIR DIR/" SQLUH_HISTORY_NAME "  # it may be missing or out of reach"},
     {sqloNLCKKeyConflict, exitLocked, "another program's semaphore set has the lock's key",
-     "zq3hist status DIR shows the key, ipcs -s the set's owner; a copy of the directory has "
-     "another key"},
+     "zq3hist status DIR; ipcs -s  # show the key, and the owner of the set with it"},
     {sqloNLCKOwnerDied, exitLocked, "a process died while it held the lock",
-     "zq3hist unlock DIR removes the lock; the next open settles what the process left unfinished"},
+     "zq3hist unlock DIR && zq3hist repair DIR  # removes the lock and settles what is unfinished"},
     {sqloNLCKBusy, exitLocked, "the lock is held by another process", nullptr},
     {END_OF_FILE, exitDamaged, "the file is empty", nullptr},
     {DISK_FULL, exitFailed, "no space is left on the device", nullptr},

@@ -6,8 +6,6 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "history/sqluhColumns.h"
-
 static constexpr textBuffer zq3HistoryData::*textMembers[] = {
     &zq3HistoryData::objectPart, &zq3HistoryData::secondTimestamp, &zq3HistoryData::firstText,
     &zq3HistoryData::lastText,   &zq3HistoryData::idText,          &zq3HistoryData::qualifierText,
@@ -149,71 +147,16 @@ static int makeRoom(historyRecord* record, bool* fitted)
     return room ? 0 : sqloSystemError | ENOMEM;
 }
 
-// Takes a line whole where the reader stops at the length that the entry states: the writer puts
-// down text and length as they are given to it.
-static bool takeLineWhole(textBuffer* text, uint32_t* length, const char* line, const char* column)
+int takeRow(const SQLUH_COMMITTED* committed, uint32_t row, historyRecord* record)
 {
-    uint32_t stated;
-    if (!hexColumns(column, &stated))
-        return true; // not as the writer writes it: what the reader made of it counts
-    uint32_t used = static_cast<uint32_t>(strnlen(line, lineTextLength));
-    while (used > 0 && line[used - 1] == ' ')
-        used--;
-    uint32_t kept = stated >= used && stated <= lineTextLength ? stated : used;
-    *length = stated;
-    return setText(text, line, strnlen(line, kept));
-}
-
-// The reader gives a blank for a letter that the file holds as "-".
-static void takeDash(char* letter, const char* head, unsigned int field)
-{
-    if (head[entryFields[field].at] == SQLUH_EMPTY_WORD[0])
-        *letter = SQLUH_EMPTY_WORD[0];
-}
-
-// Takes from the entry's first lines what the reader changes.
-static int takeAsWritten(historyRecord* record, const char* head)
-{
-    bool framed = true;
-    for (const sqluhEntryField& field : entryFields)
-        framed &= head[field.at + field.width] == ':';
-    if (!framed)
-        return 0;
-    zq3HistoryData* data = &record->data;
-    SQLUH_ENTRY* entry = &record->entry;
-    takeDash(&data->object, head, fieldObject);
-    takeDash(&data->operationType, head, fieldOperationType);
-    takeDash(&data->auxCode, head, fieldAuxCode);
-    bool taken = takeLineWhole(&data->noteText, &entry->noteLength, head + entryNoteAt,
-                               head + entryFields[fieldNoteLength].at);
-    if (taken && entry->longTextLength != 0)
-        taken = takeLineWhole(&data->longText, &entry->longTextLength, head + entryLongTextAt,
-                              head + entryFields[fieldLongTextLength].at);
-    return taken ? 0 : sqloSystemError | ENOMEM;
-}
-
-int readRecord(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, historyRecord* record,
-               long long* offset)
-{
-    char head[entryLongTextAt + lineLength] = {};
-    uint32_t headRead = 0;
-    SQLUH_ENTRYWALK walk = {file, &record->entry, workArea, 0, false};
     bool fitted = false;
-    int rc = sqloseek(file, 0, sqloFromCurrent, offset);
-    if (rc == 0)
-        rc = sqloread(file, head, sizeof head, &headRead);
-    if (rc == END_OF_FILE)
-        rc = 0;
+    int rc = 0;
     for (int round = 0; rc == 0 && !fitted && round < 4; round++) {
-        rc = sqloseek(file, *offset, sqloFromStart, nullptr);
-        if (rc == 0)
-            rc = sqluhNextEntry(&walk);
-        if (rc == 0)
+        rc = sqluhGetCommitted(committed, row, &record->entry, true);
+        if (rc == 0 || rc == TABLESPACE_LIST_TRUNCATED)
             rc = makeRoom(record, &fitted);
     }
     if (rc == 0)
-        rc = takeAsWritten(record, head);
-    if (rc == 0)
         splitObjectPart(record);
-    return walk.cutShort ? HISTORY_FILE_DAMAGED : rc;
+    return rc;
 }

@@ -37,9 +37,7 @@ bool joinObjectPart(historyRecord* record);
 bool addRecord(historyList* list, historyRecord* record);
 void freeList(historyList* list);
 
-// Reads the entry at the file's position in full, so that writing the record gives the same bytes
-// again. Returns 0, END_OF_FILE at the end of the file and nowhere else, HISTORY_FILE_DAMAGED (also
-// for an entry that the file's end cuts short), or another code of the reader; *offset receives
-// where the entry begins.
-int readRecord(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, historyRecord* record,
-               long long* offset);
+// Takes a row of a committed history in full, so that writing the record gives the same bytes
+// again. Returns 0 or, past the last row, END_OF_FILE or what ended the rows; or sqloSystemError
+// with ENOMEM.
+int takeRow(const SQLUH_COMMITTED* committed, uint32_t row, historyRecord* record);

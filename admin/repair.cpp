@@ -1,45 +1,122 @@
-// zq3hist repair: opens and closes the history, which repairs it, and says what that did.
-#include "admin/zq3hist.h"
+// zq3hist repair: brings both files into step from the one that is whole, and says what it did.
+#include "admin/pair.h"
 
+#include <cstdio>
 #include <unistd.h>
 
-static const char* repairedWords(sqluhRepair done)
+struct repairReport {
+    sqluhRepair done;
+    uint32_t count; // entries of the history afterwards
+    keptFiles kept;
+};
+
+// The history file may look usable to an open, and then a mark in the shadow would give it away:
+// the copy comes first.
+static int takeShadow(SQLUH_HANDLE* handle)
 {
-    return done == sqluhRepairShadow ? "The shadow was made anew from the history file."
-           : done == sqluhRepairHistory
-               ? "The history file was made anew from the shadow; a batch that "
-                 "was not finished is undone."
-               : "Neither file could be used. Both were moved aside, to " SQLUH_SAVED_HISTORY_NAME
-                 " and " SQLUH_SAVED_SHADOW_NAME ", and an empty history was made.";
+    int rc = sqlocopy(handle->shadowPath, handle->historyPath, 0);
+    if (rc == 0)
+        rc = sqluhUpdateHeaderStatus(handle->shadowPath, statusConsistent);
+    return rc == 0 ? sqluhUpdateHeaderStatus(handle->historyPath, statusConsistent) : rc;
+}
+
+static int repairFromSource(historyPlace* place, SQLUH_HANDLE* handle, bool fromShadow,
+                            repairReport* report)
+{
+    int rc = fromShadow ? keepFile(place->historyPath, report->kept.history)
+                        : keepFile(place->shadowPath, report->kept.shadow);
+    if (rc != 0)
+        return rc;
+    int code = fromShadow ? takeShadow(handle) : sqluhRecoverShadowFromHistory(handle);
+    return code == 0 ? 0 : failWithCode(code, "repair the history", place->directory);
+}
+
+static bool isShadowFuller(const pairFinding* pair)
+{
+    return pair->shadow.entries.count > pair->history.entries.count;
+}
+
+// Neither file is whole: the one with more entries that can be read is taken up to its damage.
+static int salvage(historyPlace* place, SQLUH_HANDLE* handle, const pairFinding* pair,
+                   repairReport* report)
+{
+    char temporary[pathCapacity];
+    partReport part = {};
+    int rc = formTemporary(place->historyPath, temporary);
+    if (rc == 0)
+        rc = keepPair(handle, &report->kept);
+    if (rc != 0)
+        return rc;
+    int code = writePart(isShadowFuller(pair) ? place->shadowPath : place->historyPath, nullptr,
+                         nullptr, temporary, &part);
+    if (code != 0)
+        rc = failWithCode(code, "repair the history", place->directory);
+    if (rc == 0)
+        rc = replacePair(place, handle, temporary);
+    unlink(temporary);
+    return rc;
+}
+
+static int repairPair(commandLine* line, SQLUH_HANDLE* handle, repairReport* report)
+{
+    historyPlace* place = &line->place;
+    const fileFinding* finding = nullptr;
+    pairFinding pair;
+    int rc = examinePair(place, true, &pair);
+    if (rc != 0)
+        return rc;
+    report->done = pair.due;
+    if (pair.refused || (pair.due == sqluhRepairAnew && !line->force))
+        return failPair(place, &pair, "repair the history");
+    if (sourceOf(place, &pair, &finding) == nullptr)
+        finding = isShadowFuller(&pair) ? &pair.shadow : &pair.history;
+    report->count = finding->entries.count;
+    if (line->dryRun || pair.due == sqluhRepairNone)
+        return 0;
+    return pair.due == sqluhRepairAnew
+               ? salvage(place, handle, &pair, report)
+               : repairFromSource(place, handle, pair.due == sqluhRepairHistory, report);
+}
+
+static void showReport(const repairReport* report, bool dryRun)
+{
+    const char* is = dryRun ? "would be" : "was";
+    if (report->done == sqluhRepairNone)
+        printf("Nothing to repair: both files hold the same %u entries\n", report->count);
+    else if (report->done == sqluhRepairAnew)
+        printf("Neither file is whole; a history of what can be read %s made: %u entries\n", is,
+               report->count);
+    else
+        printf("The %s %s made anew from the %s: %u entries\n",
+               report->done == sqluhRepairShadow ? "shadow" : "history file", is,
+               report->done == sqluhRepairShadow ? "history file" : "shadow", report->count);
+    tellKept(&report->kept);
+}
+
+static void showJsonReport(const historyPlace* place, const repairReport* report, bool dryRun)
+{
+    static const char* const words[] = {"nothing", "shadow", "history", "both"};
+    jsonWriter json = {};
+    beginAnswer(&json);
+    putJsonText(&json, "directory", place->directory);
+    putJsonBool(&json, "dryRun", dryRun);
+    putJsonText(&json, "madeAnew", words[report->done]);
+    putJsonNumber(&json, "entryCount", report->count);
+    putJsonKept(&json, &report->kept);
+    endJsonLine(&json);
 }
 
 int repairMain(commandLine* line)
 {
     historyPlace* place = &line->place;
-    int rc = awaitLock(place, R_OK | W_OK);
-    if (rc != 0)
-        return rc;
-
-    // An open does one repair; after one of the history the shadow's mark takes another.
-    sqluhRepair due = repairDueIn(place);
-    if (due == sqluhRepairNone)
-        puts("Nothing to repair: both files can be used and are in step.");
-    bool lost = false;
-    for (int round = 0; rc == 0 && due != sqluhRepairNone && round < 3; round++) {
-        SQLUH_HANDLE* handle = nullptr;
-        rc = sqluhOpen(&handle, place->directory, SQLUH_OPEN_UPDATE);
-        lost = lost || rc == HISTORY_FILE_RECREATED;
-        if (rc >= 0)
-            puts(repairedWords(rc == HISTORY_FILE_RECREATED ? sqluhRepairAnew : due));
-        int closed = sqluhClose(&handle);
-        rc = rc < 0 ? rc : closed;
-        due = repairDueIn(place);
-    }
-    releaseSignals();
-    if (rc != 0)
-        return failOpening(rc, "repair the history", place);
-    if (lost)
-        return fail(place->directory,
-                    "the history is empty: restore a backup of it, or load it anew");
-    return exitDone;
+    SQLUH_HANDLE* handle = nullptr;
+    repairReport report = {};
+    int rc = line->dryRun ? 0 : lockPair(place, R_OK | W_OK, &handle);
+    if (rc == 0)
+        rc = repairPair(line, handle, &report);
+    if (rc == 0 && line->json)
+        showJsonReport(place, &report, line->dryRun);
+    else if (rc == 0)
+        showReport(&report, line->dryRun);
+    return unlockPair(place, &handle, rc);
 }

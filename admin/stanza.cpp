@@ -216,12 +216,23 @@ int readStanzas(const char* text, size_t length, uint16_t node, historyList* lis
 
 // --- Writing -------------------------------------------------------------------------------------
 
-void writeStanza(FILE* out, const historyRecord* record)
+static void writeFields(FILE* out, const historyRecord* record, bool withNumber)
 {
     for (const recordField& field : recordFields)
-        if (!isInSqlca(&field) || record->entry.sqlcaLength != 0)
+        if ((withNumber || field.at != offsetof(historyRecord, data.entryNumber)) &&
+            (!isInSqlca(&field) || record->entry.sqlcaLength != 0))
             putField(&field, record, out);
     putc('\n', out);
+}
+
+void writeStanza(FILE* out, const historyRecord* record)
+{
+    writeFields(out, record, true);
+}
+
+void writeUnnumbered(FILE* out, const historyRecord* record)
+{
+    writeFields(out, record, false);
 }
 
 void writeJson(FILE* out, const historyRecord* record)
@@ -230,6 +241,7 @@ void writeJson(FILE* out, const historyRecord* record)
     bool withSqlca = record->entry.sqlcaLength != 0;
     bool inSqlca = false;
     beginJson(&json, nullptr, '{');
+    putJsonNumber(&json, "format", 1);
     for (const recordField& field : recordFields) {
         if (field.key == nullptr)
             continue;

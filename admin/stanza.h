@@ -22,6 +22,7 @@ int readStanzas(const char* text, size_t length, uint16_t node, historyList* lis
 
 // Prints a record as a stanza, with an empty line after it. Reading it gives the record again.
 void writeStanza(FILE* out, const historyRecord* record);
+void writeUnnumbered(FILE* out, const historyRecord* record); // without its number
 
 // Prints a record as one JSON object on one line.
 void writeJson(FILE* out, const historyRecord* record);

@@ -108,11 +108,11 @@ static void putJsonFile(jsonWriter* json, const char* key, const fileReport* fil
         putJsonBool(json, "usable", file->state.usable);
     }
     if (file->rc == 0) {
-        putJsonBytes(json, "status", &header->status, 1);
-        putJsonBytes(json, "timestamp", header->timestamp, timestampWidth);
-        putJsonNumber(json, "entries", header->entryCount);
-        putJsonNumber(json, "newestAt", static_cast<long long>(header->offset3));
-        putJsonNumber(json, "maxTablespaces", header->number8);
+        putJsonBytes(json, "headerStatus", &header->status, 1);
+        putJsonNumber(json, "headerEntryCount", header->entryCount);
+        putJsonBytes(json, "newestTimestamp", header->timestamp, timestampWidth);
+        putJsonNumber(json, "newestOffset", static_cast<long long>(header->offset3));
+        putJsonNumber(json, "maxTablespaceCount", header->number8);
         putJsonNumber(json, "maxCommandLength", header->maxCommandLength);
         putJsonNumber(json, "node", header->nodeNumber);
     }
@@ -124,8 +124,8 @@ static void showJson(const historyPlace* place, const directoryReport* report)
     static const char* const repairs[] = {"none", "shadow", "history", "anew"};
     static const char* const states[] = {"free", "being taken", "setup died",
                                          "held", "holder died", "foreign"};
-    jsonWriter json = {stdout, false};
-    beginJson(&json, nullptr, '{');
+    jsonWriter json = {};
+    beginAnswer(&json);
     putJsonText(&json, "directory", place->directory);
     putJsonBool(&json, "usable", report->due != sqluhRepairAnew);
     putJsonText(&json, "repair", repairs[report->due]);
@@ -141,6 +141,16 @@ static void showJson(const historyPlace* place, const directoryReport* report)
         putJsonText(&json, "lock", nullptr);
     }
     endJsonLine(&json);
+}
+
+static void hintAfter(const historyPlace* place, const directoryReport* report)
+{
+    int state = report->lockState.state;
+    if (report->lockKnown && (state == sqloNLCKStale || state == sqloNLCKSetupDied))
+        hint(place, "zq3hist unlock DIR && zq3hist repair DIR  # removes the lock and settles what "
+                    "is unfinished");
+    else if (report->due != sqluhRepairNone && !(report->lockKnown && state == sqloNLCKHeld))
+        hint(place, "zq3hist verify DIR  # reads both files and tells what mends them");
 }
 
 int statusMain(commandLine* line)
@@ -162,5 +172,11 @@ int statusMain(commandLine* line)
         showLock(&report);
         printf("%-10s%s\n", "", verdict(&report));
     }
-    return report.due == sqluhRepairAnew ? exitFailed : exitDone;
+    hintAfter(place, &report);
+    if (report.due == sqluhRepairAnew)
+        return exitDamaged;
+    bool isFree = report.lockState.state == sqloNLCKAbsent ||
+                  report.lockState.state == sqloNLCKSettingUp ||
+                  report.lockState.state == sqloNLCKHeld;
+    return report.lockKnown && !isFree ? exitLocked : exitDone;
 }

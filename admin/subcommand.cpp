@@ -18,20 +18,25 @@ static constexpr subcommand subcommands[] = {
      "list the images that no restore needs from a time on; delete nothing"},
     {"needed-by", neededByMain, 1, 1, 1, optionJson, "DIR TIMESTAMP",
      "list the restores that break without this image"},
-    {"load", loadMain, 1, 0, 1, 0, "DIR [FILE]",
-     "append the entries of a stanza file, all or none"},
+    {"load", loadMain, 1, 0, 1, optionJson | optionWait | optionDryRun | optionSkipExisting,
+     "DIR [FILE]", "append the entries of a stanza file, all or none"},
     {"dump", dumpMain, 1, 0, 0, optionJson, "DIR",
      "print all entries as stanzas, or one JSON object a line"},
     {"status", statusMain, 1, 0, 0, optionJson, "DIR",
      "show both files and the lock; change nothing"},
-    {"verify", verifyMain, 1, 0, 0, optionWait, "DIR", "read every entry of both files"},
-    {"repair", repairMain, 1, 0, 0, optionWait, "DIR",
+    {"verify", verifyMain, 1, 0, 0, optionJson, "DIR", "read every entry of both files"},
+    {"repair", repairMain, 1, 0, 0, optionJson | optionWait | optionDryRun | optionForce, "DIR",
      "bring both files into step and say what was done"},
-    {"copy", copyMain, 2, 0, 0, optionWait, "SRC DST", "replace the history in DST by that in SRC"},
-    {"backup", backupMain, 1, 1, 1, optionWait, "DIR FILE", "write the history to FILE"},
-    {"restore", restoreMain, 1, 1, 1, optionWait, "DIR FILE",
+    {"copy", copyMain, 2, 0, 0, optionWait | optionDryRun, "SRC DST",
+     "replace the history in DST by that in SRC"},
+    {"backup", backupMain, 1, 1, 1, optionWait | optionDryRun | optionForce, "DIR FILE",
+     "write the history to FILE"},
+    {"restore", restoreMain, 1, 1, 1, optionWait | optionDryRun, "DIR FILE",
      "replace the history by that in FILE"},
-    {"unlock", unlockMain, 1, 0, 0, 0, "DIR", "remove the lock that a dead process left"},
+    {"prune", pruneMain, 1, 0, 0, optionBefore | optionWait | optionDryRun, "DIR",
+     "remove the oldest entries that no image needs which stays"},
+    {"unlock", unlockMain, 1, 0, 0, optionAllLocks, "DIR",
+     "remove the lock that a dead process left"},
 };
 
 // --- Options -------------------------------------------------------------------------------------
@@ -77,6 +82,8 @@ static constexpr option options[] = {
      "replace a file that is there"},
     {"--skip-existing", optionSkipExisting, takesNothing, offsetof(commandLine, skipExisting), "",
      "leave out entries that the history holds already"},
+    {"--all", optionAllLocks, takesNothing, offsetof(commandLine, all), "",
+     "the locks of all dead processes, also where the directory is gone"},
 };
 
 bool parseTimestamp(const char* text, char* timestamp)
@@ -237,16 +244,18 @@ static int takeDirectories(commandLine* line)
 {
     const subcommand* command = line->command;
     historyPlace* places[] = {&line->place, &line->target};
-    if (line->numAliases != 0 && line->numAliases != command->numDirectories)
-        return failUsage("-d must stand for both directories or for none");
-    int given = line->numAliases != 0 ? 0 : command->numDirectories;
+    bool noneTaken = (command->options & optionAllLocks) != 0 && line->all;
+    int taken = noneTaken ? 0 : command->numDirectories;
+    if (line->numAliases != 0 && line->numAliases != taken)
+        return failUsage("-d must stand for each directory or for none");
+    int given = line->numAliases != 0 ? 0 : taken;
     line->arguments += given;
     line->numArguments -= given;
     if (line->numArguments < command->least ||
         (command->most >= 0 && line->numArguments > command->most))
         return failForm(line);
     int rc = 0;
-    for (int i = 0; rc == 0 && i < command->numDirectories; i++) {
+    for (int i = 0; rc == 0 && i < taken; i++) {
         rc = takePlace(given != 0 ? line->arguments[i - given] : line->aliasPaths[i], places[i]);
         places[i]->wait = line->wait;
     }

@@ -1,10 +1,5 @@
 // zq3hist copy, backup and restore: whole histories in and out of a directory.
-//
-// A history that is put in place comes in as a complete, verified file in the target's directory,
-// its header saying 'C': the history file is copied from it, header last, and the shadow from the
-// history file. Stopped anywhere, the next open finds the old history in the shadow, or the new one
-// in the history file with a letter that makes it the source of the shadow.
-#include "admin/zq3hist.h"
+#include "admin/pair.h"
 
 #include <cerrno>
 #include <cstdlib>
@@ -12,14 +7,6 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
-enum : unsigned int { pieceLength = 1024 * 1024 };
-
-static int formTemporary(const char* where, char* path)
-{
-    int length = snprintf(path, pathCapacity, "%s.%d.tmp", where, getpid());
-    return length < static_cast<int>(pathCapacity) ? 0 : fail(where, "the name is too long");
-}
 
 // Whether two paths lead to one file or directory.
 static bool isSame(const char* a, const char* b)
@@ -29,32 +16,63 @@ static bool isSame(const char* a, const char* b)
            first.st_ino == second.st_ino;
 }
 
-// Puts the verified file at temporary in the place of the target's history.
-static int installHistory(historyPlace* place, char* temporary)
+// Verifies the file at path, called name, and tells the number of its entries.
+static int proveImage(const char* path, const char* name, const char* what, uint32_t* count)
+{
+    fileFinding finding;
+    int rc = examineFile(path, what, &finding);
+    *count = finding.entries.count;
+    return rc != 0 ? failWithCode(rc, what, name) : failUnsound(&finding, name, what);
+}
+
+// Copies the committed history of a directory to the file at target, which is for where, under its
+// lock. A history that is not whole is refused: opening it might take the worse of its two files.
+static int copyCommitted(historyPlace* place, char* target, const char* what, const char* where)
 {
     SQLUH_HANDLE* handle = nullptr;
-    int rc = createIfMissing(place);
+    const fileFinding* finding = nullptr;
+    pairFinding pair;
+    int rc = lockPair(place, R_OK, &handle);
     if (rc == 0)
-        rc = awaitLock(place, R_OK | W_OK);
-    if (rc != 0)
-        return rc;
-    rc = sqluhUpdateHeaderStatus(temporary, statusCommitted);
-    if (rc == 0)
-        rc = sqluhOpen(&handle, place->directory, SQLUH_OPEN_READ);
-    if (rc == HISTORY_FILE_RECREATED)
-        rc = 0; // what is replaced was not usable
-    if (rc == 0 && handle != nullptr) {
-        rc = sqloclose(handle->fileHandle);
-        handle->fileHandle = sqloNoFile;
+        rc = examinePair(place, false, &pair);
+    const char* source = rc == 0 ? sourceOf(place, &pair, &finding) : nullptr;
+    if (rc == 0 && (source == nullptr || pair.refused))
+        rc = failPair(place, &pair, what);
+    int code = rc == 0 ? sqlocopy(source, target, 0) : 0;
+    if (rc == 0 && code == 0 && finding->file.header.status != statusConsistent)
+        code = sqluhUpdateHeaderStatus(target, statusConsistent);
+    if (code != 0)
+        rc = failWithCode(code, what, where);
+    if (rc == 0 && !pair.same) {
+        fprintf(stderr, "zq3hist: warning: only %s is whole\n",
+                source == place->historyPath ? SQLUH_HISTORY_NAME : SQLUH_SHADOW_NAME);
+        hintAboutPair(place, &pair);
     }
-    if (rc == 0)
-        rc = sqlocopy(temporary, handle->historyPath, 0);
-    if (rc == 0)
-        rc = sqluhRecoverShadowFromHistory(handle);
-    int closed = sqluhClose(&handle);
-    releaseSignals();
-    rc = rc != 0 ? rc : closed;
-    return rc == 0 ? 0 : failOpening(rc, "put the history in place", place);
+    return unlockPair(place, &handle, rc);
+}
+
+// What a dry run of copy and backup tells: the entries that are committed.
+static int countCommitted(const historyPlace* place, const char* what, uint32_t* count)
+{
+    const fileFinding* finding = nullptr;
+    pairFinding pair;
+    bool atWork;
+    int rc = examineQuietPair(place, true, &pair, &atWork);
+    if (rc == 0 && sourceOf(place, &pair, &finding) == nullptr)
+        rc = failPair(place, &pair, what);
+    *count = finding != nullptr ? finding->entries.count : 0;
+    return rc;
+}
+
+static void tellReplaced(const historyPlace* place, uint32_t count, const char* done, bool dryRun,
+                         const keptFiles* kept)
+{
+    fileReport there;
+    lookAtFile(place->historyPath, &there);
+    printf("%u entries %s%s\n", count, dryRun ? "would be " : "", done);
+    if (dryRun && there.rc == 0 && there.header.entryCount != 0)
+        printf("The %u entries that are there would be kept\n", there.header.entryCount);
+    tellKept(kept);
 }
 
 int restoreMain(commandLine* line)
@@ -62,23 +80,24 @@ int restoreMain(commandLine* line)
     historyPlace* place = &line->place;
     const char* image = line->arguments[0];
     char temporary[pathCapacity];
+    keptFiles kept = {};
+    uint32_t count = 0;
     int rc = formTemporary(place->historyPath, temporary);
-    if (rc != 0)
-        return rc;
-    if (!isSoundImage(image, image, "restore the history"))
-        return exitFailed;
-    // The copy is what was verified, whatever happens to the image meanwhile: so it is verified
-    // too.
-    int copied = sqlocopy(image, temporary, 0);
-    if (copied != 0)
-        rc = failWithCode(copied, "copy the backup to the directory", place->directory);
-    if (rc == 0 && !isSoundImage(temporary, image, "restore the history"))
-        rc = exitFailed;
     if (rc == 0)
-        rc = installHistory(place, temporary);
-    unlink(temporary);
+        rc = proveImage(image, image, "restore the history", &count);
+    if (rc == 0 && !line->dryRun) {
+        // The copy is what was verified, whatever happens to the image meanwhile: so it is verified
+        // too.
+        int copied = sqlocopy(image, temporary, 0);
+        rc = copied != 0
+                 ? failWithCode(copied, "copy the backup to the directory", place->directory)
+                 : proveImage(temporary, image, "restore the history", &count);
+        if (rc == 0)
+            rc = installHistory(place, temporary, &kept);
+        unlink(temporary);
+    }
     if (rc == 0)
-        puts("The history was restored.");
+        tellReplaced(place, count, "restored", line->dryRun, &kept);
     return rc;
 }
 
@@ -86,75 +105,44 @@ int copyMain(commandLine* line)
 {
     historyPlace* source = &line->place;
     historyPlace* target = &line->target;
-    SQLUH_HANDLE* handle = nullptr;
     char temporary[pathCapacity];
+    keptFiles kept = {};
+    uint32_t count = 0;
     int rc = formTemporary(target->historyPath, temporary);
     if (rc != 0)
         return rc;
     if (isSame(source->directory, target->directory))
         return fail(target->directory, "source and target are the same directory");
-
-    // One lock at a time: keys may clash, and the second lock would then wait for the first.
-    rc = openHistory(source, SQLUH_OPEN_READ, &handle);
-    if (rc == 0) {
-        int copied = sqlocopy(source->historyPath, temporary, 0);
-        if (copied != 0)
-            rc = failWithCode(copied, "copy the history", target->directory);
-        int closed = closeHistory(source, &handle, "close the history");
-        rc = rc != 0 ? rc : closed;
+    if (line->dryRun) {
+        rc = countCommitted(source, "copy the history", &count);
+    } else {
+        // One lock at a time: keys may clash, and the second lock would then wait for the first.
+        rc = copyCommitted(source, temporary, "copy the history", target->directory);
+        if (rc == 0)
+            rc = proveImage(temporary, source->directory, "copy the history", &count);
+        if (rc == 0)
+            rc = installHistory(target, temporary, &kept);
+        unlink(temporary);
     }
-    if (rc == 0 && !isSoundImage(temporary, source->directory, "copy the history"))
-        rc = exitFailed;
     if (rc == 0)
-        rc = installHistory(target, temporary);
-    unlink(temporary);
-    if (rc == 0)
-        puts("The history was copied.");
+        tellReplaced(target, count, "copied", line->dryRun, &kept);
     return rc;
 }
 
-// A backup takes the place of an older one of that name, but neither of the history, which others
-// may be using, nor of a device or a pipe.
-static int checkBackupName(const historyPlace* place, const char* path)
+// --- Backup --------------------------------------------------------------------------------------
+
+// A backup takes the place of an older one of that name only if it is told to, and never that of
+// the history, which others may be using, nor of a device or a pipe.
+static int checkBackupName(const historyPlace* place, const char* path, bool force)
 {
     struct stat there;
     if (isSame(path, place->historyPath) || isSame(path, place->shadowPath))
         return fail(path, "the backup would replace the history itself");
-    if (lstat(path, &there) == 0 && !S_ISREG(there.st_mode))
+    if (lstat(path, &there) != 0)
+        return 0;
+    if (!S_ISREG(there.st_mode))
         return fail(path, "the backup would replace something that is no regular file");
-    return 0;
-}
-
-// Reads the open history piece by piece into the file at path, which is durable afterwards.
-static int writeBackup(SQLUH_HANDLE* handle, const char* path)
-{
-    SQLO_FHANDLE file = sqloNoFile;
-    long long size = 0;
-    unsigned int offset = 0;
-    unsigned int got = pieceLength;
-    uint32_t written = 0;
-    int rc = sqloseek(handle->fileHandle, 0, sqloFromEnd, &size);
-    if (rc == 0 && size > UINT32_MAX)
-        rc = sqloSystemError | EFBIG; // pieces are placed by 32-bit offsets
-    unsigned char* buffer = static_cast<unsigned char*>(malloc(pieceLength));
-    if (rc == 0 && buffer == nullptr)
-        rc = sqloSystemError | ENOMEM;
-    if (rc == 0)
-        rc = sqloopenp(path, sqloOpenNew, sqloPermissions, &file);
-    while (rc == 0 && got == pieceLength) {
-        rc = sqluh_fill_backup_buffer(handle, offset, pieceLength, buffer, &got);
-        if (rc == 0)
-            rc = sqlowrite(file, buffer, got, &written);
-        offset += got;
-    }
-    if (rc == 0)
-        rc = sqlosync(file);
-    if (file.descriptor != sqloNoFile.descriptor) {
-        int closed = sqloclose(file);
-        rc = rc != 0 ? rc : closed;
-    }
-    free(buffer);
-    return rc;
+    return force ? 0 : fail(path, "there is a file of that name; --force replaces it");
 }
 
 // Gives the finished backup its name, durably; a backup of that name is replaced as a whole.
@@ -174,30 +162,49 @@ static int nameBackup(const char* temporary, const char* path)
     return rc;
 }
 
+static int writeOut(const char* path)
+{
+    char buffer[64 * 1024];
+    size_t got;
+    FILE* in = fopen(path, "r");
+    if (in == nullptr)
+        return sqloSystemError | errno;
+    while ((got = fread(buffer, 1, sizeof buffer, in)) > 0)
+        fwrite(buffer, 1, got, stdout);
+    int rc = ferror(in) ? sqloSystemError | errno : 0;
+    fclose(in);
+    return rc != 0 || fflush(stdout) == 0 ? rc : sqloSystemError | errno;
+}
+
 int backupMain(commandLine* line)
 {
     historyPlace* place = &line->place;
     const char* path = line->arguments[0];
-    SQLUH_HANDLE* handle = nullptr;
-    char temporary[pathCapacity];
-    int rc = checkBackupName(place, path);
+    const char* folder = getenv("TMPDIR");
+    bool toOutput = strcmp(path, "-") == 0;
+    char temporary[pathCapacity], where[pathCapacity];
+    uint32_t count = 0;
+    snprintf(where, sizeof where, "%s/zq3hist", folder != nullptr && *folder ? folder : "/tmp");
+    int rc = toOutput ? 0 : checkBackupName(place, path, line->force);
     if (rc == 0)
-        rc = formTemporary(path, temporary);
-    if (rc == 0)
-        rc = openHistory(place, SQLUH_OPEN_READ, &handle);
+        rc = formTemporary(toOutput ? where : path, temporary);
     if (rc != 0)
         return rc;
-    int stored = writeBackup(handle, temporary);
-    rc = closeHistory(place, &handle, "close the history");
-    if (rc == 0 && stored == 0 && !isSoundImage(temporary, place->directory, "back up the history"))
-        rc = exitFailed; // a damaged history must not take the place of a good backup
-    if (rc == 0 && stored == 0)
-        stored = nameBackup(temporary, path);
-    if (rc == 0 && stored != 0)
-        rc = failWithCode(stored, "write the backup", path);
-    if (rc != 0)
-        unlink(temporary);
-    else
-        puts("The history was backed up.");
+    if (line->dryRun) {
+        rc = countCommitted(place, "back up the history", &count);
+    } else {
+        rc = copyCommitted(place, temporary, "back up the history", path);
+        // A damaged history must not take the place of a good backup.
+        if (rc == 0)
+            rc = proveImage(temporary, place->directory, "back up the history", &count);
+        int code = rc != 0 ? 0 : toOutput ? writeOut(temporary) : nameBackup(temporary, path);
+        if (code != 0)
+            rc = failWithCode(code, "write the backup", toOutput ? "standard output" : path);
+        if (rc != 0 || toOutput)
+            unlink(temporary);
+    }
+    if (rc == 0)
+        fprintf(toOutput ? stderr : stdout, "%u entries %sbacked up\n", count,
+                line->dryRun ? "would be " : "");
     return rc;
 }

@@ -1,108 +1,116 @@
 // zq3hist verify: reads every entry of both files and changes nothing.
-#include "admin/zq3hist.h"
+#include "admin/pair.h"
 
-#include <cerrno>
-#include <unistd.h>
+#include <cstdio>
 
-// Reads one file and says what was found. Returns 0 when it is sound, or what is wrong with it.
-static int verifyFile(const char* path, const char* name, SQLUH_WORKAREA* workArea,
-                      entriesReport* entries)
+static const char* const verdictWords[] = {"sound",      "missing", "refused",
+                                           "no history", "damaged", "short"};
+
+static void showFinding(const char* name, const fileFinding* finding, bool isShadow)
 {
-    SQLO_FHANDLE file = sqloNoFile;
-    SQLUH_HEADER header;
-    *entries = {};
-    int rc = sqloopenp(path, sqloOpenRead, sqloPermissions, &file);
-    if (rc != 0) {
-        printf("%s: cannot be opened: %s\n", name, wordsForCode(rc));
-        return rc;
-    }
-    rc = sqluhReadHeader(file, &header);
-    // Text that is no header may read as one of an old version, but for the letter.
-    if (rc == 0 && header.status != statusConsistent && header.status != statusPending &&
-        header.status != statusCommitted)
-        rc = HISTORY_FILE_DAMAGED;
-    bool headerRead = rc == 0;
-    if (headerRead) {
-        readAllEntries(file, workArea, name, entries);
-        rc = entries->rc;
-    }
-    sqloclose(file);
-    if (isSystemCode(rc))
-        printf("%s: cannot be read at offset %lld: %s\n", name, entries->offset, wordsForCode(rc));
-    else if (!headerRead)
-        printf("%s: damaged at offset 0: the header cannot be read\n", name);
-    else if (rc != 0)
-        printf("%s: damaged at offset %lld: entry %u cannot be read\n", name, entries->offset,
+    const SQLUH_HEADER* header = &finding->file.header;
+    const entriesReport* entries = &finding->entries;
+    int rc = finding->file.rc != 0 ? finding->file.rc : entries->rc;
+    printf("%s: ", name);
+    switch (finding->verdict) {
+    case fileMissing:
+        puts("missing");
+        break;
+    case fileRefused:
+        printf("cannot be read at offset %lld: %s\n", entries->offset, wordsForCode(rc));
+        break;
+    case fileNoHistory:
+        puts("damaged at offset 0: the header cannot be read");
+        break;
+    case fileDamaged:
+        printf("damaged at offset %lld: entry %u cannot be read\n", entries->offset,
                entries->count + 1);
-    else if (header.entryCount != entries->count)
-        printf("%s: sound, %u entries; its header counts %u\n", name, entries->count,
-               header.entryCount);
-    else
-        printf("%s: sound, %u entries\n", name, entries->count);
-    return rc;
+        break;
+    case fileShort:
+        printf("ends at offset %lld, after %u of %u entries\n", entries->offset, entries->count,
+               header->entryCount);
+        break;
+    case fileSound:
+        printf("sound, %u entries", entries->count);
+        if (header->status == statusPending)
+            puts(isShadow ? "; the history was made anew from it" : ", and a batch is unfinished");
+        else if (header->entryCount != entries->count)
+            printf("; its header counts %u\n", header->entryCount);
+        else
+            puts("");
+    }
 }
 
-// Whether the system refused to deliver a file that is there.
-static bool isRefused(int rc)
+static void putJsonFinding(jsonWriter* json, const char* key, const fileFinding* finding)
 {
-    return isSystemCode(rc) && rc != (sqloSystemError | ENOENT);
+    beginJson(json, key, '{');
+    putJsonText(json, "verdict", verdictWords[finding->verdict]);
+    putJsonNumber(json, "entryCount", finding->entries.count);
+    if (finding->file.rc == 0) {
+        putJsonBytes(json, "headerStatus", &finding->file.header.status, 1);
+        putJsonNumber(json, "headerEntryCount", finding->file.header.entryCount);
+    }
+    if (finding->verdict != fileMissing)
+        putJsonNumber(json, "endOffset", finding->entries.offset);
+    endJson(json, '}');
 }
 
-static const char* adviceFor(int history, int shadow)
+static void showJsonPair(const historyPlace* place, const pairFinding* pair, bool atWork)
 {
-    // The file may be sound: whoever replaces it from elsewhere may lose entries.
-    if (isRefused(history) || isRefused(shadow))
-        return "what could not be read may be sound; remove the reason that is given, then repeat "
-               "zq3hist verify DIR";
-    if (history == 0) // also when both are sound: it is the one that programs read
-        return "zq3hist restore DIR DIR/" SQLUH_HISTORY_NAME " makes the shadow anew";
-    if (shadow == 0)
-        return "zq3hist restore DIR DIR/" SQLUH_SHADOW_NAME " takes the entries of the shadow";
-    return "zq3hist restore DIR FILE puts a backup in its place";
+    jsonWriter json = {};
+    beginAnswer(&json);
+    putJsonText(&json, "directory", place->directory);
+    putJsonBool(&json, "sound", pair->same);
+    putJsonBool(&json, "writerAtWork", atWork);
+    putJsonFinding(&json, "history", &pair->history);
+    putJsonFinding(&json, "shadow", &pair->shadow);
+    endJsonLine(&json);
 }
 
-static int verifyBoth(const historyPlace* place)
+// The process whose batch is unfinished, if it lives; else 0.
+static int writerOf(const historyPlace* place, const pairFinding* pair)
 {
-    SQLUH_WORKAREA workArea = {};
-    entriesReport inHistory, inShadow;
-    int rc = sqluhInitWorkArea(&workArea, defaultWorkAreaSize);
-    if (rc != 0)
-        return failInPlace(rc, "verify the history", place);
-    int history = verifyFile(place->historyPath, SQLUH_HISTORY_NAME, &workArea, &inHistory);
-    int shadow = verifyFile(place->shadowPath, SQLUH_SHADOW_NAME, &workArea, &inShadow);
-    sqlofmblkEx(workArea.buffer);
-    bool bothSound = history == 0 && shadow == 0;
-    if (bothSound && inHistory.digest == inShadow.digest && inHistory.count == inShadow.count)
+    SQLO_NLCK lock = {};
+    SQLO_NLCKSTATE state = {};
+    bool unfinished = pair->due != sqluhRepairNone && pair->due != sqluhRepairAnew;
+    return unfinished && queryLock(place, &lock, &state) && state.state == sqloNLCKHeld ? state.pid
+                                                                                        : 0;
+}
+
+static int judge(const historyPlace* place, const pairFinding* pair, bool atWork)
+{
+    int writer = writerOf(place, pair);
+    if (atWork) {
+        fail(place->directory, "the history was changed while it was read: verify it again");
+        return exitLocked;
+    }
+    if (writer != 0)
+        fprintf(stderr, "zq3hist: process %d is changing the history; what is committed is sound\n",
+                writer);
+    if (writer != 0 || pair->same)
         return exitDone;
-    if (bothSound)
-        puts("The two files hold different entries.");
     fail(place->directory, "the history is not sound");
-    hint(place, adviceFor(history, shadow));
-    return exitFailed;
+    hintAboutPair(place, pair);
+    return exitDamaged;
 }
 
 int verifyMain(commandLine* line)
 {
     historyPlace* place = &line->place;
-    SQLUH_HANDLE* handle = nullptr;
-    int rc = awaitLock(place, R_OK);
+    pairFinding pair;
+    bool atWork = false;
+    int rc = examineQuietPair(place, true, &pair, &atWork);
     if (rc != 0)
         return rc;
-    // Taking the lock makes a history file where there is none, and verifying must not.
-    if (hasHistoryFile(place)) {
-        rc = sqluhHandleAllocAndInit(place->directory, &handle);
-        if (rc == 0)
-            rc = sqluhLock(handle);
-        rc = rc == 0 ? 0 : failInPlace(rc, "take the lock", place);
+    if (pair.history.verdict == fileMissing && pair.shadow.verdict == fileMissing)
+        return failPair(place, &pair, "verify the history");
+    if (line->json) {
+        showJsonPair(place, &pair, atWork);
+    } else {
+        showFinding(SQLUH_HISTORY_NAME, &pair.history, false);
+        showFinding(SQLUH_SHADOW_NAME, &pair.shadow, true);
+        if (pair.due == sqluhRepairShadow && pair.shadow.verdict == fileSound && !pair.same)
+            puts("The two files hold different entries.");
     }
-    if (rc == 0)
-        rc = verifyBoth(place);
-    if (handle != nullptr) {
-        int unlocked = sqluhUnlock(handle);
-        sqluhHandleFree(&handle);
-        if (rc == 0 && unlocked != 0)
-            rc = failInPlace(unlocked, "release the lock", place);
-    }
-    releaseSignals();
-    return rc;
+    return judge(place, &pair, atWork);
 }

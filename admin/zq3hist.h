@@ -57,6 +57,7 @@ enum : unsigned int {
     optionDryRun = 4096,
     optionForce = 8192,
     optionSkipExisting = 16384,
+    optionAllLocks = 32768, // in place of the directory
 };
 
 // A call of a subcommand.
@@ -88,6 +89,7 @@ int repairMain(commandLine* line);
 int copyMain(commandLine* line);
 int backupMain(commandLine* line);
 int restoreMain(commandLine* line);
+int pruneMain(commandLine* line);
 int unlockMain(commandLine* line);
 
 // Runs the subcommand that argv[1] names and returns its exit status.
@@ -154,17 +156,11 @@ bool queryLock(const historyPlace* place, SQLO_NLCK* lock, SQLO_NLCKSTATE* state
 // missing, when the lock stays busy, or when the wait would never end; else 0.
 int awaitLock(const historyPlace* place, int rights);
 void releaseSignals(void);
+bool isSignalHeld(void); // one of them came meanwhile
 
 // Says why an open failed, telling a repair that failed from a history that is beyond one, and
 // returns the code's exit status.
 int failOpening(int code, const char* what, const historyPlace* place);
-
-// Opens the history, which repairs it if it must. Complains on failure and returns exitFailed. A
-// history that had to be made anew is a failure, too: the handle is then closed.
-int openHistory(historyPlace* place, unsigned int accessMode, SQLUH_HANDLE** handle);
-
-// Closes what openHistory opened. what: the job that fails with the close.
-int closeHistory(const historyPlace* place, SQLUH_HANDLE** handle, const char* what);
 
 // Makes an empty pair of files, under the lock, when the directory has none. Complains on failure
 // and returns exitFailed, else 0.
@@ -217,7 +213,5 @@ void addToReport(entriesReport* report, const SQLUH_ENTRY* entry);
 void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* progress,
                     entriesReport* report);
 
-// Opens a file and reads header and entries. False, having complained, when one of them is damaged
-// or its status is neither blank nor 'C'. name: what the file is called in messages; what: the job
-// that fails.
-bool isSoundImage(const char* path, const char* name, const char* what);
+// Makes the header say of the entries what was found.
+void setTotals(SQLUH_HEADER* header, const entriesReport* totals);

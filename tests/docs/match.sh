@@ -64,7 +64,7 @@ mapfile -t words < <(echo "$commands"; echo "$help" | grep -oP '^  \K--[a-z-]+'
 holds man/zq3hist.1 "${words[@]}"
 mapfile -t words <<<"$commands"
 holds completion/zq3hist.bash "${words[@]}" # options it takes from the help
-mapfile -t texts < <(grep -ohP '(^ *\{"|#define FIELD_\w+ ")\K[A-Z][^"]*' admin/fields.*)
+mapfile -t texts < <(grep -ohP '^ *(\{|[A-Z]+\()"\K[A-Z][^"]*' admin/fields.cpp)
 holds man/zq3hist.1 "${texts[@]}"
 
 # zq3rhist(5) and the log records.

@@ -1,0 +1,272 @@
+// The subcommands that change a history, on sound pairs and on broken ones.
+#include <regex>
+
+#include "tests/admin/program.h"
+
+static const char week[] = "Operation: backup\nTimestamp: 20250105010000\nTablespace: A\n\n"
+                           "Operation: backup\nType: delta\nTimestamp: 20250106010000\n"
+                           "Tablespace: A\n\n"
+                           "Operation: backup\nTimestamp: 20250107010000\nTablespace: A\n";
+static const char more[] = "Operation: backup\nTimestamp: 20250108010000\nTablespace: A\n";
+
+// Each entry of the week takes 779 bytes, after a header of 1024.
+#define SPOIL(file, at)                                                                            \
+    "printf '\\377' | dd of=h/zq3rhist." file " seek=" at " bs=1 conv=notrunc status=none; "
+#define CUT(file, size) "truncate -s " size " h/zq3rhist." file "; "
+#define KILLED "killed" // a batch of a process that was killed; its lock is there
+
+class ChangeTest : public ProgramTest
+{
+  protected:
+    std::string history, shadow;
+    int followed = 0; // hints
+
+    void follow(const std::string& arguments, std::string* trace);
+
+    ChangeTest()
+    {
+        fs::create_directory(root + "bin");
+        fs::create_symlink(ZQ3HIST, root + "bin/zq3hist");
+        setenv("PATH", (root + "bin:" + getenv("PATH")).c_str(), 1);
+        EXPECT_EQ("3 entries appended\n[0]", run("load h/", week));
+        EXPECT_EQ("3 entries backed up\n[0]", run("backup h/ image"));
+        history = slurp(historyPath);
+        shadow = slurp(shadowPath);
+        spill(root + "more", more);
+    }
+
+    // Half a batch of a process that ends with the lock in its hands.
+    void killWriter()
+    {
+        pid_t child = fork();
+        if (child == 0) {
+            SQLUH_HANDLE* handle = nullptr;
+            entryBuilder entry;
+            sqluhBeginBatch(&handle, directory.data());
+            sqloseek(handle->fileHandle, 0, sqloFromEnd, nullptr);
+            sqluhWriteEntry(handle, entry.build());
+            _exit(0);
+        }
+        waitpid(child, nullptr, 0);
+    }
+
+    // Puts the pair of the week there and does to it what state says.
+    void prepare(const std::string& state)
+    {
+        removeLockSet(historyPath);
+        for (const fs::path& file : fs::directory_iterator(directory))
+            fs::remove(file);
+        fs::remove(root + "new");
+        spill(historyPath, history);
+        spill(shadowPath, shadow);
+        if (state == KILLED)
+            killWriter();
+        else
+            EXPECT_EQ(0, system(("cd " + root + "; :; " + state).c_str()));
+    }
+
+    // How many entries of a file can be read; x: not even its header; -: there is no file.
+    static std::string entriesIn(const std::string& path)
+    {
+        SQLO_FHANDLE file = sqloNoFile;
+        SQLUH_HEADER header;
+        SQLUH_WORKAREA workArea = {};
+        int count = 0;
+        if (sqloopenp(path.c_str(), sqloOpenRead, 0, &file) != 0)
+            return "-";
+        bool readable = sqluhReadHeader(file, &header) == 0;
+        EXPECT_EQ(0, sqluhInitWorkArea(&workArea, defaultWorkAreaSize));
+        while (readable && sqluhVerifyOneEntry(file, &workArea) == 0)
+            count++;
+        sqlofmblkEx(workArea.buffer);
+        sqloclose(file);
+        return readable ? std::to_string(count) : "x";
+    }
+
+    // Entries in history file, shadow and other files of the directory.
+    std::string entriesThere()
+    {
+        std::string there = entriesIn(historyPath) + " " + entriesIn(shadowPath);
+        std::vector<std::string> kept;
+        for (const fs::path& file : fs::directory_iterator(directory))
+            if (file != historyPath && file != shadowPath)
+                kept.push_back(file);
+        std::sort(kept.begin(), kept.end());
+        for (const std::string& file : kept)
+            there += " " + entriesIn(file);
+        return there;
+    }
+
+    std::string runStamped(const std::string& arguments)
+    {
+        static const std::regex stamp("\\.(asc|bak)\\.[0-9]{14}(\\.2)?");
+        return std::regex_replace(run(arguments), stamp, ".$1.STAMP");
+    }
+};
+
+#define KEPT(file) "The old file is kept as h/zq3rhist." file ".STAMP\n"
+#define FROM_SHADOW "zq3hist: hint: zq3hist repair h/  # takes the entries of the shadow\n[3]"
+
+TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
+{
+    const struct {
+        const char* state;
+        const char* arguments;
+        const char* output;
+        const char* there; // entries in history file, shadow, and files that are kept
+    } rows[] = {
+        {"", "load --dry-run h/ more", "1 entries would be appended\n[0]", "3 3"},
+        {"", "load h/ more", "1 entries appended\n[0]", "4 4"},
+        {"cat more >>in; ", "load --skip-existing h/ more",
+         "1 entries appended, 0 that were there left out\n[0]", "4 4"},
+        {"zq3hist dump h >all; ", "load --skip-existing h/ all",
+         "0 entries appended, 3 that were there left out\n[0]", "3 3"},
+        {SPOIL("asc", "2000"), "load h/ more",
+         "zq3hist: cannot append to the history: the history is damaged, h/\n"
+         "zq3hist: hint: zq3hist verify h/  # names the damage and what mends it\n[3]",
+         "1 3"},
+        {CUT("asc", "1803"), "load h/ more",
+         "zq3hist: cannot append to the history: the file ends after 1 of 3 entries, "
+         "h/zq3rhist.asc\n" FROM_SHADOW,
+         "1 3"},
+        {CUT("asc", "1803") CUT("bak", "1803"), "verify h/",
+         "zq3rhist.asc: ends at offset 1803, after 1 of 3 entries\n"
+         "zq3rhist.bak: ends at offset 1803, after 1 of 3 entries\n"
+         "zq3hist: the history is not sound, h/\n"
+         "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "
+         "--force h/ goes on with what can be read\n[3]",
+         "1 1"},
+        {CUT("asc", "1803") CUT("bak", "2582"), "repair --force h/",
+         "Neither file is whole; a history of what can be read was made: 2 entries\n" KEPT("asc")
+             KEPT("bak") "[0]",
+         "2 2 1 2"},
+        {SPOIL("asc", "10") SPOIL("bak", "10"), "repair h/",
+         "zq3hist: cannot repair the history: the file is no history, h/zq3rhist.asc\n"
+         "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "
+         "--force h/ goes on with what can be read\n[3]",
+         "x x"},
+        {SPOIL("asc", "10") SPOIL("bak", "10"), "backup h/ new",
+         "zq3hist: cannot back up the history: the file is no history, h/zq3rhist.asc\n"
+         "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "
+         "--force h/ goes on with what can be read\n[3]",
+         "x x"},
+        {SPOIL("asc", "2000"), "repair --dry-run h/",
+         "The history file would be made anew from the shadow: 3 entries\n[0]", "1 3"},
+        {SPOIL("asc", "2000"), "repair h/",
+         "The history file was made anew from the shadow: 3 entries\n" KEPT("asc") "[0]", "3 3 1"},
+        {SPOIL("bak", "2000"), "repair h/",
+         "The shadow was made anew from the history file: 3 entries\n" KEPT("bak") "[0]", "3 3 1"},
+        {"rm h/zq3rhist.asc; ", "repair h/",
+         "The history file was made anew from the shadow: 3 entries\n[0]", "3 3"},
+        {SPOIL("asc", "2000"), "repair --json h/",
+         "{\"format\":1,\"directory\":\"h/\",\"dryRun\":false,\"madeAnew\":\"history\","
+         "\"entryCount\":3,\"keptFiles\":[\"h/zq3rhist.asc.STAMP\"]}\n[0]",
+         "3 3 1"},
+        {KILLED, "repair h/",
+         "zq3hist: cannot take the lock: a process died while it held the lock, h/\n"
+         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and settles "
+         "what is unfinished\n[4]",
+         "4 3"},
+        {"", "backup h/ image",
+         "zq3hist: there is a file of that name; --force replaces it, image\n[1]", "3 3"},
+        {"", "backup --force h/ image", "3 entries backed up\n[0]", "3 3"},
+        {"", "backup --dry-run h/ new", "3 entries would be backed up\n[0]", "3 3"},
+        {SPOIL("asc", "2000"), "backup h/ new; cmp new image",
+         "3 entries backed up\nzq3hist: warning: only zq3rhist.bak is whole\n"
+         "zq3hist: hint: zq3hist repair h/  # takes the entries of the shadow\n[0]",
+         "1 3"},
+        {"", "backup h/ - >new; cmp new image", "3 entries backed up\n[0]", "3 3"},
+        {"zq3hist load h more >new; ", "restore --dry-run h/ image",
+         "3 entries would be restored\nThe 4 entries that are there would be kept\n[0]", "4 4"},
+        {"zq3hist load h more >new; ", "restore h/ image",
+         "3 entries restored\n" KEPT("asc") KEPT("bak") "[0]", "3 3 4 4"},
+        {"rm h/*; ", "restore h/ image", "3 entries restored\n[0]", "3 3"},
+        {CUT("bak", "1803"), "restore h/ h/zq3rhist.bak",
+         "zq3hist: cannot restore the history: the file ends after 1 of 3 entries, "
+         "h/zq3rhist.bak\n[3]",
+         "3 1"},
+        {"", "prune --before 20250107000000 h/",
+         "2 of 3 entries removed, those before 20250107000000; 1 stay\n" KEPT("asc")
+             KEPT("bak") "[0]",
+         "1 1 3 3"},
+        {"", "prune --before '2025-01-06 01:00:00' h/",
+         "0 of 3 entries removed, those before 20250105010000; 3 stay\n"
+         "The entries from 20250105010000 on stay because the image 20250106010000 needs "
+         "them\n[0]",
+         "3 3"},
+        {"", "prune --dry-run --before 20250107000000 h/",
+         "2 of 3 entries would be removed, those before 20250107000000; 1 would stay\n[0]", "3 3"},
+        {SPOIL("bak", "2000"), "prune --before 20250107000000 h/",
+         "zq3hist: cannot prune the history: the entry at offset 1803 is damaged, h/zq3rhist.bak\n"
+         "zq3hist: hint: zq3hist repair h/  # makes the shadow anew from the history file\n[3]",
+         "3 1"},
+    };
+    for (const auto& row : rows) {
+        prepare(row.state);
+        EXPECT_EQ(row.output, runStamped(row.arguments)) << row.state << row.arguments;
+        EXPECT_EQ(row.there, entriesThere()) << row.state << row.arguments;
+    }
+    for (const fs::path& file : fs::recursive_directory_iterator(root))
+        EXPECT_NE(".tmp", file.extension());
+}
+
+// Types a command and what its hints say, at most four times.
+void ChangeTest::follow(const std::string& arguments, std::string* trace)
+{
+    std::string typed = "zq3hist " + arguments;
+    for (int step = 0; step < 5; step++) {
+        std::smatch hint;
+        int rc = system(("cd " + root + "; (" + typed + ") >out 2>err").c_str());
+        std::string said = slurp(root + "err");
+        *trace += "\n$ " + typed + "\n" + slurp(root + "out") + said + "[" +
+                  std::to_string(WEXITSTATUS(rc)) + "]";
+        if (!std::regex_search(said, hint, std::regex("hint: (.*?)  #")))
+            return;
+        typed = std::regex_replace(hint[1].str(), std::regex("FILE"), "image");
+        followed++;
+    }
+    ADD_FAILURE() << "hints without end\n" << *trace;
+}
+
+// Every hint is a command: followed until there is none, it leads to a sound history that has lost
+// nothing.
+TEST_F(ChangeTest, FollowedHintsMendTheHistory)
+{
+    static const char* const states[] = {
+        "",
+        SPOIL("asc", "10"),
+        SPOIL("bak", "10"),
+        SPOIL("asc", "10") SPOIL("bak", "10"),
+        SPOIL("asc", "2000"),
+        SPOIL("bak", "2000"),
+        SPOIL("asc", "2000") SPOIL("bak", "1100"),
+        CUT("asc", "1803"),
+        CUT("bak", "1803"),
+        CUT("asc", "1803") CUT("bak", "1803"),
+        CUT("asc", "0"),
+        CUT("asc", "2000"),
+        "rm h/zq3rhist.asc; ",
+        "rm h/zq3rhist.bak; ",
+        "rm h/*; ",
+        KILLED,
+    };
+    static const char* const commands[] = {"verify h/",      "status h/",     "load h/ more",
+                                           "dump h/",        "backup h/ new", "repair h/",
+                                           "copy h/ target", "images h/"};
+    fs::create_directory(root + "target");
+    for (const char* state : states)
+        for (const char* command : commands) {
+            if (std::string(state) + command == "rm h/*; load h/ more")
+                continue; // it begins a history
+            prepare(state);
+            std::string trace = state;
+            follow(command, &trace);
+            follow("verify h/", &trace);
+            EXPECT_TRUE(std::regex_match(run("verify h/"),
+                                         std::regex("zq3rhist.asc: sound, ([34]) entries\n"
+                                                    "zq3rhist.bak: sound, \\1 entries.*\n\\[0\\]")))
+                << trace << "\n"
+                << run("verify h/");
+        }
+    printf("%d hints followed\n", followed);
+}
