@@ -17,13 +17,21 @@ struct sqluhChunk {
     size_t size;
 };
 
-// The tablespace lines of an entry, as they stand in the file.
+// The tablespace lines of an entry, as they stand in the file, after it. Before them, for each
+// name, where it begins in the lines and how long it is up to the first zero byte, if any.
+struct sqluhName {
+    uint32_t at;
+    uint32_t length;
+};
 struct sqluhNameList {
     uint32_t count;
     uint32_t length; // of the lines in bytes
-    bool zeroFree;   // no name ends early
-    char* lines;
+    const char* lines;
 };
+static const sqluhName* namesOf(const sqluhNameList* list)
+{
+    return reinterpret_cast<const sqluhName*>(list + 1);
+}
 
 // A text that ends a line of the record or stands on one.
 struct packedText {
@@ -111,16 +119,29 @@ static bool listsSame(const sqluhNameList* list, const char* lines, size_t room,
            memcmp(list->lines, lines, list->length) == 0;
 }
 
+// Makes a list of proven lines.
 static const sqluhNameList* makeNames(sqluhRows* rows, const char* lines, uint32_t length,
                                       uint32_t count, int* rc)
 {
-    void* space = takeSpace(rows, sizeof(sqluhNameList) + length, rc);
+    size_t headLength = sizeof(sqluhNameList) + count * sizeof(sqluhName);
+    void* space = takeSpace(rows, headLength + length, rc);
     if (space == nullptr)
         return nullptr;
     sqluhNameList* list = static_cast<sqluhNameList*>(space);
-    *list = {count, length, memchr(lines, '\0', length) == nullptr,
-             reinterpret_cast<char*>(list + 1)};
-    memcpy(list->lines, lines, length);
+    sqluhName* names = reinterpret_cast<sqluhName*>(list + 1);
+    char* copy = reinterpret_cast<char*>(names + count);
+    *list = {count, length, copy};
+    memcpy(copy, lines, length);
+
+    uint64_t head = 0;
+    uint64_t characters = noTablespaceLength;
+    const char* at = copy;
+    for (uint32_t i = 0; i < count && tablespaceFits(at, copy + length, &head, &characters); i++) {
+        const char* name = at + tablespaceNameAt;
+        names[i] = {static_cast<uint32_t>(name - copy),
+                    static_cast<uint32_t>(strnlen(name, static_cast<size_t>(characters)))};
+        at = name + characters + 1;
+    }
     return list;
 }
 
@@ -171,6 +192,9 @@ static int shareEvent(sqluhRows* rows, const char* line, const sqlca** event)
 
 static uint32_t lengthWithoutBlanks(const char* text, uint32_t length)
 {
+    static constexpr uint64_t blanks = 0x2020202020202020; // most lines are nothing else
+    while (length >= sizeof blanks && columnsAt(text + length - sizeof blanks) == blanks)
+        length -= static_cast<uint32_t>(sizeof blanks);
     while (length > 0 && text[length - 1] == ' ')
         length--;
     return length;
@@ -218,7 +242,7 @@ static char* packTexts(sqluhRow* row, const char* record, const sqluhProvenEntry
     bool named = row->entry.qualifierLength != 0 || row->entry.nameLength != 0;
     for (unsigned int field = fieldObjectPart; field < fieldAuxCode; field++) {
         const char* word = wordOfField(&proven->fixed.words, field);
-        size_t length = field == fieldLogPosition ? 0 : strlen(word);
+        size_t length = lengthOfWord(word, entryFields[field].kind);
         row->wordLength[field - fieldObjectPart] = static_cast<uint8_t>(length);
         memcpy(at, word, length);
         at += length;
@@ -289,22 +313,14 @@ static uint32_t writtenLength(packedText packed, uint32_t stated)
     return stated >= packed.stored && stated <= lineTextLength ? stated : packed.stored;
 }
 
-static void unpackNames(zq3HistoryData* data, const sqluhNameList* names)
+static void unpackNames(zq3HistoryData* data, const sqluhNameList* list)
 {
-    uint32_t stored = data->tablespaceBuffers == nullptr            ? 0
-                      : data->numTablespaces < data->maxTablespaces ? data->numTablespaces
-                                                                    : data->maxTablespaces;
-    const char* at = names->lines;
-    const char* end = at + names->length;
-    uint64_t head = 0;
-    uint64_t length = noTablespaceLength;
-    for (uint32_t i = 0; i < stored && tablespaceFits(at, end, &head, &length); i++) {
-        const char* name = at + tablespaceNameAt;
-        size_t characters = static_cast<size_t>(length);
-        copyText(&data->tablespaceBuffers[i], name,
-                 names->zeroFree ? characters : strnlen(name, characters));
-        at = name + characters + 1;
-    }
+    const sqluhName* names = namesOf(list);
+    uint32_t stored = data->tablespaceBuffers == nullptr   ? 0
+                      : list->count < data->maxTablespaces ? list->count
+                                                           : data->maxTablespaces;
+    for (uint32_t i = 0; i < stored; i++)
+        copyText(&data->tablespaceBuffers[i], list->lines + names[i].at, names[i].length);
 }
 
 static char letterOf(char written, bool asWritten)
@@ -338,15 +354,10 @@ static const char* unpackWords(const sqluhRow* row, zq3HistoryData* data)
 {
     const char* at = reinterpret_cast<const char*>(row + 1);
     for (unsigned int field = fieldObjectPart; field < fieldAuxCode; field++) {
-        char word[fixedWordCapacity];
+        char* member = reinterpret_cast<char*>(data) + entryFields[field].member;
         uint8_t length = row->wordLength[field - fieldObjectPart];
-        if (field == fieldLogPosition)
-            continue;
-        memcpy(word, at, length);
-        word[length] = '\0';
-        copyWord(reinterpret_cast<textBuffer*>(reinterpret_cast<char*>(data) +
-                                               entryFields[field].member),
-                 word, entryFields[field].kind);
+        if (field != fieldLogPosition)
+            copyText(reinterpret_cast<textBuffer*>(member), at, length);
         at += length;
     }
     return at;

@@ -226,7 +226,7 @@ static void takeLine2(zq3HistoryData* data, const sqluhFixedWords* words)
         if (row.kind == kindLogPosition)
             sqluhParseLogPosition(word, data->logPosition);
         else
-            copyWord(reinterpret_cast<textBuffer*>(member), word, row.kind);
+            copyText(reinterpret_cast<textBuffer*>(member), word, lengthOfWord(word, row.kind));
     }
 }
 

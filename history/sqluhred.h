@@ -63,11 +63,15 @@ static inline void copyText(textBuffer* target, const char* text, size_t length)
     target->data[copied] = '\0';
 }
 
-// Copies a word, or the empty text for what stands in the file for it.
-static inline void copyWord(textBuffer* target, const char* word, sqluhFieldKind kind)
+// The length of the text that a field's word stands for: 0 for what stands in the file for none,
+// and for the log position, which is no text.
+static inline size_t lengthOfWord(const char* word, sqluhFieldKind kind)
 {
-    const char* empty = kind == kindTimestamp ? SQLUH_EMPTY_TIMESTAMP : SQLUH_EMPTY_WORD;
-    copyText(target, word, strcmp(word, empty) == 0 ? 0 : strlen(word));
+    if (kind == kindLogPosition)
+        return 0;
+    return strcmp(word, kind == kindTimestamp ? SQLUH_EMPTY_TIMESTAMP : SQLUH_EMPTY_WORD) == 0
+               ? 0
+               : strlen(word);
 }
 
 // For a head that is no number: does not fit, whatever room there is.
