@@ -64,8 +64,10 @@ void nextSample(sampleEntry* sample, uint32_t index);
 // The timestamp of the index-th entry.
 std::string sampleTimestamp(uint32_t index);
 
-// Makes a directory with a sound pair of files. Returns the directory, with its separator.
-std::string makeHistory(const std::string& parent, uint32_t entries, uint32_t tablespaces);
+// Makes a directory with a sound pair of files. different: no two entries list the same
+// tablespaces. Returns the directory, with its separator.
+std::string makeHistory(const std::string& parent, uint32_t entries, uint32_t tablespaces,
+                        bool different = false);
 
 std::string sizeName(uint32_t entries, uint32_t tablespaces); // as 100000x50
 std::string historyFileOf(const std::string& directory);

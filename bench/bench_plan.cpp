@@ -1,16 +1,20 @@
-// The whole command: start, scan, plan, report, on large histories and on their doubles.
+// The whole command: start, read, plan, report, on small and large histories and on their doubles.
+// If BENCH_EARLIER names the planner of another build, also against that one.
 
 #include "bench/bench.h"
 
 #include <fcntl.h>
 #include <spawn.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 
 #include <cstdio>
 #include <cstdlib>
 
-// Runs a program with its standard output discarded and returns its wait status.
-static int run(std::vector<std::string> words)
+// Runs a program with its standard output discarded and returns its wait status. usage: null, or
+// what it used.
+static int run(std::vector<std::string> words, rusage* usage = nullptr)
 {
     std::vector<char*> arguments;
     for (std::string& word : words)
@@ -22,7 +26,7 @@ static int run(std::vector<std::string> words)
     pid_t pid = 0;
     int status = posix_spawnp(&pid, arguments[0], &actions, nullptr, arguments.data(), environ);
     posix_spawn_file_actions_destroy(&actions);
-    if (status == 0 && waitpid(pid, &status, 0) == -1)
+    if (status == 0 && wait4(pid, &status, 0, usage) == -1)
         status = -1;
     return status;
 }
@@ -35,51 +39,98 @@ static void addRun(const std::string& name, const std::vector<std::string>& word
     });
 }
 
-// A history in the place where the planner finds it, and the plan of its last image.
-static std::string addPlan(const std::string& directory, uint32_t entries, uint32_t tablespaces)
+// A history in the place where the planner finds it.
+struct placedHistory {
+    std::string size;                // as its benchmarks are called
+    std::string file;                // the history file
+    std::vector<std::string> planIt; // the planner's arguments
+};
+
+static placedHistory placeHistory(const std::string& directory, uint32_t entries,
+                                  uint32_t tablespaces, bool different = false)
 {
     static int made = 0;
     std::string alias = "BENCH" + std::to_string(++made);
     std::string placed = directory + alias;
-    check(rename(makeHistory(directory, entries, tablespaces).c_str(), placed.c_str()), "rename");
-    addRun("plan/" + sizeName(entries, tablespaces),
-           {BENCH_PLANNER, "-d", alias, "-t", sampleTimestamp(entries - 1)});
-    return historyFileOf(placed + "/");
+    std::string history = makeHistory(directory, entries, tablespaces, different);
+    check(rename(history.c_str(), placed.c_str()), "rename");
+    return {sizeName(entries, tablespaces) + (different ? ", lists differ" : ""),
+            historyFileOf(placed + "/"),
+            {"-d", alias, "-t", sampleTimestamp(entries - 1)}};
 }
 
-static void addSize(const std::string& directory, uint32_t entries, uint32_t tablespaces,
-                    std::vector<ratioRow>* rows)
+static std::vector<std::string> commandOf(const char* planner, const placedHistory& history)
 {
-    std::string size = sizeName(entries, tablespaces);
-    std::string moreEntries = sizeName(2 * entries, tablespaces);
-    std::string moreNames = sizeName(entries, 2 * tablespaces);
-    std::string file = addPlan(directory, entries, tablespaces);
-    addPlan(directory, 2 * entries, tablespaces);
-    addPlan(directory, entries, 2 * tablespaces);
+    std::vector<std::string> words = {planner};
+    words.insert(words.end(), history.planIt.begin(), history.planIt.end());
+    return words;
+}
+
+// The plan of the history's last image. aim: against the earlier planner.
+static void addPlan(const placedHistory& history, const char* aim, std::vector<ratioRow>* rows)
+{
+    const char* earlier = getenv("BENCH_EARLIER");
+    std::string plan = "plan/" + history.size, before = "earlier plan/" + history.size;
+    addRun(plan, commandOf(BENCH_PLANNER, history));
+    if (earlier == nullptr)
+        return;
+    addRun(before, commandOf(earlier, history));
+    rows->push_back({"plan, " + history.size, plan, before, aim});
+}
+
+// A planner needs the same memory each time. aim: in MB.
+static void showMemory(const placedHistory& history, int aim)
+{
+    rusage usage = {};
+    struct stat file = {};
+    check(run(commandOf(BENCH_PLANNER, history), &usage), BENCH_PLANNER);
+    check(stat(history.file.c_str(), &file), "stat");
+    printf("| %s | %ld MB | %ld MB | %d MB |\n", history.size.c_str(),
+           static_cast<long>(usage.ru_maxrss / 1024), static_cast<long>(file.st_size >> 20), aim);
+}
+
+static void addLarge(const std::string& directory, uint32_t entries, uint32_t tablespaces,
+                     std::vector<ratioRow>* rows)
+{
+    placedHistory history = placeHistory(directory, entries, tablespaces);
+    placedHistory moreEntries = placeHistory(directory, 2 * entries, tablespaces);
+    placedHistory moreNames = placeHistory(directory, entries, 2 * tablespaces);
+    std::string size = history.size, file = history.file, plan = "plan/" + size;
+    addPlan(history, "0.4", rows);
+    addPlan(moreEntries, "0.4", rows);
+    addPlan(moreNames, "0.4", rows);
+    showMemory(history, 40);
     addBenchmark("floor/" + size, 1, benchmark::kMillisecond, [=](benchmark::State& state) {
         for (auto _ : state)
             benchmark::DoNotOptimize(readFloor(file));
     });
     addRun("cksum/" + size, {"cksum", file});
-    rows->push_back({"plan, " + size, "plan/" + size, "floor/" + size, "6"});
-    rows->push_back({"plan, " + size, "plan/" + size, "cksum/" + size, ""});
+    rows->push_back({"plan, " + size, plan, "floor/" + size, "6"});
+    rows->push_back({"plan, " + size, plan, "cksum/" + size, ""});
 #ifdef BENCH_SQLITE
     std::string table = makeTable(directory, entries, tablespaces);
     addBenchmark("SQLite scan/" + size, 1, benchmark::kMillisecond, [=](benchmark::State& state) {
         for (auto _ : state)
             check(scanTable(table) != entries, "SQLite scan");
     });
-    rows->push_back({"plan, " + size, "plan/" + size, "SQLite scan/" + size, "0.8"});
+    rows->push_back({"plan, " + size, plan, "SQLite scan/" + size, "0.5"});
 #endif
-    rows->push_back({"plan, twice the entries", "plan/" + moreEntries, "plan/" + size, "2.2"});
-    rows->push_back({"plan, twice the names", "plan/" + moreNames, "plan/" + size, "2.2"});
+    rows->push_back({"plan, twice the entries", "plan/" + moreEntries.size, plan, "2.2"});
+    rows->push_back({"plan, twice the names", "plan/" + moreNames.size, plan, "2.2"});
 }
 
 static void prepare(const std::string& directory, std::vector<ratioRow>* rows)
 {
     setenv("ZQ3DBPATH", directory.c_str(), 1);
-    addSize(directory, 100000, 50, rows);
-    addSize(directory, 5000, 1000, rows);
+    printf("\n### Memory of the whole command\n\n| History | Peak | File | Aim "
+           "|\n|---|---|---|---|\n");
+    addLarge(directory, 100000, 50, rows);
+    addLarge(directory, 5000, 1000, rows);
+    placedHistory different = placeHistory(directory, 100000, 50, true);
+    showMemory(different, 250);
+    addPlan(different, "1", rows);
+    addPlan(placeHistory(directory, 1000, 50), "0.6", rows);
+    addPlan(placeHistory(directory, 20, 50), "0.9", rows);
 }
 
 int main(int argc, char** argv)

@@ -137,14 +137,26 @@ std::string historyFileOf(const std::string& directory)
     return directory + SQLUH_HISTORY_NAME;
 }
 
+// Names the last tablespace anew; the last entry, which a plan starts from, does without it.
+static void makeDifferent(sampleEntry* sample, uint32_t index, uint32_t entries)
+{
+    uint32_t last = sample->data.maxTablespaces - 1;
+    snprintf(&sample->slots[last * slotSize], slotSize, "TX%08u", index);
+    setText(&sample->names[last], &sample->slots[last * slotSize]);
+    sample->data.numTablespaces -= index == entries - 1;
+}
+
 // Through a handle that nobody else can know yet: a lock and a batch would only copy the file.
-static void writeEntries(SQLUH_HANDLE* handle, uint32_t entries, uint32_t tablespaces)
+static void writeEntries(SQLUH_HANDLE* handle, uint32_t entries, uint32_t tablespaces,
+                         bool different)
 {
     sampleEntry sample;
     initSample(&sample, tablespaces);
     handle->replayArea.replayDisabled = 1;
     for (uint32_t i = 0; i < entries; i++) {
         nextSample(&sample, i);
+        if (different)
+            makeDifferent(&sample, i, entries);
         check(sqluhWriteEntry(handle, &sample.entry), "sqluhWriteEntry");
     }
     handle->header.entryCount = entries;
@@ -152,7 +164,8 @@ static void writeEntries(SQLUH_HANDLE* handle, uint32_t entries, uint32_t tables
     check(sqluhWriteHeader(handle->fileHandle, &handle->header), "sqluhWriteHeader");
 }
 
-std::string makeHistory(const std::string& parent, uint32_t entries, uint32_t tablespaces)
+std::string makeHistory(const std::string& parent, uint32_t entries, uint32_t tablespaces,
+                        bool different)
 {
     std::string directory = parent + sizeName(entries, tablespaces) + "/";
     mkdir(directory.c_str(), 0750);
@@ -162,7 +175,7 @@ std::string makeHistory(const std::string& parent, uint32_t entries, uint32_t ta
     check(sqloopenp(handle->historyPath, sqloOpenUpdate, sqloPermissions, &handle->fileHandle),
           "sqloopenp");
     check(sqluhReadHeader(handle->fileHandle, &handle->header), "sqluhReadHeader");
-    writeEntries(handle, entries, tablespaces);
+    writeEntries(handle, entries, tablespaces, different);
     check(sqloclose(handle->fileHandle), "sqloclose");
     check(sqlocopy(handle->historyPath, handle->shadowPath, 0), "sqlocopy");
     sqluhHandleFree(&handle);
