@@ -1,6 +1,7 @@
 // The restore order report.
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 
 #include "tool/zq3ckrst.h"
 
@@ -32,6 +33,11 @@ static int selectTablespaces(const restorePlan* plan, int row)
     size_t columns = static_cast<size_t>(plan->numTablespaces);
     const char* cells = plan->matrix + static_cast<size_t>(row) * columns;
     int count = 0;
+    // Nothing is needed from most images: all cells are like the one before, and the first unused.
+    if (cells[0] == cellUnused && memcmp(cells, cells + 1, columns - 1) == 0) {
+        memset(plan->selected, 0, columns);
+        return 0;
+    }
     for (size_t i = 0; i < columns; i++) {
         plan->selected[i] = cells[i] != cellUnused ? 1 : 0;
         count += cells[i] != cellUnused;

@@ -171,6 +171,12 @@ struct nameChange {
     char newName[nameSize];
 };
 
+// What the table makes of the name that the list looked at last had in one of its slots.
+struct slotEffect {
+    char name[nameSize];
+    int effect; // -1: none
+};
+
 // The renames met so far on the walk, newest first, and the table of their effect.
 struct renameWalk {
     nameChange* renames;
@@ -178,8 +184,10 @@ struct renameWalk {
     nameChange* effects;
     int numEffects;
     size_t buckets; // of effects
-    int numLists;   // looked at so far
-    bool oneByOne;  // a rename concerns ***
+    slotEffect* slots;
+    uint32_t numSlots; // whose effects hold
+    int numLists;      // looked at so far
+    bool oneByOne;     // a rename concerns ***
 };
 
 static bool isRename(const historyEntry* entry)
@@ -236,6 +244,21 @@ static void addRename(renameWalk* walk, const historyEntry* entry)
     setEffect(walk, rename->newName, DELETED_RENAMED);
     if (strcmp(rename->name, rename->newName) != 0)
         setEffect(walk, rename->name, newest);
+    walk->numSlots = 0;
+}
+
+// The effect on the name in a slot, slots being taken in order. Lists mostly differ in few names,
+// so the effect is mostly that on the last list's name.
+static int effectInSlot(renameWalk* walk, uint32_t number, const char* name)
+{
+    slotEffect* slot = &walk->slots[number];
+    if (number < walk->numSlots && memcmp(slot->name, name, nameSize) == 0)
+        return slot->effect;
+    if (number == walk->numSlots)
+        walk->numSlots++;
+    memcpy(slot->name, name, nameSize);
+    slot->effect = findName(walk->effects, walk->buckets, name);
+    return slot->effect;
 }
 
 // Tells how many of the entry's names the table changes; -1 when one of them is there twice.
@@ -244,7 +267,7 @@ static int countChanges(renameWalk* walk, const historyEntry* entry)
     int changes = 0;
     walk->numLists++;
     for (uint32_t i = 0; i < entry->numTablespaces; i++) {
-        int effect = findName(walk->effects, walk->buckets, entry->tablespaceNames[i]);
+        int effect = effectInSlot(walk, i, entry->tablespaceNames[i]);
         if (effect < 0)
             continue;
         if (walk->effects[effect].seenIn == walk->numLists)
@@ -264,7 +287,7 @@ static void makeChanges(renameWalk* walk, historyEntry* entry, int changes)
         return;
     }
     for (uint32_t i = 0; i < entry->numTablespaces && changes > 0; i++) {
-        int effect = findName(walk->effects, walk->buckets, entry->tablespaceNames[i]);
+        int effect = walk->slots[i].effect;
         if (effect < 0)
             continue;
         copyName(entry->tablespaceNames[i], walk->effects[effect].newName);
@@ -305,18 +328,36 @@ static size_t countRenames(const historyData* data)
     return numRenames;
 }
 
-// Allocates a walk for so many renames, in one block that starts with walk->renames. False: no
-// memory.
-static bool initWalk(renameWalk* walk, size_t numRenames)
+// Sets all lists before the target to not renamed. Returns the length of the longest.
+static size_t resetLists(const historyData* data)
 {
+    size_t most = 0;
+    for (int i = 0; i < data->backupIndex; i++) {
+        nameList* list = namesOf(&data->entries[i]);
+        if (list == nullptr)
+            continue;
+        list->renamedBy = 0;
+        if (list->count > most)
+            most = list->count;
+    }
+    return most;
+}
+
+// Allocates a walk over lists of so many names at most, in one block that starts with
+// walk->renames. False: no memory.
+static bool initWalk(renameWalk* walk, size_t numRenames, size_t mostNames)
+{
+    static_assert(sizeof(slotEffect) <= sizeof(nameChange));
     *walk = {};
     if (numRenames > INT_MAX / 2)
         return false;
-    walk->renames = static_cast<nameChange*>(calloc(3 * numRenames, sizeof(nameChange)));
+    walk->renames =
+        static_cast<nameChange*>(calloc(3 * numRenames + mostNames, sizeof(nameChange)));
     if (walk->renames == nullptr)
         return false;
     walk->effects = walk->renames + numRenames;
     walk->buckets = 2 * numRenames;
+    walk->slots = reinterpret_cast<slotEffect*>(walk->effects + walk->buckets);
     return true;
 }
 
@@ -327,11 +368,8 @@ int updateHistoryEntriesforRename(historyData* data)
         return 0;
 
     renameWalk walk;
-    if (!initWalk(&walk, numRenames))
+    if (!initWalk(&walk, numRenames, resetLists(data)))
         return failStage(msgNoMemoryImages);
-    for (int i = 0; i < data->backupIndex; i++)
-        if (data->entries[i].tablespaceNames != nullptr)
-            namesOf(&data->entries[i])->renamedBy = 0;
     int rc = 0;
     for (int i = data->backupIndex - 1; i >= 0 && rc == 0; i--) {
         historyEntry* entry = &data->entries[i];

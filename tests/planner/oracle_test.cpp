@@ -202,6 +202,17 @@ size_t numLists(const historyData& data)
     return lists.size();
 }
 
+// Renames act from the oldest to the newest, so that they can be applied in several goes.
+void renameInTwoGoes(historyData* data)
+{
+    int target = data->backupIndex;
+    data->backupIndex = (data->renameIndex + target) / 2;
+    EXPECT_EQ(updateHistoryEntriesforRename(data), 0);
+    data->renameIndex = data->backupIndex;
+    data->backupIndex = target;
+    EXPECT_EQ(updateHistoryEntriesforRename(data), 0);
+}
+
 std::string planByStages(std::string timestamp, size_t* lists)
 {
     restorePlan plan = {};
@@ -212,7 +223,8 @@ std::string planByStages(std::string timestamp, size_t* lists)
     *lists += numLists(plan.histData);
 
     std::string result;
-    EXPECT_EQ(isRenamePassDue(&plan) ? updateHistoryEntriesforRename(&plan.histData) : 0, 0);
+    if (isRenamePassDue(&plan))
+        renameInTwoGoes(&plan.histData);
     for (int i = 0; i < plan.histData.numEntries; i++) {
         const historyEntry& entry = plan.histData.entries[i];
         result += listed({entry.tablespaceNames, entry.tablespaceNames + entry.numTablespaces});
