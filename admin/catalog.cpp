@@ -105,25 +105,21 @@ static int orderOfUnused(const void* first, const void* second)
                               &static_cast<const unusedImage*>(second)->image);
 }
 
-// Reads the entries that matter, and notes what the planner does not keep.
-static int readEntries(const historyPlace* place, imageCatalog* catalog)
+// Takes the entries that matter, and notes what the planner does not keep.
+static int takeEntries(const historyPlace* place, SQLUH_COMMITTED* history, imageCatalog* catalog)
 {
-    catalogRead read = {catalog, nullptr, 0, nullptr};
+    catalogRead read = {catalog, history, 0, nullptr};
     const historySource source = {&read, openRead, getRow, closeRead};
     int numBackups = 0;
-    int rc = readCommitted(place, &read.history);
-    if (rc == 0 && read.history->failure != 0)
-        rc = failDamaged(place, read.history, "read the history");
-    if (rc == 0)
-        catalog->numEntries = read.history->numRows;
-    if (rc == 0 && (!allocateFacts(&read) ||
-                    fetchFromSource(&source, nullptr, &catalog->history, &numBackups) != 0))
+    int rc = 0;
+    catalog->numEntries = history->numRows;
+    if (!allocateFacts(&read) ||
+        fetchFromSource(&source, nullptr, &catalog->history, &numBackups) != 0)
         rc = failWithCode(sqloSystemError | ENOMEM, "read the history", place->directory);
     if (rc == 0)
         qsort(catalog->unused, static_cast<size_t>(catalog->numUnused), sizeof(unusedImage),
               orderOfUnused);
     free(read.lastNumbers);
-    sqluhFreeCommitted(&read.history);
     return rc;
 }
 
@@ -182,11 +178,24 @@ static int readOnHand(imageCatalog* catalog, const char* name)
 
 int readCatalog(const historyPlace* place, const char* have, imageCatalog* catalog)
 {
+    SQLUH_COMMITTED* history = nullptr;
+    int rc = readCommitted(place, &history);
+    if (rc == 0 && history->failure != 0) {
+        rc = failDamaged(place, history, "read the history");
+        sqluhFreeCommitted(&history);
+    }
+    return rc != 0 ? rc : fillCatalog(place, history, have, catalog);
+}
+
+int fillCatalog(const historyPlace* place, SQLUH_COMMITTED* history, const char* have,
+                imageCatalog* catalog)
+{
     *catalog = {};
     catalog->history.backupIndex = catalog->history.renameIndex = -1;
     int rc = have != nullptr ? readOnHand(catalog, have) : 0;
     if (rc == 0)
-        rc = readEntries(place, catalog);
+        rc = takeEntries(place, history, catalog);
+    sqluhFreeCommitted(&history);
     const historyEntry *image = nullptr, *rename = nullptr;
     for (int i = catalog->history.numEntries - 1; i >= 0; i--) {
         const historyEntry* entry = &catalog->history.entries[i];

@@ -40,6 +40,10 @@ struct imageCatalog {
 // input). Complains on failure and returns an exit status, else 0. freeCatalog accepts what a
 // failed call left.
 int readCatalog(const historyPlace* place, const char* have, imageCatalog* catalog);
+
+// Makes the catalog of a history that was read, which it releases.
+int fillCatalog(const historyPlace* place, SQLUH_COMMITTED* history, const char* have,
+                imageCatalog* catalog);
 void freeCatalog(imageCatalog* catalog);
 
 bool isImage(const historyEntry* entry);

@@ -265,3 +265,55 @@ TEST_F(QuestionTest, TheManualListsEveryMember)
             manual.check(ask(std::string(row.command) + " --json " + arguments, status));
     }
 }
+
+// A year: weekly full, daily incremental, hourly delta images of twelve tablespaces, one of which
+// is renamed each month; a restore each month; and a Sunday without its full image.
+static std::string aYear()
+{
+    std::vector<std::string> names;
+    for (int i = 0; i < 12; i++)
+        names.push_back("SPACE" + std::to_string(i));
+    std::string text;
+    for (time_t hour = 0; hour < 366 * 24; hour++) {
+        time_t seconds = 1704067200 + hour * 3600; // from 2024-01-01, a Monday
+        tm day;
+        gmtime_r(&seconds, &day);
+        long time = (day.tm_year + 1900) * 10000000000 + (day.tm_mon + 1) * 100000000 +
+                    day.tm_mday * 1000000 + day.tm_hour * 10000;
+        bool daily = day.tm_hour == 1, weekly = daily && day.tm_wday == 0;
+        if (weekly && day.tm_yday == 308)
+            continue;
+        text += stanza("backup", time,
+                       weekly  ? ""
+                       : daily ? "Type: incremental\n"
+                               : "Type: delta\n",
+                       names);
+        if (day.tm_mday == 15 && day.tm_hour == 3) {
+            std::string old = names[0];
+            names[0] = "RENAMED" + std::to_string(day.tm_mon);
+            text += stanza("rename tablespace", time + 1, "", {old, names[0]});
+        }
+        if (day.tm_mday == 20 && day.tm_hour == 5)
+            text +=
+                stanza("restore", time + 1, "Id: " + std::to_string(time - 20000) + "\n", names);
+    }
+    return text;
+}
+
+TEST_F(QuestionTest, EveryQuestionAboutAYearIsAnsweredWithinASecond)
+{
+    EXPECT_EQ("8808 entries appended\n[0]", run("load h/", aYear()));
+    for (const char* question :
+         {"images h/", "images --json h/", "plan h/ latest", "plan h/ --before 20241110000000",
+          "chart h/", "chart h/ --svg -", "check h/", "unneeded --keep 30 h/",
+          "needed-by h/ 20241027010000", "status h/", "verify h/"}) {
+        timespec start, end;
+        clock_gettime(CLOCK_MONOTONIC, &start);
+        EXPECT_FALSE(run(question).empty());
+        clock_gettime(CLOCK_MONOTONIC, &end);
+        double seconds = static_cast<double>(end.tv_sec - start.tv_sec) +
+                         static_cast<double>(end.tv_nsec - start.tv_nsec) / 1e9;
+        EXPECT_LT(seconds, 1) << question;
+        printf("%-35s %.3f s\n", question, seconds);
+    }
+}
