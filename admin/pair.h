@@ -25,6 +25,9 @@ struct fileFinding {
 // for a file that is not sound; or the allocation's code.
 int examineFile(const char* path, const char* progress, fileFinding* finding);
 
+// Puts what was found as an object (verify.cpp).
+void putJsonFinding(jsonWriter* json, const char* key, const fileFinding* finding);
+
 // Says what is wrong with the file and returns exitDamaged, or the status of what the system
 // refused; returns 0 without a word for a sound file whose status is neither 'P' nor unknown.
 int failUnsound(const fileFinding* finding, const char* name, const char* what);

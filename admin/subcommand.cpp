@@ -14,6 +14,8 @@ static constexpr subcommand subcommands[] = {
      "list the images that a restore needs; TIMESTAMP may be latest"},
     {"chart", chartMain, 1, 0, 1, optionJson | optionColor | optionSvg, "DIR [TIMESTAMP]",
      "draw the images of each tablespace, and which ones are needed"},
+    {"check", checkMain, 1, 0, 0, optionJson | optionMaxAge | optionHave, "DIR",
+     "say in one line whether everything is well"},
     {"unneeded", unneededMain, 1, 0, 0, optionJson | optionSince | optionKeep, "DIR",
      "list the images that no restore needs from a time on; delete nothing"},
     {"needed-by", neededByMain, 1, 1, 1, optionJson, "DIR TIMESTAMP",

@@ -41,7 +41,7 @@ static void showFinding(const char* name, const fileFinding* finding, bool isSha
     }
 }
 
-static void putJsonFinding(jsonWriter* json, const char* key, const fileFinding* finding)
+void putJsonFinding(jsonWriter* json, const char* key, const fileFinding* finding)
 {
     beginJson(json, key, '{');
     putJsonText(json, "verdict", verdictWords[finding->verdict]);

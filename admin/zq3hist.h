@@ -79,6 +79,7 @@ struct commandLine {
 int imagesMain(commandLine* line);
 int planMain(commandLine* line);
 int chartMain(commandLine* line);
+int checkMain(commandLine* line);
 int unneededMain(commandLine* line);
 int neededByMain(commandLine* line);
 int loadMain(commandLine* line);

@@ -2,7 +2,7 @@
 
 _zq3hist() {
   local word=${COMP_WORDS[COMP_CWORD]} last=${COMP_WORDS[COMP_CWORD - 1]} command=${COMP_WORDS[1]}
-  local commands="images plan chart unneeded needed-by load dump status verify repair copy backup
+  local commands="images plan chart check unneeded needed-by load dump status verify repair copy backup
     restore prune unlock help"
   local i place=() given=()
   COMPREPLY=()

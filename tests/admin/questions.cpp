@@ -239,6 +239,48 @@ TEST_F(QuestionTest, AnswersInFull)
         EXPECT_EQ(row.output, run(row.arguments)) << row.arguments;
 }
 
+TEST_F(QuestionTest, AChecksLineBeginsWithTheGravest)
+{
+    const auto hoursAgo = [](int hours) {
+        time_t seconds = time(nullptr) - hours * 3600 - 60;
+        tm day;
+        char text[16];
+        strftime(text, sizeof text, "%Y%m%d%H%M%S", gmtime_r(&seconds, &day));
+        return std::stol(text);
+    };
+    long full = hoursAgo(30), delta = hoursAgo(3);
+    std::string three = "newest that can be restored: " + std::to_string(delta) + ", 3 hours old";
+    std::string thirty = "newest that can be restored: " + std::to_string(full) + ", 30 hours old";
+    const struct {
+        const char* before;
+        const char* arguments;
+        std::string output;
+    } rows[] = {
+        {"", "h/ --max-age 3", "ok: 2 entries, 2 images, 0 incomplete; " + three + "\n[0]"},
+        {"", "h/ --max-age 2",
+         "no image: the newest image that can be restored is 3 hours old; 2 entries, 2 images, 0 "
+         "incomplete; " +
+             three + "\n[5]"},
+        {"", "h/ --have have",
+         "incomplete: tablespace A lacks the image " + std::to_string(delta) +
+             " (2 tablespaces lack one); 2 entries, 2 images, 1 incomplete; " + thirty + "\n[6]"},
+        {"rm h/zq3rhist.bak; ", "h/",
+         "damaged: zq3rhist.bak is missing; 2 entries, 2 images, 0 incomplete; " + three + "\n[3]"},
+        {"cp h/zq3rhist.asc h/zq3rhist.bak; truncate -s 1024 h/zq3rhist.asc; ", "h/ --max-age 2",
+         "damaged: zq3rhist.asc ends after 0 of 2 entries; the newest image that can be "
+         "restored is 3 hours old; 2 entries, 2 images, 0 incomplete; " +
+             three + "\n[3]"},
+        {"rm h/*; ", "h/", "damaged: the directory holds no history file\n[3]"},
+    };
+    run("load h/", stanza("backup", full, "", {"A", "B"}) +
+                       stanza("backup", delta, "Type: delta\n", {"A", "B"}));
+    spill(root + "have", std::to_string(full));
+    for (const auto& row : rows)
+        EXPECT_EQ(row.output, run(std::string("check ") + row.arguments, "",
+                                  std::string("export TZ=UTC; ") + row.before))
+            << row.arguments;
+}
+
 TEST_F(QuestionTest, TheManualListsEveryMember)
 {
     const struct {
@@ -252,12 +294,17 @@ TEST_F(QuestionTest, TheManualListsEveryMember)
           {"h/ 20250105010000", 0},
           {"--have have h/ 20250102010000", 6}}},
         {"chart", {{"h/", 0}, {"h/ 20250102010000", 0}, {"s/", 0}}},
+        {"check", {{"h/", 0}, {"e/", 5}, {"s/", 5}, {"g/", 0}}},
         {"unneeded", {{"--keep 1 h/", 0}}},
         {"needed-by", {{"h/ 20250101010000", 0}}},
     };
     run("load h/", tenDays());
     run("load e/", "", "mkdir e; ");
     run("load s/", stanza("backup", 20250101000000, "Type: delta\n", {"A"}), "mkdir s; ");
+    run("load g/",
+        stanza("backup", 20250101000000, "", {"A"}) +
+            stanza("backup", 20250102000000, "Type: delta\nNumber: 5\n", {"A"}),
+        "mkdir g; ");
     spill(root + "have", "");
     for (const auto& row : rows) {
         manualSection manual(row.command);
