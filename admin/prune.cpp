@@ -44,6 +44,29 @@ static bool stays(const void* context, const char* objectPart)
            memcmp(objectPart, plan->from, timestampWidth) >= 0;
 }
 
+// What pruning would come to.
+static int rehearsePruning(const historyPlace* place, const prunePlan* plan, partReport* part)
+{
+    char objectPart[zq3ObjectPartCapacity] = {};
+    zq3HistoryData data = {};
+    data.objectPart = {objectPart, sizeof objectPart, 0};
+    SQLUH_ENTRY entry = {};
+    entry.data = &data;
+    SQLUH_COMMITTED* committed = nullptr;
+    int rc = readCommitted(place, &committed);
+    if (rc != 0)
+        return rc;
+    if (committed->failure != 0)
+        rc = failDamaged(place, committed, "prune the history");
+    for (uint32_t row = 0; rc == 0 && row < committed->numRows; row++) {
+        sqluhGetCommitted(committed, row, &entry, false);
+        part->total++;
+        part->kept += stays(plan, objectPart);
+    }
+    sqluhFreeCommitted(&committed);
+    return rc;
+}
+
 static void tellPart(const prunePlan* plan, const partReport* part, bool dryRun)
 {
     const char* would = dryRun ? "would be " : "";
@@ -62,10 +85,9 @@ static bool isUnchanged(const struct stat* before, const struct stat* after)
            before->st_ctim.tv_nsec == after->st_ctim.tv_nsec;
 }
 
-static int prunePair(commandLine* line, SQLUH_HANDLE* handle, const struct stat* planned,
+static int prunePair(historyPlace* place, SQLUH_HANDLE* handle, const struct stat* planned,
                      const prunePlan* plan, char* temporary)
 {
-    historyPlace* place = &line->place;
     struct stat there = {};
     pairFinding pair;
     partReport part = {};
@@ -78,13 +100,13 @@ static int prunePair(commandLine* line, SQLUH_HANDLE* handle, const struct stat*
     int code = rc == 0 ? writePart(place->historyPath, stays, plan, temporary, &part) : 0;
     if (code != 0)
         rc = failWithCode(code, "write the new history", place->directory);
-    bool change = rc == 0 && !line->dryRun && part.kept < part.total;
+    bool change = rc == 0 && part.kept < part.total;
     if (change)
         rc = keepPair(handle, &kept);
     if (change && rc == 0)
         rc = replacePair(place, handle, temporary);
     if (rc == 0)
-        tellPart(plan, &part, line->dryRun);
+        tellPart(plan, &part, false);
     tellKept(&kept);
     return rc;
 }
@@ -102,10 +124,17 @@ int pruneMain(commandLine* line)
     int rc = formTemporary(place->historyPath, temporary);
     if (rc == 0)
         rc = findBeginning(place, line->before, &plan);
+    if (rc == 0 && line->dryRun) {
+        partReport part = {};
+        rc = rehearsePruning(place, &plan, &part);
+        if (rc == 0)
+            tellPart(&plan, &part, true);
+        return rc;
+    }
     if (rc == 0)
         rc = lockPair(place, R_OK | W_OK, &handle);
     if (rc == 0) {
-        rc = prunePair(line, handle, &planned, &plan, temporary);
+        rc = prunePair(place, handle, &planned, &plan, temporary);
         unlink(temporary);
     }
     return unlockPair(place, &handle, rc);

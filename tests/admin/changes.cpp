@@ -2,6 +2,7 @@
 #include <regex>
 
 #include "tests/admin/program.h"
+#include "tests/admin/schema.h"
 
 static const char week[] = "Operation: backup\nTimestamp: 20250105010000\nTablespace: A\n\n"
                            "Operation: backup\nType: delta\nTimestamp: 20250106010000\n"
@@ -93,7 +94,7 @@ class ChangeTest : public ProgramTest
                 kept.push_back(file);
         std::sort(kept.begin(), kept.end());
         for (const std::string& file : kept)
-            there += " " + entriesIn(file);
+            there.append(" ").append(entriesIn(file));
         return there;
     }
 
@@ -269,4 +270,73 @@ TEST_F(ChangeTest, FollowedHintsMendTheHistory)
                 << run("verify h/");
         }
     printf("%d hints followed\n", followed);
+}
+
+TEST_F(ChangeTest, TheJsonIsAsTheManualSays)
+{
+    const std::string entry = "Operation: B\nTablespace: A\nSQLCODE: 1\n";
+    const struct {
+        const char* command;
+        std::vector<std::array<const char*, 2>> calls; // state and arguments
+    } rows[] = {
+        {"dump", {{"", "h/"}, {"rm h/*; zq3hist load h <sqlca >new; ", "h/"}}},
+        {"status", {{"", "h/"}, {"rm h/zq3rhist.asc; ", "h/"}, {SPOIL("bak", "10"), "h/"}}},
+        {"verify", {{"", "h/"}, {CUT("asc", "1803"), "h/"}, {SPOIL("bak", "2000"), "h/"}}},
+        {"repair", {{SPOIL("bak", "2000"), "h/"}, {"", "--dry-run h/"}}},
+        {"load", {{"", "h/ more"}, {"", "--skip-existing h/ more"}}},
+    };
+    spill(root + "sqlca", entry);
+    for (const auto& row : rows) {
+        SCOPED_TRACE(row.command);
+        manualSection section(row.command);
+        for (const auto& [state, arguments] : row.calls) {
+            prepare(state);
+            run(std::string(row.command).append(" --json ").append(arguments));
+            std::istringstream out(slurp(root + "out"));
+            for (std::string line; std::getline(out, line);)
+                section.check(nlohmann::json::parse(line));
+        }
+    }
+}
+
+// What only looks leaves every file as it is, down to its times, and no lock.
+TEST_F(ChangeTest, LookingOnlyLooks)
+{
+    static const char* const states[] = {"",
+                                         SPOIL("asc", "10"),
+                                         SPOIL("asc", "10") SPOIL("bak", "10"),
+                                         SPOIL("asc", "2000"),
+                                         CUT("asc", "1803"),
+                                         "rm h/zq3rhist.asc; ",
+                                         "rm h/zq3rhist.bak; ",
+                                         "rm h/*; ",
+                                         KILLED};
+    static const char* const commands[] = {"status h",
+                                           "verify h",
+                                           "dump h",
+                                           "load --dry-run --skip-existing h more",
+                                           "repair --dry-run h",
+                                           "repair --dry-run --force h",
+                                           "restore --dry-run h image",
+                                           "backup --dry-run h new",
+                                           "copy --dry-run h target",
+                                           "copy --dry-run target h",
+                                           "prune --dry-run --before 20250107000000 h"};
+    fs::create_directory(root + "target");
+    const auto look = [&] {
+        int set = lockSetOf(historyPath);
+        EXPECT_EQ(0, system(("cd " + root +
+                             "; stat -c '%n %i %s %z' h/ h/* >seen 2>&-; "
+                             "md5sum h/* >>seen 2>&-; ls . target >>seen")
+                                .c_str()));
+        return slurp(root + "seen") + std::to_string(set);
+    };
+    for (const char* state : states) {
+        prepare(state);
+        const std::string before = look();
+        for (const char* command : commands) {
+            std::string said = run(command);
+            EXPECT_EQ(before, look()) << state << command << said;
+        }
+    }
 }
