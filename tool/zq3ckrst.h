@@ -163,7 +163,7 @@ void freePlan(restorePlan* plan);
 // Stands in an entry for a name that another tablespace took; a slot like any other.
 extern const char DELETED_RENAMED[nameSize];
 
-// --- Lists of names (names.cpp) ------------------------------------------------------------------
+// --- Lists of names (plan.cpp) -------------------------------------------------------------------
 
 // Makes a list of names that no entry has yet. names: count slots with zeros after the names.
 // Returns null when there is no memory.
