@@ -174,7 +174,7 @@ static uint32_t hashNames(const char (*names)[nameSize], uint32_t count)
 
 // The list for the names in the first count slots: that of a recent entry where one has the same
 // names, else a new one. Null: no memory.
-static nameList* takeNames(scanBuffers* buffers, uint32_t count)
+static nameList* listForNames(scanBuffers* buffers, uint32_t count)
 {
     if (hasNames(buffers->last, buffers->names, count))
         return buffers->last;
@@ -213,7 +213,7 @@ static int keepEntry(scanBuffers* buffers, historyData* data)
     // The record tells how many names the history's entry has; only so many have a slot.
     uint32_t numNames = record->numTablespaces < buffers->maxTablespaces ? record->numTablespaces
                                                                          : buffers->maxTablespaces;
-    nameList* list = numNames != 0 ? takeNames(buffers, numNames) : nullptr;
+    nameList* list = numNames != 0 ? listForNames(buffers, numNames) : nullptr;
     if (numNames != 0 && list == nullptr)
         return failStage(msgNoMemoryNames);
     giveNames(entry, list);

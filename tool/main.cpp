@@ -163,7 +163,7 @@ static int takeNames(planOptions* options, int argc, char** argv, int* at)
     return options->numNames == 0 ? reportError(msgNoNames) : 0;
 }
 
-static int takeOption(planOptions* options, int argc, char** argv, int* at)
+static int takeOptionAt(planOptions* options, int argc, char** argv, int* at)
 {
     switch (argv[*at][1]) {
     case 'd':
@@ -194,7 +194,7 @@ static int parseCommandLine(planOptions* options, int argc, char** argv)
     }
     for (int at = 1; at < argc && rc == 0 && !options->helpGiven; at++)
         if (argv[at][0] == '-')
-            rc = takeOption(options, argc, argv, &at);
+            rc = takeOptionAt(options, argc, argv, &at);
 
     if (rc == 0 && !options->helpGiven && options->seen != (seenAlias | seenTimestamp))
         rc = reportError(msgNoAliasOrTimestamp);

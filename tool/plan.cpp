@@ -30,7 +30,7 @@ nameList* makeNameList(const char (*names)[nameSize], uint32_t count)
     return list;
 }
 
-nameList* namesOf(const historyEntry* entry)
+nameList* namesOfEntry(const historyEntry* entry)
 {
     return entry->tablespaceNames == nullptr
                ? nullptr
@@ -39,7 +39,7 @@ nameList* namesOf(const historyEntry* entry)
 
 void giveNames(historyEntry* entry, nameList* list)
 {
-    nameList* former = namesOf(entry);
+    nameList* former = namesOfEntry(entry);
     if (list != nullptr)
         list->uses++;
     if (former != nullptr && --former->uses == 0)

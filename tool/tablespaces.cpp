@@ -299,7 +299,7 @@ static void makeChanges(renameWalk* walk, historyEntry* entry, int changes)
 // its names. Entries before the next older rename may have the list, too, so it is left alone.
 static int renameInEntry(renameWalk* walk, historyEntry* entry)
 {
-    nameList* list = namesOf(entry);
+    nameList* list = namesOfEntry(entry);
     if (list == nullptr)
         return 0;
     if (list->renamedBy == walk->numRenames) {
@@ -333,7 +333,7 @@ static size_t resetLists(const historyData* data)
 {
     size_t most = 0;
     for (int i = 0; i < data->backupIndex; i++) {
-        nameList* list = namesOf(&data->entries[i]);
+        nameList* list = namesOfEntry(&data->entries[i]);
         if (list == nullptr)
             continue;
         list->renamedBy = 0;

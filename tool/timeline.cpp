@@ -176,7 +176,7 @@ int fillColumns(char* matrix, historyData* data, tablespaceInfo* list, int numTa
     timelineWalk walk = {data->backupIndex + 1, nullptr, end, cellUnused, numTablespaces, -1};
     const nameList* settled = nullptr; // its names are of no column, or of complete ones
     while (walk.incomplete > 0 && stepBack(&walk, data, numTablespaces)) {
-        const nameList* names = namesOf(walk.entry);
+        const nameList* names = namesOfEntry(walk.entry);
         if (names != nullptr && names != settled && !visitColumns(&walk, list, numTablespaces))
             settled = names;
     }

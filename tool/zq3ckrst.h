@@ -174,7 +174,7 @@ nameList* makeNameList(const char (*names)[nameSize], uint32_t count);
 void giveNames(historyEntry* entry, nameList* list);
 
 // The entry's list; null when it has none.
-nameList* namesOf(const historyEntry* entry);
+nameList* namesOfEntry(const historyEntry* entry);
 
 // --- Fetching the history (fetch.cpp, scan.cpp) --------------------------------------------------
 

@@ -198,7 +198,7 @@ size_t numLists(const historyData& data)
 {
     std::set<const nameList*> lists;
     for (int i = 0; i < data.numEntries; i++)
-        lists.insert(namesOf(&data.entries[i]));
+        lists.insert(namesOfEntry(&data.entries[i]));
     return lists.size();
 }
 
