@@ -32,9 +32,21 @@ bool lists(const Names& names, const std::string& name)
     return std::find(names.begin(), names.end(), name) != names.end();
 }
 
-History randomHistory(std::mt19937& random, const std::string& target)
+// So many names, or fewer, of a few; unique: none twice.
+Names randomNames(std::mt19937& random, size_t count, size_t poolSize, bool unique)
 {
     static const char* const pool[] = {"A", "B", "C", "TABLESPACE", "TABLESPACE_OF_18CH", "***"};
+    Names names;
+    for (size_t i = 0; i < count; i++) {
+        std::string name = pool[random() % poolSize];
+        if (!unique || !lists(names, name))
+            names.push_back(name);
+    }
+    return names;
+}
+
+History randomHistory(std::mt19937& random, const std::string& target)
+{
     static const char operations[] = "BBBBBBRRANNN", types[] = "FDDIIEO";
     auto pick = [&](size_t count) { return random() % count; };
     size_t poolSize = 3 + pick(4), length = 2 + pick(14);
@@ -46,15 +58,10 @@ History randomHistory(std::mt19937& random, const std::string& target)
         event = {operations[pick(12)], types[pick(7)], day(1 + i + pick(2)), "", {}};
         if (event.operation == 'R')
             event.id = day(1 + pick(length));
-        bool alike = i > 0 && event.operation != 'N' && pick(2) == 0;
-        if (alike) // entries that share a list, with other entries among them
-            event.names = history[i - 1 - pick(i)].names;
         size_t numNames = event.operation == 'N' ? 1 + pick(7) / 2 : pick(poolSize + 1);
-        for (size_t j = 0; j < numNames && !alike; j++) {
-            std::string name = pool[pick(poolSize)];
-            if (!unique || !lists(event.names, name))
-                event.names.push_back(name);
-        }
+        event.names = randomNames(random, numNames, poolSize, unique);
+        if (i > 0 && event.operation != 'N' && pick(2) == 0) // a list that entries share
+            event.names = history[i - 1 - pick(i)].names;
     }
     history[length - 1 - pick(2)] = {'B', types[pick(7)], target, "", {"A", "C", "B"}};
     for (Event& event : history) // more columns than are scanned side by side
@@ -153,7 +160,8 @@ std::string listed(const Names& names)
     return text + "\n";
 }
 
-std::string planSlowly(History history, const std::string& timestamp)
+// asked: the tablespaces to restore; none: all of the target.
+std::string planSlowly(History history, const std::string& timestamp, const Names& asked)
 {
     std::stable_sort(history.begin(), history.end(),
                      [](const Event& a, const Event& b) { return a.timestamp < b.timestamp; });
@@ -166,8 +174,8 @@ std::string planSlowly(History history, const std::string& timestamp)
     for (const Event& event : history)
         result += listed(event.names);
     Names columns;
-    for (const std::string& name : history[target].names) {
-        if (lists(columns, name))
+    for (const std::string& name : asked.empty() ? history[target].names : asked) {
+        if (lists(columns, name) || !lists(history[target].names, name))
             continue;
         columns.push_back(name);
         std::string cells;
@@ -213,7 +221,36 @@ void renameInTwoGoes(historyData* data)
     EXPECT_EQ(updateHistoryEntriesforRename(data), 0);
 }
 
-std::string planByStages(std::string timestamp, size_t* lists)
+void listAsked(restorePlan* plan, Names asked)
+{
+    std::vector<char*> names;
+    for (std::string& name : asked)
+        names.push_back(name.data());
+    int rc = names.empty() ? listTargetTablespaces(plan)
+                           : listNamedTablespaces(plan, names.data(), int(names.size()));
+    EXPECT_EQ(rc, plan->numTablespaces == 0 && !names.empty() ? argumentMissing : 0);
+    historyEntry* target = &plan->histData.entries[plan->histData.backupIndex];
+    for (char* name : names)
+        EXPECT_EQ(isNameListed(plan, name), isTablespaceInHistoryEntry(target, name, nullptr));
+}
+
+std::string timelines(restorePlan& plan)
+{
+    std::string result;
+    EXPECT_EQ(allocateTimelineMatrix(&plan), 0);
+    int failed =
+        fillColumns(plan.matrix, &plan.histData, plan.list, plan.numTablespaces, plan.numBackups);
+    if (failed < 0) {
+        result += columnsOf(plan);
+        failed = scanColumns(plan.matrix, plan.numTablespaces, plan.numBackups);
+        result += columnsOf(plan);
+    }
+    if (failed >= 0)
+        result += std::string("missing: ") + plan.list[failed].name;
+    return result;
+}
+
+std::string planByStages(std::string timestamp, const Names& asked, size_t* lists)
 {
     restorePlan plan = {};
     plan.histData.backupIndex = plan.histData.renameIndex = -1;
@@ -229,17 +266,8 @@ std::string planByStages(std::string timestamp, size_t* lists)
         const historyEntry& entry = plan.histData.entries[i];
         result += listed({entry.tablespaceNames, entry.tablespaceNames + entry.numTablespaces});
     }
-    EXPECT_EQ(listTargetTablespaces(&plan), 0);
-    EXPECT_EQ(allocateTimelineMatrix(&plan), 0);
-    int failed =
-        fillColumns(plan.matrix, &plan.histData, plan.list, plan.numTablespaces, plan.numBackups);
-    if (failed < 0) {
-        result += columnsOf(plan);
-        failed = scanColumns(plan.matrix, plan.numTablespaces, plan.numBackups);
-        result += columnsOf(plan);
-    }
-    if (failed >= 0)
-        result += std::string("missing: ") + plan.list[failed].name;
+    listAsked(&plan, asked);
+    result += timelines(plan);
     freePlan(&plan);
     return result;
 }
@@ -253,15 +281,16 @@ TEST(Oracle, StagesAgreeWithTheSlowPlanner)
     for (int run = 0; run < 3000; run++) {
         std::string timestamp = day(2 + random() % 16);
         History history = randomHistory(random, timestamp);
-        std::string script = asScript(history), expected = planSlowly(history, timestamp);
+        Names asked = randomNames(random, random() % 3, 6, false);
+        std::string script = asScript(history), expected = planSlowly(history, timestamp, asked);
         std::set<Names> different;
         for (const Event& event : history)
             different.insert(event.names);
         differentLists += different.size();
         setenv("ZQ3SCRIPT", script.c_str(), 1);
-        ASSERT_EQ(planByStages(timestamp, &lists), expected) << script;
+        ASSERT_EQ(planByStages(timestamp, asked, &lists), expected) << script;
         plans += expected.find("missing") == std::string::npos;
     }
-    EXPECT_LT(lists, differentLists * 101 / 100); // two lists with one place among the recent ones
+    EXPECT_LT(lists, differentLists * 101 / 100);  // two lists with one place among the recent ones
     EXPECT_GT(std::min(plans, 3000 - plans), 500); // the histories reach both outcomes
 }

@@ -64,6 +64,22 @@ void deliver(const textBuffer& buffer, uint32_t capacity, const std::string& tex
     snprintf(buffer.data, capacity, "%s", text.c_str());
 }
 
+// The names, the id and the SQLCODE of an entry.
+void deliverWords(std::istringstream& words, zq3HistoryData* record)
+{
+    broken(record->maxTablespaces != script.maxTablespaces, "room for names");
+    record->eventSqlca->sqlcode = 0;
+    record->numTablespaces = 0;
+    for (std::string word; words >> word;) {
+        if (word[0] == '=')
+            deliver(record->idText, 25, word.substr(1));
+        else if (word[0] == '!')
+            record->eventSqlca->sqlcode = atoi(word.c_str() + 1);
+        else if (record->numTablespaces++ < record->maxTablespaces)
+            deliver(record->tablespaceBuffers[record->numTablespaces - 1], 19, word);
+    }
+}
+
 void deliverEntry(const std::string& line, zq3HistoryData* record)
 {
     static const uint32_t capacities[] = {18, 15, 13, 13, 25, 31, 129, 256, 31, 2097152};
@@ -76,17 +92,7 @@ void deliverEntry(const std::string& line, zq3HistoryData* record)
     deliver(record->objectPart, 18, objectPart + (objectPart.size() == 14 ? "001" : ""));
     deliver(record->commandText, 2097152, line.substr(std::min(quote + 1, line.size())));
     record->commandText.data[2097152] = '\0'; // one byte more is the caller's
-    broken(record->maxTablespaces != script.maxTablespaces, "room for names");
-    record->eventSqlca->sqlcode = 0;
-    record->numTablespaces = 0;
-    for (std::string word; words >> word;) {
-        if (word[0] == '=')
-            deliver(record->idText, 25, word.substr(1));
-        else if (word[0] == '!')
-            record->eventSqlca->sqlcode = atoi(word.c_str() + 1);
-        else if (record->numTablespaces++ < record->maxTablespaces)
-            deliver(record->tablespaceBuffers[record->numTablespaces - 1], 19, word);
-    }
+    deliverWords(words, record);
     record->operation = letters[0];
     record->object = letters[1];
     record->operationType = letters[2];
