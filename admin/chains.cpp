@@ -170,8 +170,8 @@ static int takeRename(chainWalker* walker, const historyEntry* entry)
     if (renamed < 0 || replaced < 0 || fresh < 0)
         return -1;
     chainTablespace* tablespaces = walker->walk->tablespaces;
-    tablespaces[replaced].name[0] = '\0';
-    copyName(tablespaces[renamed].name, replaced == renamed ? "" : newName);
+    copyName(tablespaces[renamed].name, newName);
+    tablespaces[replaced].name[0] = '\0'; // also of one that is renamed to itself
     takeName(walker, newName)->number = renamed; // both are known by now
     takeName(walker, oldName)->number = fresh;
     return 0;

@@ -2,7 +2,6 @@
 #pragma once
 
 #include <nlohmann/json.hpp>
-#include <regex>
 #include <set>
 
 #include "tests/support.h"
@@ -15,14 +14,13 @@ struct manualSection {
     explicit manualSection(const std::string& command)
     {
         std::istringstream manual(slurp(ZQ3_MANUALS "/zq3hist-json.5"));
-        std::smatch match;
         std::string section;
         for (std::string line; std::getline(manual, line);)
             if (line.starts_with(".Ss "))
                 section = line.substr(4);
-            else if (section == command &&
-                     std::regex_match(line, match, std::regex(R"(\.It Li (\S+) Pq (.*))")))
-                members[match[1]] = match[2];
+            else if (size_t type = line.find(" Pq "); section == command && type < line.size())
+                members[line.substr(strlen(".It Li "), type - strlen(".It Li "))] =
+                    line.substr(type + strlen(" Pq "));
     }
 
     // Every member of an output must be listed with its type.
