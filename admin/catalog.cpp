@@ -128,6 +128,19 @@ static int orderOfTimestamps(const void* first, const void* second)
     return memcmp(first, second, timestampLength);
 }
 
+// Makes room for one more in the list of images on hand.
+static int growOnHand(imageCatalog* catalog, const char* name)
+{
+    size_t count = catalog->numOnHand;
+    if ((count & (count + 1)) != 0)
+        return 0; // there is room up to one less than a power of two
+    void* grown = reallocarray(catalog->onHand, count * 2 + 2, sizeof *catalog->onHand);
+    if (grown == nullptr)
+        return failWithCode(sqloSystemError | ENOMEM, "read the list of images", name);
+    catalog->onHand = static_cast<char(*)[timestampLength + 1]>(grown);
+    return 0;
+}
+
 // Takes one line of the list of images on hand: a timestamp, a comment, or nothing.
 static int takeOnHand(imageCatalog* catalog, const char* name, int number, char* line)
 {
@@ -137,13 +150,8 @@ static int takeOnHand(imageCatalog* catalog, const char* name, int number, char*
         text[length - 1] = '\0';
     if (text[0] == '\0' || text[0] == '#')
         return 0;
-    if ((catalog->numOnHand & (catalog->numOnHand + 1)) == 0) { // one less than a power of two
-        void* grown =
-            reallocarray(catalog->onHand, catalog->numOnHand * 2 + 2, sizeof *catalog->onHand);
-        if (grown == nullptr)
-            return failWithCode(sqloSystemError | ENOMEM, "read the list of images", name);
-        catalog->onHand = static_cast<char(*)[timestampLength + 1]>(grown);
-    }
+    if (growOnHand(catalog, name) != 0)
+        return exitFailed;
     if (!parseTimestamp(text, catalog->onHand[catalog->numOnHand]))
         return fail(name, "found \"%.40s\" in line %d but expected a timestamp", text, number);
     catalog->numOnHand++;
@@ -157,18 +165,14 @@ static int readOnHand(imageCatalog* catalog, const char* name)
     FILE* in = isInput ? stdin : fopen(name, "re");
     if (in == nullptr)
         return failWithCode(sqloSystemError | errno, "read the list of images", title);
-    // An empty list is one, too.
-    catalog->onHand = static_cast<char(*)[timestampLength + 1]>(malloc(sizeof *catalog->onHand));
     char* line = nullptr;
     size_t capacity = 0;
-    int rc = catalog->onHand != nullptr
-                 ? 0
-                 : failWithCode(sqloSystemError | ENOMEM, "read the list of images", title);
+    int rc = growOnHand(catalog, title); // an empty list is one, too
     for (int number = 1; rc == 0 && getline(&line, &capacity, in) >= 0; number++)
         rc = takeOnHand(catalog, title, number, line);
     if (rc == 0 && ferror(in))
         rc = failWithCode(sqloSystemError | errno, "read the list of images", title);
-    if (rc == 0)
+    if (catalog->onHand != nullptr)
         qsort(catalog->onHand, catalog->numOnHand, sizeof *catalog->onHand, orderOfTimestamps);
     free(line);
     if (!isInput)

@@ -93,7 +93,7 @@ static int takeImage(chainWalker* walker, int position)
     image->firstLink = walk->numLinks;
     for (uint32_t i = 0; i < entry->numTablespaces; i++) {
         int number = numberOf(walker, entry->tablespaceNames[i]);
-        if (number < 0)
+        if (number < 0 || walk->links == nullptr)
             return -1;
         int* head = &walk->tablespaces[number].head;
         const chainLink* parent = *head >= 0 ? &walk->links[*head] : nullptr;
@@ -171,7 +171,7 @@ static int takeRename(chainWalker* walker, const historyEntry* entry)
         return -1;
     chainTablespace* tablespaces = walker->walk->tablespaces;
     copyName(tablespaces[renamed].name, newName);
-    tablespaces[replaced].name[0] = '\0'; // also of one that is renamed to itself
+    tablespaces[replaced].name[0] = '\0';        // also of one that is renamed to itself
     takeName(walker, newName)->number = renamed; // both are known by now
     takeName(walker, oldName)->number = fresh;
     return 0;

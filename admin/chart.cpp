@@ -155,7 +155,7 @@ static char* cellOf(const imageChart* chart, int tablespace, int column)
            column;
 }
 
-// Marks what the tablespaces came from; what is not marked was left behind.
+// Marks what the tablespaces came from; what is not marked was given up.
 static void markLineage(const chainWalk* walk, bool* lineage)
 {
     for (int i = 0; i < walk->numTablespaces; i++)

@@ -9,7 +9,7 @@ enum : char {
     chartFull = 'F',
     chartIncremental = 'I',
     chartDelta = 'D',
-    chartDiscarded = 'x', // a restore went back behind it, or the tablespace was made anew
+    chartDiscarded = 'x', // a restore went back to before it, or the tablespace was made anew
     chartMissing = '?',
 };
 

@@ -159,15 +159,15 @@ static void putLegend(const chartView* view)
         {"?", "?      missing"},
         {".", ".      not in the image"},
     };
-    bool seen[128] = {};
+    bool seen[256] = {};
     for (int row = 0; row < view->chart->numRows; row++)
         for (int i = 0; i < view->numColumns; i++)
-            seen[static_cast<int>(cellInView(view, &view->chart->rows[row], i))] = true;
+            seen[static_cast<unsigned char>(cellInView(view, &view->chart->rows[row], i))] = true;
     putchar('\n');
     for (const auto& line : legend) {
         bool any = false;
         for (const char* cell = line.cells; *cell != '\0'; cell++)
-            any = any || seen[static_cast<int>(*cell)];
+            any = any || seen[static_cast<unsigned char>(*cell)];
         if (any)
             puts(line.words);
     }

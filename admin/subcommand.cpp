@@ -245,7 +245,8 @@ static int takeOptions(int argc, char** argv, commandLine* line, bool* helpGiven
 static int takeDirectories(commandLine* line)
 {
     const subcommand* command = line->command;
-    historyPlace* places[] = {&line->place, &line->target};
+    enum : int { mostDirectories = 2 };
+    historyPlace* places[mostDirectories] = {&line->place, &line->target};
     bool noneTaken = (command->options & optionAllLocks) != 0 && line->all;
     int taken = noneTaken ? 0 : command->numDirectories;
     if (line->numAliases != 0 && line->numAliases != taken)
@@ -257,7 +258,7 @@ static int takeDirectories(commandLine* line)
         (command->most >= 0 && line->numArguments > command->most))
         return failForm(line);
     int rc = 0;
-    for (int i = 0; rc == 0 && i < taken; i++) {
+    for (int i = 0; rc == 0 && i < taken && i < mostDirectories; i++) {
         rc = takePlace(given != 0 ? line->arguments[i - given] : line->aliasPaths[i], places[i]);
         places[i]->wait = line->wait;
     }
