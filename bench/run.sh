@@ -3,6 +3,8 @@
 # as Markdown. What follows the directory goes to every program, for instance
 #     bench/run.sh build/release --benchmark_repetitions=21
 # The programs' full listings go to standard error.
+# With BENCH_EARLIER=PATH, the zq3ckrst of another build, the whole command is measured against that
+# one, too.
 set -eu
 root=$(cd "$(dirname "$0")/.." && pwd)
 build=${1:-$root/build/release}
