@@ -1,5 +1,5 @@
 // The subcommands that change a history, on sound pairs and on broken ones.
-#include <regex>
+#include <algorithm>
 
 #include "tests/admin/program.h"
 #include "tests/admin/schema.h"
@@ -100,8 +100,13 @@ class ChangeTest : public ProgramTest
 
     std::string runStamped(const std::string& arguments)
     {
-        static const std::regex stamp("\\.(asc|bak)\\.[0-9]{14}(\\.2)?");
-        return std::regex_replace(run(arguments), stamp, ".$1.STAMP");
+        std::string text = run(arguments);
+        for (size_t at = 0; (at = text.find("h/zq3rhist.", at)) != std::string::npos;) {
+            at += strlen("h/zq3rhist.asc");
+            if (text[at] == '.')
+                text.replace(at + 1, text.find_first_of("\n\"", at) - at - 1, "STAMP");
+        }
+        return text;
     }
 };
 
@@ -216,14 +221,16 @@ void ChangeTest::follow(const std::string& arguments, std::string* trace)
 {
     std::string typed = "zq3hist " + arguments;
     for (int step = 0; step < 5; step++) {
-        std::smatch hint;
         int rc = system(("cd " + root + "; (" + typed + ") >out 2>err").c_str());
         std::string said = slurp(root + "err");
         *trace += "\n$ " + typed + "\n" + slurp(root + "out") + said + "[" +
                   std::to_string(WEXITSTATUS(rc)) + "]";
-        if (!std::regex_search(said, hint, std::regex("hint: (.*?)  #")))
+        size_t hint = said.find("hint: "), end = said.find("  #");
+        if (hint == std::string::npos)
             return;
-        typed = std::regex_replace(hint[1].str(), std::regex("FILE"), "image");
+        typed = said.substr(hint + 6, end - hint - 6);
+        if (size_t file = typed.find("FILE"); file != std::string::npos)
+            typed.replace(file, 4, "image");
         followed++;
     }
     ADD_FAILURE() << "hints without end\n" << *trace;
@@ -263,11 +270,13 @@ TEST_F(ChangeTest, FollowedHintsMendTheHistory)
             std::string trace = state;
             follow(command, &trace);
             follow("verify h/", &trace);
-            EXPECT_TRUE(std::regex_match(run("verify h/"),
-                                         std::regex("zq3rhist.asc: sound, ([34]) entries\n"
-                                                    "zq3rhist.bak: sound, \\1 entries.*\n\\[0\\]")))
+            std::string last = run("verify h/");
+            std::string count = last.starts_with("zq3rhist.asc: sound, 4") ? "4" : "3";
+            EXPECT_TRUE(last.starts_with("zq3rhist.asc: sound, " + count +
+                                         " entries\nzq3rhist.bak: sound, " + count + " entries") &&
+                        last.ends_with("\n[0]"))
                 << trace << "\n"
-                << run("verify h/");
+                << last;
         }
     printf("%d hints followed\n", followed);
 }
