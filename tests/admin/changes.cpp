@@ -14,13 +14,18 @@ static const char more[] = "Operation: backup\nTimestamp: 20250108010000\nTables
 #define SPOIL(file, at)                                                                            \
     "printf '\\377' | dd of=h/zq3rhist." file " seek=" at " bs=1 conv=notrunc status=none; "
 #define CUT(file, size) "truncate -s " size " h/zq3rhist." file "; "
+#define OTHER                                                                                      \
+    "mkdir x; zq3hist dump h | sed s/20250107/20250109/ | zq3hist load x >new; "                   \
+    "cp x/zq3rhist.asc h/zq3rhist.bak; rm -r x; "
 #define KILLED "killed" // a batch of a process that was killed; its lock is there
+#define BEGUN "begun"   // a batch of this process, which holds the lock
 
 class ChangeTest : public ProgramTest
 {
   protected:
     std::string history, shadow;
     int followed = 0; // hints
+    SQLUH_HANDLE* begun = nullptr;
 
     void follow(const std::string& arguments, std::string* trace);
 
@@ -54,6 +59,7 @@ class ChangeTest : public ProgramTest
     // Puts the pair of the week there and does to it what state says.
     void prepare(const std::string& state)
     {
+        sqluhEndBatch(&begun, sqluhAbandon);
         removeLockSet(historyPath);
         for (const fs::path& file : fs::directory_iterator(directory))
             fs::remove(file);
@@ -62,6 +68,8 @@ class ChangeTest : public ProgramTest
         spill(shadowPath, shadow);
         if (state == KILLED)
             killWriter();
+        else if (state == BEGUN)
+            EXPECT_EQ(0, sqluhBeginBatch(&begun, directory.data()));
         else
             EXPECT_EQ(0, system(("cd " + root + "; :; " + state).c_str()));
     }
@@ -101,6 +109,12 @@ class ChangeTest : public ProgramTest
     std::string runStamped(const std::string& arguments)
     {
         std::string text = run(arguments);
+        std::string process = "process ";
+        for (size_t at = 0; (at = text.find(process, at)) != std::string::npos; at++)
+            if (size_t digits =
+                    text.find_first_not_of("0123456789", at + process.size()) - at - process.size();
+                digits != 0)
+                text.replace(at + process.size(), digits, "PID");
         for (size_t at = 0; (at = text.find("h/zq3rhist.", at)) != std::string::npos;) {
             at += strlen("h/zq3rhist.asc");
             if (text[at] == '.')
@@ -173,6 +187,49 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and settles "
          "what is unfinished\n[4]",
          "4 3"},
+        {BEGUN, "load --wait 0 h/ more", "zq3hist: the lock is held by process PID, h/\n[4]",
+         "3 3"},
+        {BEGUN, "verify h/",
+         "zq3rhist.asc: sound, 3 entries, and a batch is unfinished\nzq3rhist.bak: sound, 3 "
+         "entries\nzq3hist: process PID is changing the history; what is committed is "
+         "sound\n[0]",
+         "3 3"},
+        {BEGUN, "unlock h/", "zq3hist: the lock is held by process PID and was left alone, h/\n[4]",
+         "3 3"},
+        {KILLED, "status h/",
+         "history   zq3rhist.asc: 4129 bytes, status 'P' (a batch is unfinished), 3 entries, "
+         "newest "
+         "20250107010000 at offset 2582, node 0\n"
+         "shadow    zq3rhist.bak: 3361 bytes, status 'C' (consistent since the last commit), 3 "
+         "entries, newest 20250107010000 at offset 2582, node 0\n"
+         "lock      left by a process that died while it held it (key KEY, process PID)\n"
+         "          usable; the next open rebuilds the history from the shadow\n"
+         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and settles "
+         "what is unfinished\n[4]",
+         "4 3"},
+        {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "verify h/",
+         "zq3rhist.asc: sound, 3 entries\n"
+         "zq3rhist.bak: cannot be read at offset 0: Is a directory\n"
+         "zq3hist: the history is not sound, h/\n"
+         "zq3hist: hint: zq3hist verify h/  # again, once the reason that is given is gone\n[3]",
+         "3 -"},
+        {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "load h/ more",
+         "zq3hist: cannot append to the history: Is a directory, h/zq3rhist.bak\n"
+         "zq3hist: hint: zq3hist verify h/  # again, once the reason that is given is gone\n[1]",
+         "3 -"},
+        {OTHER, "verify h/",
+         "zq3rhist.asc: sound, 3 entries\nzq3rhist.bak: sound, 3 entries\n"
+         "The two files hold different entries.\nzq3hist: the history is not sound, h/\n"
+         "zq3hist: hint: zq3hist repair h/  # makes the shadow anew from the history file\n[3]",
+         "3 3"},
+        {OTHER, "prune --before 20250106000000 h/",
+         "zq3hist: cannot prune the history: the two files hold different entries, h/\n"
+         "zq3hist: hint: zq3hist repair h/  # makes the shadow anew from the history file\n[3]",
+         "3 3"},
+        {"", "prune h/", "zq3hist: prune takes --before TIMESTAMP\nTry 'zq3hist --help'.\n[2]",
+         "3 3"},
+        {"", "restore h/ none",
+         "zq3hist: cannot restore the history: No such file or directory, none\n[1]", "3 3"},
         {"", "backup h/ image",
          "zq3hist: there is a file of that name; --force replaces it, image\n[1]", "3 3"},
         {"", "backup --force h/ image", "3 entries backed up\n[0]", "3 3"},

@@ -6,43 +6,67 @@
 #include "admin/zq3hist.h"
 #include "tests/support.h"
 
-static int stepsLeft = -1; // what ends the process happens at the step that finds 0; -1: never
-static bool bySignal = false;
+enum stopKind { killed, signalled, failsOnce, failsOn };
+static stopKind kind;
+static int stepsLeft = -1; // it happens at the step that finds 0; -1: never
+static bool happened = false;
 
-static void endAtStep()
+static bool isDue()
 {
-    if (stepsLeft < 0 || stepsLeft-- != 0)
-        return;
-    if (!bySignal)
+    if (stepsLeft != 0) {
+        stepsLeft -= stepsLeft > 0;
+        return false;
+    }
+    happened = true;
+    stepsLeft = kind == failsOn ? 0 : -1;
+    return true;
+}
+
+// Returns the code with which the call fails, or 0 where it goes on.
+static int stop()
+{
+    if (kind == killed)
         _exit(42);
-    raise(SIGTERM);
+    if (kind == signalled)
+        raise(SIGTERM);
+    return kind == signalled ? 0 : static_cast<int>(DISK_FULL);
 }
 
 // A write is two steps, nothing and half of it done; so is a copy, the target untouched and empty.
 extern "C" int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* written)
 {
     auto write = reinterpret_cast<decltype(&sqlowrite)>(dlsym(RTLD_NEXT, "sqlowrite"));
-    endAtStep();
-    int rc = write(fh, buffer, stepsLeft == 0 && !bySignal ? count / 2 : count, written);
-    endAtStep();
-    return rc;
+    int rc = 0;
+    *written = 0;
+    if (isDue())
+        rc = stop();
+    if (rc == 0 && kind != signalled && isDue()) {
+        write(fh, buffer, count / 2, written);
+        rc = stop();
+    }
+    return rc != 0 ? rc : write(fh, buffer, count, written);
 }
 
 extern "C" int sqlocopy(const char* source, const char* target, unsigned int options)
 {
     auto copy = reinterpret_cast<decltype(&sqlocopy)>(dlsym(RTLD_NEXT, "sqlocopy"));
-    endAtStep();
-    if (stepsLeft == 0 && !bySignal)
+    int rc = 0;
+    if (isDue())
+        rc = stop();
+    if (rc == 0 && kind != signalled && isDue()) {
         spill(target, "");
-    endAtStep();
-    return copy(source, target, options);
+        rc = stop();
+    }
+    return rc != 0 ? rc : copy(source, target, options);
 }
 
 class StopTest : public HistoryTest
 {
   protected:
+    enum { untouched = 64 }; // added to the status: the step was not reached
+
     // Runs a subcommand; words that begin with a slash follow the scratch directory's name.
-    int run(std::vector<std::string> words, int stopAt = -1, bool signalled = false)
+    int run(std::vector<std::string> words, int stopAt = -1, stopKind stops = killed)
     {
         std::vector<char*> argv = {words[0].data()};
         for (std::string& word : words) {
@@ -56,14 +80,14 @@ class StopTest : public HistoryTest
             freopen((root + "said").c_str(), "w", stdout);
             dup2(STDOUT_FILENO, STDERR_FILENO);
             stepsLeft = stopAt;
-            bySignal = signalled;
+            kind = stops;
             int rc = runProgram(static_cast<int>(argv.size()) - 1, argv.data());
             fflush(stdout);
-            _exit(rc);
+            _exit(happened || stopAt < 0 ? rc : untouched + rc);
         }
         int status = 0;
         waitpid(child, &status, 0);
-        if (!signalled)
+        if (stops == killed)
             removeLockSet(historyPath), removeLockSet(root + "source/" SQLUH_HISTORY_NAME);
         return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
     }
@@ -132,22 +156,29 @@ TEST_F(StopTest, WhatIsLeftIsTheOldHistoryOrTheNewOne)
         putPair(row.history, row.shadow);
         ASSERT_EQ(0, run(row.words)) << row.name << slurp(root + "said");
         const std::string newEntries = entriesAfterOpen();
-        int stops = 0, status = 42, changed = 0;
-        for (; status == 42; stops++) {
-            putPair(row.history, row.shadow);
-            status = run(row.words, stops);
-            std::string left = slurp(historyPath);
-            bool untouched = left == row.history && slurp(shadowPath) == row.shadow;
-            std::string entries = untouched ? "" : entriesAfterOpen();
-            changed += entries == newEntries;
-            EXPECT_TRUE(entries == newEntries || untouched ||
-                        (changed == 0 && entries == row.history.substr(headerLength)) ||
-                        (changed == 0 && entries == row.shadow.substr(headerLength)))
-                << row.name << " stopped at " << stops;
+        for (stopKind stops : {killed, failsOnce, failsOn}) {
+            int steps = 0, status = 0, changed = 0;
+            for (; status < untouched; steps++) {
+                putPair(row.history, row.shadow);
+                status = run(row.words, steps, stops);
+                bool isOld = slurp(historyPath) == row.history && slurp(shadowPath) == row.shadow;
+                std::string entries = isOld ? "" : entriesAfterOpen();
+                changed += entries == newEntries;
+                bool mayBeOld = changed == 0 || stops != killed;
+                EXPECT_TRUE(entries == newEntries || isOld ||
+                            (mayBeOld && entries == row.history.substr(headerLength)) ||
+                            (mayBeOld && entries == row.shadow.substr(headerLength)))
+                    << row.name << stops << " stopped at " << steps << slurp(root + "said");
+                EXPECT_NE(0, status) << row.name << stops << " stopped at " << steps;
+                EXPECT_TRUE(stops == killed || lockKeyIsFree(historyPath));
+                for (const auto& file : std::filesystem::directory_iterator(directory))
+                    EXPECT_TRUE(stops == killed || file.path().extension() != ".tmp");
+            }
+            EXPECT_EQ(untouched, status) << row.name;
+            EXPECT_GT(changed, 1) << row.name;
+            if (stops == killed)
+                printf("%s: stopped at %d steps\n", row.name, steps - 1);
         }
-        EXPECT_EQ(0, status) << row.name;
-        EXPECT_GT(changed, 1) << row.name;
-        printf("%s: stopped at %d steps\n", row.name, stops - 1);
     }
 }
 
@@ -158,10 +189,10 @@ TEST_F(StopTest, AnInterruptedLoadIsUndoneOrTold)
     spill(root + "old", stanzas({"20250101000000", "20250102000000"}));
     ASSERT_EQ(0, run({"load", "/SAMPLE", "/old"}));
     const std::string history = slurp(historyPath), shadow = slurp(shadowPath);
-    int undone = 0, done = 0, status = 128 + SIGTERM;
-    for (int step = 0; status != 0; step++) {
+    int undone = 0, done = 0, status = 0;
+    for (int step = 0; status < untouched || status > 128; step++) {
         putPair(history, shadow);
-        status = run({"load", "/SAMPLE", "/old"}, step, true);
+        status = run({"load", "/SAMPLE", "/old"}, step, signalled);
         std::string said = slurp(root + "said");
         EXPECT_TRUE(lockKeyIsFree(historyPath)) << step;
         if (slurp(historyPath) == history && slurp(shadowPath) == shadow) {
@@ -170,7 +201,7 @@ TEST_F(StopTest, AnInterruptedLoadIsUndoneOrTold)
         } else {
             EXPECT_EQ("2 entries appended\n", said) << step;
             EXPECT_EQ(history.size() + 2 * size_t{entryMinLength}, slurp(historyPath).size());
-            done += status != 0;
+            done += status > 128;
         }
     }
     EXPECT_GT(undone, 1);
