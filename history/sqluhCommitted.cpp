@@ -86,7 +86,7 @@ static bool isEarlier(const timespec& a, const timespec& b)
     return a.tv_sec != b.tv_sec ? a.tv_sec < b.tv_sec : a.tv_nsec < b.tv_nsec;
 }
 
-static bool isSame(const timespec& a, const timespec& b)
+static bool isSameTime(const timespec& a, const timespec& b)
 {
     return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec;
 }
@@ -108,7 +108,7 @@ static void readClocks(timespec* clock, timespec* offset)
         clock_gettime(CLOCK_REALTIME_COARSE, clock);
         clock_gettime(CLOCK_MONOTONIC_COARSE, &steady);
         clock_gettime(CLOCK_REALTIME_COARSE, &again);
-    } while (!isSame(*clock, again));
+    } while (!isSameTime(*clock, again));
     *offset = difference(*clock, steady);
 }
 
@@ -124,7 +124,7 @@ static bool isOlder(const lookedFile* file, const timespec& clock)
 // --- The two files -------------------------------------------------------------------------------
 
 // Opens the file if it is there and reads its header. Returns 0, or what tells nothing of the file.
-static int lookAtFile(lookedFile* file)
+static int openToLook(lookedFile* file)
 {
     int rc = sqloopenp(file->path, sqloOpenRead, sqloPermissions, &file->fh);
     file->present = rc != systemCode(ENOENT) && rc != systemCode(ENOTDIR);
@@ -138,7 +138,7 @@ static int lookAtFile(lookedFile* file)
     return isShortage(rc) ? rc : 0;
 }
 
-static void closeFile(lookedFile* file)
+static void endLook(lookedFile* file)
 {
     if (file->fh.descriptor != sqloNoFile.descriptor)
         sqloclose(file->fh);
@@ -148,10 +148,10 @@ static void closeFile(lookedFile* file)
 static bool sameStatus(const struct stat& a, const struct stat& b)
 {
     return a.st_dev == b.st_dev && a.st_ino == b.st_ino && a.st_size == b.st_size &&
-           isSame(a.st_ctim, b.st_ctim);
+           isSameTime(a.st_ctim, b.st_ctim);
 }
 
-static bool isUnchanged(const lookedFile* file)
+static bool isAsItWas(const lookedFile* file)
 {
     struct stat status;
     bool there = stat(file->path, &status) == 0;
@@ -162,13 +162,13 @@ static bool isUnchanged(const lookedFile* file)
 }
 
 // Whether nobody wrote since the read began.
-static bool isQuiet(const pairRead* read)
+static bool nobodyWrote(const pairRead* read)
 {
     timespec clock;
     timespec offset;
-    bool unchanged = isUnchanged(&read->history) && isUnchanged(&read->shadow);
+    bool unchanged = isAsItWas(&read->history) && isAsItWas(&read->shadow);
     readClocks(&clock, &offset);
-    return unchanged && isSame(offset, read->offset) && !isEarlier(clock, read->clock);
+    return unchanged && isSameTime(offset, read->offset) && !isEarlier(clock, read->clock);
 }
 
 // Whether the file system's times are this system's own: the usual local ones.
@@ -307,8 +307,8 @@ static int readChosen(pairRead* read)
 
 static void endRead(pairRead* read)
 {
-    closeFile(&read->history);
-    closeFile(&read->shadow);
+    endLook(&read->history);
+    endLook(&read->shadow);
     sqluhFreeCommitted(&read->result);
 }
 
@@ -316,8 +316,8 @@ static void endRead(pairRead* read)
 static int beginRead(pairRead* read)
 {
     readClocks(&read->clock, &read->offset);
-    int rc = lookAtFile(&read->history);
-    int second = lookAtFile(&read->shadow);
+    int rc = openToLook(&read->history);
+    int second = openToLook(&read->shadow);
     return rc != 0 ? rc : second;
 }
 
@@ -329,7 +329,7 @@ static int readQuietly(pairRead* read, bool* proven)
     if (rc == 0 && isOlder(&read->history, read->clock) && isOlder(&read->shadow, read->clock) &&
         hasOwnTimes(&read->history) && hasOwnTimes(&read->shadow)) {
         rc = readChosen(read);
-        *proven = isQuiet(read);
+        *proven = nobodyWrote(read);
     }
     return rc;
 }
@@ -376,7 +376,7 @@ static bool isStillLocked(const char* path, const SQLO_NLCK* lock, int held)
 }
 
 // Holds back the signals that would end the process: it must not die with the lock.
-static void holdSignals(sigset_t* before)
+static void holdBackSignals(sigset_t* before)
 {
     static const int faults[] = {SIGSEGV, SIGBUS, SIGILL, SIGFPE, SIGABRT, SIGTRAP, SIGSYS};
     sigset_t held;
@@ -392,7 +392,7 @@ static int readLocked(pairRead* read, bool* done)
 {
     SQLO_NLCK lock = {-1, -1};
     sigset_t before;
-    holdSignals(&before);
+    holdBackSignals(&before);
     int held = tryLock(read->history.path, &lock);
     int rc = held;
     *done = false;

@@ -17,20 +17,17 @@ struct sqluhChunk {
     size_t size;
 };
 
-// The tablespace lines of an entry, as they stand in the file, after it. Before them, for each
-// name, where it begins in the lines and how long it is up to the first zero byte, if any.
-struct sqluhName {
-    uint32_t at;
-    uint32_t length;
-};
+// The tablespace lines of an entry as they stand in the file; they follow the places.
 struct sqluhNameList {
     uint32_t count;
     uint32_t length; // of the lines in bytes
+    bool zeroFree;   // no name ends early
     const char* lines;
 };
-static const sqluhName* namesOf(const sqluhNameList* list)
+// Where each name begins in the lines; one more place tells where the last one ends.
+static const uint32_t* placesOf(const sqluhNameList* list)
 {
-    return reinterpret_cast<const sqluhName*>(list + 1);
+    return reinterpret_cast<const uint32_t*>(list + 1);
 }
 
 // A text that ends a line of the record or stands on one.
@@ -123,24 +120,24 @@ static bool listsSame(const sqluhNameList* list, const char* lines, size_t room,
 static const sqluhNameList* makeNames(sqluhRows* rows, const char* lines, uint32_t length,
                                       uint32_t count, int* rc)
 {
-    size_t headLength = sizeof(sqluhNameList) + count * sizeof(sqluhName);
-    void* space = takeSpace(rows, headLength + length, rc);
+    size_t numPlaces = size_t{count} + 1;
+    void* space =
+        takeSpace(rows, sizeof(sqluhNameList) + numPlaces * sizeof(uint32_t) + length, rc);
     if (space == nullptr)
         return nullptr;
     sqluhNameList* list = static_cast<sqluhNameList*>(space);
-    sqluhName* names = reinterpret_cast<sqluhName*>(list + 1);
-    char* copy = reinterpret_cast<char*>(names + count);
-    *list = {count, length, copy};
+    uint32_t* places = reinterpret_cast<uint32_t*>(list + 1);
+    char* copy = reinterpret_cast<char*>(places + numPlaces);
     memcpy(copy, lines, length);
+    *list = {count, length, memchr(lines, '\0', length) == nullptr, copy};
 
     uint64_t head = 0;
     uint64_t characters = noTablespaceLength;
-    const char* at = copy;
-    for (uint32_t i = 0; i < count && tablespaceFits(at, copy + length, &head, &characters); i++) {
-        const char* name = at + tablespaceNameAt;
-        names[i] = {static_cast<uint32_t>(name - copy),
-                    static_cast<uint32_t>(strnlen(name, static_cast<size_t>(characters)))};
-        at = name + characters + 1;
+    places[0] = tablespaceNameAt;
+    for (uint32_t i = 0; i < count; i++) {
+        const char* line = copy + places[i] - tablespaceNameAt;
+        tablespaceFits(line, copy + length, &head, &characters);
+        places[i + 1] = places[i] + static_cast<uint32_t>(characters) + tablespaceLineExtra;
     }
     return list;
 }
@@ -190,7 +187,7 @@ static int shareEvent(sqluhRows* rows, const char* line, const sqlca** event)
 
 // --- Packing -------------------------------------------------------------------------------------
 
-static uint32_t lengthWithoutBlanks(const char* text, uint32_t length)
+static uint32_t lengthBeforeBlanks(const char* text, uint32_t length)
 {
     static constexpr uint64_t blanks = 0x2020202020202020; // most lines are nothing else
     while (length >= sizeof blanks && columnsAt(text + length - sizeof blanks) == blanks)
@@ -208,13 +205,13 @@ static uint32_t packCommand(char* target, const char* lines, uint32_t length)
         memcpy(target + done, lines, left < commandPieceLength ? left : commandPieceLength);
         lines += commandPieceLength + 1;
     }
-    return lengthWithoutBlanks(target, length);
+    return lengthBeforeBlanks(target, length);
 }
 
 static packedText packText(char** target, const char* text, uint32_t length)
 {
     packedText packed = {static_cast<uint32_t>(strnlen(text, length)), 0};
-    packed.stored = lengthWithoutBlanks(text, packed.length);
+    packed.stored = lengthBeforeBlanks(text, packed.length);
     memcpy(*target, text, packed.stored);
     *target += packed.stored;
     return packed;
@@ -315,12 +312,17 @@ static uint32_t writtenLength(packedText packed, uint32_t stated)
 
 static void unpackNames(zq3HistoryData* data, const sqluhNameList* list)
 {
-    const sqluhName* names = namesOf(list);
+    const uint32_t* places = placesOf(list);
     uint32_t stored = data->tablespaceBuffers == nullptr   ? 0
                       : list->count < data->maxTablespaces ? list->count
                                                            : data->maxTablespaces;
-    for (uint32_t i = 0; i < stored; i++)
-        copyText(&data->tablespaceBuffers[i], list->lines + names[i].at, names[i].length);
+    for (uint32_t i = 0; i < stored; i++) {
+        const char* name = list->lines + places[i];
+        uint32_t length = places[i + 1] - places[i] - tablespaceLineExtra;
+        if (!list->zeroFree)
+            length = static_cast<uint32_t>(strnlen(name, length));
+        copyText(&data->tablespaceBuffers[i], name, length);
+    }
 }
 
 static char letterOf(char written, bool asWritten)
