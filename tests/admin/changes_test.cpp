@@ -17,8 +17,9 @@ static const char more[] = "Operation: backup\nTimestamp: 20250108010000\nTables
 #define OTHER                                                                                      \
     "mkdir x; zq3hist dump h | sed s/20250107/20250109/ | zq3hist load x >new; "                   \
     "cp x/zq3rhist.asc h/zq3rhist.bak; rm -r x; "
-#define KILLED "killed" // a batch of a process that was killed; its lock is there
-#define BEGUN "begun"   // a batch of this process, which holds the lock
+#define KILLED "killed"       // a batch of a process that was killed; its lock is there
+#define BEGUN "begun"         // a batch of this process, which holds the lock
+#define COMMITTED "committed" // the shadow was not made anew after a commit
 
 class ChangeTest : public ProgramTest
 {
@@ -70,6 +71,8 @@ class ChangeTest : public ProgramTest
             killWriter();
         else if (state == BEGUN)
             EXPECT_EQ(0, sqluhBeginBatch(&begun, directory.data()));
+        else if (state == COMMITTED)
+            EXPECT_EQ(0, sqluhUpdateHeaderStatus(historyPath.data(), statusCommitted));
         else
             EXPECT_EQ(0, system(("cd " + root + "; :; " + state).c_str()));
     }
@@ -376,7 +379,9 @@ TEST_F(ChangeTest, LookingOnlyLooks)
                                          "rm h/zq3rhist.asc; ",
                                          "rm h/zq3rhist.bak; ",
                                          "rm h/*; ",
-                                         KILLED};
+                                         KILLED,
+                                         BEGUN,
+                                         COMMITTED};
     static const char* const commands[] = {"status h",
                                            "verify h",
                                            "dump h",
@@ -387,7 +392,13 @@ TEST_F(ChangeTest, LookingOnlyLooks)
                                            "backup --dry-run h new",
                                            "copy --dry-run h target",
                                            "copy --dry-run target h",
-                                           "prune --dry-run --before 20250107000000 h"};
+                                           "prune --dry-run --before 20250107000000 h",
+                                           "images h",
+                                           "plan h latest",
+                                           "chart h",
+                                           "check h",
+                                           "unneeded --keep 1 h",
+                                           "needed-by h 20250105010000"};
     fs::create_directory(root + "target");
     const auto look = [&] {
         int set = lockSetOf(historyPath);
@@ -403,6 +414,75 @@ TEST_F(ChangeTest, LookingOnlyLooks)
         for (const char* command : commands) {
             std::string said = run(command);
             EXPECT_EQ(before, look()) << state << command << said;
+        }
+    }
+}
+
+// Whoever only asks is answered as long as one file holds what was committed, and told what to know
+// about the files.
+TEST_F(ChangeTest, QuestionsAreAnsweredInEveryState)
+{
+#define SHADOW_READ "zq3hist: warning: the history file cannot be used; the shadow was read, h/\n"
+#define OTHER_READ(entry, file, at)                                                                \
+    "zq3hist: warning: entry " entry " of zq3rhist." file ", at offset " at                        \
+    ", is damaged; the other file was read, h/\n"
+#define UNUSABLE                                                                                   \
+    "zq3hist: cannot read the history: the history is damaged, h/\n"                               \
+    "zq3hist: hint: zq3hist verify h/  # names the damage and what mends it\n"
+#define DAMAGED_AT(entry, at)                                                                      \
+    "zq3hist: cannot read the history: entry " entry ", at offset " at                             \
+    ", is damaged, h/zq3rhist.asc\n"                                                               \
+    "zq3hist: hint: zq3hist verify h/  # reads both files and tells what mends them\n"
+    const struct {
+        const char* state;
+        int status;
+        const char* said;
+    } rows[] = {
+        {"", 0, ""},
+        {COMMITTED, 0, ""},
+        {SPOIL("bak", "10"), 0, ""},
+        {CUT("bak", "1803"), 0, ""},
+        {"rm h/zq3rhist.bak; ", 0, ""},
+        {SPOIL("bak", "2000"), 0, ""},
+        {BEGUN, 0,
+         "zq3hist: warning: a batch is being written; the state before it was read, h/\n"},
+        {KILLED, 0,
+         "zq3hist: warning: a process died while it held the lock, which stops the next writer, "
+         "h/\n"
+         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock, then settles "
+         "what was left unfinished\n"
+         "zq3hist: warning: a batch is unfinished; the state before it was read, h/\n"},
+        {SPOIL("asc", "10"), 0, SHADOW_READ},
+        {"rm h/zq3rhist.asc; ", 0, SHADOW_READ},
+        {CUT("asc", "1803"), 0, SHADOW_READ},
+        {SPOIL("asc", "1100"), 0, OTHER_READ("1", "asc", "1024")},
+        {SPOIL("asc", "2000"), 0, OTHER_READ("2", "asc", "1803")},
+        {SPOIL("asc", "2700"), 0, OTHER_READ("3", "asc", "2582")},
+        {SPOIL("asc", "10") SPOIL("bak", "10"), 3, UNUSABLE},
+        {": >h/zq3rhist.asc; : >h/zq3rhist.bak; ", 3, UNUSABLE},
+        {SPOIL("asc", "1100") SPOIL("bak", "1100"), 3, DAMAGED_AT("1", "1024")},
+        {SPOIL("asc", "2000") SPOIL("bak", "2000"), 3, DAMAGED_AT("2", "1803")},
+        {SPOIL("asc", "2700") SPOIL("bak", "2700"), 3, DAMAGED_AT("3", "2582")},
+    };
+    prepare("");
+    setenv("ZQ3DBPATH", root.c_str(), 1);
+    fs::create_directory_symlink(directory, root + "H");
+    const std::string zq3ckrst = "cd " + root + "; " ZQ3CKRST " -d h -t 20250106010000 >out 2>err";
+    const char* const questions[] = {"images h/", "plan h/ latest", "chart h/", "dump h/"};
+    std::vector<std::string> answers;
+    ASSERT_EQ(0, system(zq3ckrst.c_str()));
+    const std::string planned = slurp(root + "out");
+    for (const char* question : questions)
+        answers.push_back((run(question), slurp(root + "out")));
+    for (const auto& row : rows) {
+        prepare(row.state);
+        EXPECT_EQ(row.status == 0, system(zq3ckrst.c_str()) == 0) << row.state;
+        EXPECT_EQ(row.status == 0 ? planned : "", slurp(root + "out")) << row.state;
+        for (size_t i = 0; i < answers.size() - (row.status != 0); i++) { // a dump says other words
+            std::string said = run(questions[i]);
+            EXPECT_EQ(row.said, slurp(root + "err")) << row.state << questions[i];
+            EXPECT_EQ(row.status == 0 ? answers[i] : "", slurp(root + "out")) << row.state;
+            EXPECT_TRUE(said.ends_with(row.status == 0 ? "[0]" : "[3]")) << said;
         }
     }
 }
