@@ -2,6 +2,7 @@
 // replay; nothing in the library but the utilities stands on it.
 
 #include "history/sqluhDiagnostics.h"
+#include "history/sqluhRecovery.h"
 #include "history/sqluhist.h"
 
 // --- Open and close ------------------------------------------------------------------------------
@@ -54,9 +55,13 @@ int sqluhClose(SQLUH_HANDLE** handle)
 
     int rc = 0;
     if (*handle != nullptr) {
-        rc = closeFile(*handle, __func__);
+        // An image that could not be put in force, or is another process's file by now, is not
+        // copied: no file has the empty name, and the shadow stays what it is.
+        rc = sqluhCommitRestore(*handle);
+        const char* image = rc == 0 ? (*handle)->historyPath : "";
+        rc = firstOf(rc, closeFile(*handle, __func__));
         if ((*handle)->restoredFromImage)
-            rc = firstOf(rc, logged(sqlocopy((*handle)->historyPath, (*handle)->shadowPath, 0)));
+            rc = firstOf(rc, logged(sqlocopy(image, (*handle)->shadowPath, 0)));
         (*handle)->restoredFromImage = false;
         rc = firstOf(rc, logged(sqluhUnlock(*handle)));
         sqluhHandleFree(handle);

@@ -21,6 +21,9 @@
 //   shadow from history, copied               'C'                  'C'      again from the history
 //   moved aside                               absent               absent   an empty pair is made
 
+#include "history/sqluhRecovery.h"
+
+#include <cerrno>
 #include <cstring>
 
 #include "history/sqluhDiagnostics.h"
@@ -28,22 +31,28 @@
 #include "history/sqluhfun.h"
 #include "history/sqluhist.h"
 
+static int updateStatus(const char* path, char status, bool durable, const char* operation)
+{
+    SQLO_FHANDLE fh = sqloNoFile;
+    SQLUH_HEADER header;
+    int rc = logged(sqloopenp(path, sqloOpenUpdate, sqloPermissions, &fh), operation);
+    if (rc == 0) {
+        rc = logged(sqluhReadHeader(fh, &header), operation);
+        if (rc == 0) {
+            header.status = status;
+            rc = logged(sqluhWriteHeader(fh, &header), operation);
+        }
+        if (rc == 0 && durable)
+            rc = logged(sqlosync(fh), operation);
+        rc = firstOf(rc, logged(sqloclose(fh), operation));
+    }
+    return rc;
+}
+
 int sqluhUpdateHeaderStatus(char* path, char status)
 {
     pdtEntry();
-
-    SQLO_FHANDLE fh = sqloNoFile;
-    SQLUH_HEADER header;
-    int rc = logged(sqloopenp(path, sqloOpenUpdate, sqloPermissions, &fh));
-    if (rc == 0) {
-        rc = logged(sqluhReadHeader(fh, &header));
-        if (rc == 0) {
-            header.status = status;
-            rc = logged(sqluhWriteHeader(fh, &header));
-        }
-        rc = firstOf(rc, logged(sqloclose(fh)));
-    }
-
+    int rc = updateStatus(path, status, false, __func__);
     pdtExit(rc);
     return rc;
 }
@@ -149,12 +158,42 @@ bool sqluhVerifyHistFilesAreIndentical(SQLUH_HANDLE* handle)
     return identical;
 }
 
-// A file that cannot be opened or read is not usable; what closing it says does not count.
-static SQLUH_FILESTATE examineFile(SQLUH_HANDLE* handle, const char* path)
+// Whether an open or a header's reading failed for a reason that lies outside the file, which then
+// may be sound: no descriptor free, no right, no memory, a device that does not answer.
+static bool isUnseen(int rc)
+{
+    static const int told[] = {0,
+                               END_OF_FILE,
+                               HISTORY_FILE_DAMAGED,
+                               sqloFileIncomplete,
+                               sqloSystemError | ENOENT,
+                               sqloSystemError | EISDIR,
+                               sqloSystemError | EINVAL};
+    for (int code : told)
+        if (rc == code)
+            return false;
+    return true;
+}
+
+// A file that cannot be opened or read is not usable; what closing it says does not count. *unseen
+// receives the code if it says nothing about the file.
+static SQLUH_FILESTATE examineFile(SQLUH_HANDLE* handle, const char* path, int* unseen)
 {
     int closed = 0;
     int rc = readHeaderOf(handle, path, &closed);
+    if (isUnseen(rc))
+        *unseen = rc;
     return sqluhStateOfFile(rc, &handle->header);
+}
+
+// Looks at both files and decides. Returns 0, or what kept one of them from being looked at.
+static int examineFiles(SQLUH_HANDLE* handle, sqluhRepair* due)
+{
+    int unseen = 0;
+    SQLUH_FILESTATE history = examineFile(handle, handle->historyPath, &unseen);
+    SQLUH_FILESTATE shadow = examineFile(handle, handle->shadowPath, &unseen);
+    *due = sqluhDecideRepair(history, shadow);
+    return unseen;
 }
 
 SQLUH_FILESTATE sqluhStateOfFile(int rc, const SQLUH_HEADER* header)
@@ -201,9 +240,10 @@ int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
         // Locked before there is anything in it. Someone else may have been first, and then has
         // made the pair; while the old file is in its place its lock keeps everybody out.
         bool made = false;
+        int unseen = 0;
         if (moved == 0 && handle->isLocked) {
             rc = logged(sqluhFollowLock(handle, __func__));
-            made = rc == 0 && examineFile(handle, handle->historyPath).usable;
+            made = rc == 0 && examineFile(handle, handle->historyPath, &unseen).usable;
         }
         if (rc == 0 && !made)
             rc = sqluhCreate(handle->directory);
@@ -230,11 +270,16 @@ static int repair(SQLUH_HANDLE* handle, sqluhRepair due, const char* operation)
 
 static int examineAndRepair(SQLUH_HANDLE* handle, bool optToRecover, const char* operation)
 {
-    SQLUH_FILESTATE history = examineFile(handle, handle->historyPath);
-    SQLUH_FILESTATE shadow = examineFile(handle, handle->shadowPath);
-    sqluhRepair due = sqluhDecideRepair(history, shadow);
+    sqluhRepair due;
+    int unseen = examineFiles(handle, &due);
+    // What kept a file from being looked at may have passed. Nor is a pair given up for want of
+    // sight.
+    if (unseen != 0)
+        unseen = examineFiles(handle, &due);
     if (!optToRecover)
         return due == sqluhRepairAnew ? HISTORY_FILE_DAMAGED : 0;
+    if (due == sqluhRepairAnew && unseen != 0)
+        return logged(unseen, operation);
     if (due == sqluhRepairAnew) {
         int rc = sqluhRecoverFromFatalError(handle);
         return rc == 0 ? HISTORY_FILE_RECREATED : rc;
@@ -252,6 +297,43 @@ int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOu
         rc = logged(sqluhLock(*handleOut));
     if (rc == 0)
         rc = examineAndRepair(*handleOut, optToRecover, __func__);
+
+    pdtExit(rc);
+    return rc;
+}
+
+int sqluhKeepCommitted(SQLUH_HANDLE* handle)
+{
+    pdtEntry();
+
+    sqluhRepair due;
+    int rc = logged(examineFiles(handle, &due));
+    if (rc == 0 &&
+        (due == sqluhRepairShadow || (due == sqluhRepairNone && !sizesAgree(handle, __func__))))
+        rc = logged(sqlocopy(handle->historyPath, handle->shadowPath, 0));
+    if (rc == 0 && due != sqluhRepairAnew)
+        rc = updateStatus(handle->shadowPath, statusPending, true, __func__); // RP
+
+    pdtExit(rc);
+    return rc;
+}
+
+int sqluhCommitRestore(SQLUH_HANDLE* handle)
+{
+    pdtEntry();
+
+    int rc = handle->restoreCode;
+    if (rc == 0 && handle->restoreMarked) {
+        SQLO_FHANDLE image = handle->fileHandle;
+        rc = logged(sqloNLCKCheckHeld(&handle->namedLock));
+        if (rc == 0)
+            rc = logged(sqloreserve(handle->historyPath, handle->shadowPath));
+        if (rc == 0)
+            rc = sqluhKeepCommitted(handle);
+        handle->fileHandle = image;
+        if (rc == 0)
+            rc = logged(sqlounmark(image));
+    }
 
     pdtExit(rc);
     return rc;

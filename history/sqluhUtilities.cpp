@@ -4,6 +4,7 @@
 
 #include "history/sqluhDiagnostics.h"
 #include "history/sqluhHandle.h"
+#include "history/sqluhRecovery.h"
 #include "history/sqluhfun.h"
 #include "history/sqluhist.h"
 
@@ -113,37 +114,42 @@ int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned
     return rc;
 }
 
-// What someone who came between the creation of the new file and its lock has put there goes. He
-// may have moved the file itself aside, so the path tells, not the handle.
-static int emptyFile(SQLUH_HANDLE* handle)
-{
-    char name[] = SQLUH_HISTORY_NAME;
-    unsigned long long size = 0;
-    int rc = sqluh_history_file_get_size(handle->directory, name, &size);
-    if (rc != 0 || size == 0)
-        return rc;
-    rc = sqloclose(handle->fileHandle);
-    handle->fileHandle = sqloNoFile;
-    if (rc == 0)
-        rc = createdCode(
-            sqloopenp(handle->historyPath, sqloOpenNew, sqloPermissions, &handle->fileHandle));
-    return rc;
-}
-
-// Puts an empty file in the place of the history file.
-static int replaceHistoryFile(SQLUH_HANDLE* handle, const char* operation)
+static int closeToReplace(SQLUH_HANDLE* handle)
 {
     int rc = sqloclose(handle->fileHandle);
     handle->fileHandle = sqloNoFile;
+    return rc;
+}
+
+static int openToReplace(SQLUH_HANDLE* handle, unsigned int option)
+{
+    int rc =
+        createdCode(sqloopenp(handle->historyPath, option, sqloPermissions, &handle->fileHandle));
+    if (rc != 0)
+        handle->fileHandle = sqloNoFile;
+    return rc;
+}
+
+// Puts an empty file in the place of the history file, which is marked until the image is whole.
+static int replaceHistoryFile(SQLUH_HANDLE* handle, const char* operation)
+{
+    handle->restoreCode = 0;
+    int rc = closeToReplace(handle);
     if (rc == 0)
         rc = sqlodelete(handle->historyPath, 0);
     if (rc == 0)
-        rc = createdCode(sqloopenp(handle->historyPath, sqloOpenReplacement, sqloPermissions,
-                                   &handle->fileHandle));
+        rc = openToReplace(handle, sqloOpenReplacement);
     if (rc == 0)
         rc = sqluhFollowLock(handle, operation);
+    // Between its creation and its lock someone may have written to the new file, or have put one
+    // of his own in its place: what stands at the path now is emptied.
     if (rc == 0)
-        rc = emptyFile(handle);
+        rc = closeToReplace(handle);
+    if (rc == 0)
+        rc = openToReplace(handle, sqloOpenNew);
+    if (rc == 0)
+        rc = sqlomark(handle->fileHandle);
+    handle->restoreMarked = rc == 0;
     return rc;
 }
 
@@ -165,7 +171,25 @@ int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsign
             rc = transferCode(rc);
     }
 
+    handle->restoreCode = firstOf(handle->restoreCode, rc);
+
     pdtExit(logged(rc));
+    return rc;
+}
+
+// Copies the history file into a directory: before, its shadow holds what is committed there;
+// afterwards, no shadow stands beside the copy.
+static int copyInto(const char* source, char* targetDirectory, const char* operation)
+{
+    SQLUH_HANDLE* target = nullptr;
+    int rc = logged(sqluhHandleAllocAndInit(targetDirectory, &target), operation);
+    if (rc == 0)
+        rc = sqluhKeepCommitted(target);
+    if (rc == 0)
+        rc = logged(sqlocopy(source, target->historyPath, 0), operation);
+    if (rc == 0 && ossPathExists(target->shadowPath))
+        rc = logged(sqlodelete(target->shadowPath, 0), operation);
+    sqluhHandleFree(&target);
     return rc;
 }
 
@@ -174,15 +198,12 @@ int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory)
     pdtEntry();
 
     SQLUH_HANDLE* handle = nullptr;
-    char source[pathCapacity] = {};
-    char target[pathCapacity] = {};
-    int rc = sqluhJoinPath(target, sizeof target, targetDirectory, SQLUH_HISTORY_NAME);
-    if (rc == 0)
-        rc = sqluhJoinPath(source, sizeof source, sourceDirectory, SQLUH_HISTORY_NAME);
+    // Told before the source is opened.
+    int rc = strlen(targetDirectory) <= maxDirectoryLength ? 0 : sqluhPathTooLong;
     if (rc == 0)
         rc = sqluhOpen(&handle, sourceDirectory, SQLUH_OPEN_READ);
     if (rc == 0)
-        rc = logged(sqlocopy(source, target, 0));
+        rc = copyInto(handle->historyPath, targetDirectory, __func__);
     // With the warning the source had become an empty history: it is passed on, and the target
     // keeps what it has.
     rc = firstOf(rc, logged(sqluhClose(&handle)));

@@ -15,6 +15,22 @@ static void initialHeader(SQLUH_HEADER* header)
     memcpy(header->timestamp, SQLUH_EMPTY_TIMESTAMP, timestampWidth);
 }
 
+// Writes the header, first as that of a file that nobody takes for sound. N: from then on the two
+// differ in the first sector only, so that the device keeps either the one or the other.
+static int writeFirstHeader(SQLO_FHANDLE fh, const char* operation)
+{
+    SQLUH_HEADER header;
+    initialHeader(&header);
+    header.status = statusPending;
+    int rc = logged(sqluhWriteHeader(fh, &header), operation);
+    if (rc == 0)
+        rc = logged(sqlosync(fh), operation);
+    header.status = statusConsistent;
+    if (rc == 0)
+        rc = logged(sqluhWriteHeader(fh, &header), operation);
+    return rc;
+}
+
 int sqluhCreate(char* directory)
 {
     pdtEntry1(directory, strlen(directory));
@@ -22,7 +38,6 @@ int sqluhCreate(char* directory)
     char historyPath[createPathCapacity] = {};
     char shadowPath[createPathCapacity] = {};
     SQLO_FHANDLE fh = sqloNoFile;
-    SQLUH_HEADER header;
     int rc = 0;
 
     if (strlen(directory) > maxCreateDirectoryLength) {
@@ -33,8 +48,7 @@ int sqluhCreate(char* directory)
         rc = logged(createdCode(sqloopenp(historyPath, sqloOpenNew, sqloPermissions, &fh)));
     }
     if (rc == 0) {
-        initialHeader(&header);
-        rc = logged(sqluhWriteHeader(fh, &header));
+        rc = writeFirstHeader(fh, __func__);
         bool written = rc == 0;
         rc = firstOf(rc, logged(sqloclose(fh)));
         // The shadow comes into being as the copy of a complete history file, never before it. The

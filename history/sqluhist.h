@@ -392,6 +392,8 @@ struct SQLUH_HANDLE {
     char shadowPath[pathCapacity];
     SQLUH_REPLAYAREA replayArea;
     bool restoredFromImage; // rewritten from a backup image; the close copies it over the shadow
+    bool restoreMarked;     // its file is marked until the whole image is there
+    int restoreCode;        // of the first piece of the image that failed
 };
 
 // Allocates and initialises a handle, the caller's until sqluhHandleFree; opens and locks nothing.
@@ -408,16 +410,18 @@ enum : unsigned int { SQLUH_OPEN_READ = 4, SQLUH_OPEN_UPDATE = 12 };
 
 // Takes the directory's lock, checks and repairs the two files, opens the history file and reads
 // its header. Waits without limit for the lock; whoever holds a handle on the directory must not
-// open it again. A file that cannot be opened or read counts as damaged, whatever the reason.
-// Returns 0 or HISTORY_FILE_RECREATED with an open handle, to be released by sqluhClose; or with
-// null stored HISTORY_FILE_DAMAGED; sqluhPathTooLong; a lock code; an allocation's code; a failure
-// of sqluhCreate.
+// open it again in another thread. A file that cannot be opened or read counts as damaged, whatever
+// the reason, but two are not given up while one of them may be sound. Returns 0 or
+// HISTORY_FILE_RECREATED with an open handle, to be released by sqluhClose; or with null stored
+// HISTORY_FILE_DAMAGED; sqluhPathTooLong; a lock code; an allocation's code; what kept a file from
+// being looked at; a failure of sqluhCreate.
 int sqluhOpen(SQLUH_HANDLE** handleOut, char* directory, unsigned int accessMode);
 
-// Closes the file, copies a restored history over the shadow, releases the lock and frees the
-// handle, whatever fails on the way; the caller's pointer, which may have been null, is null
-// afterwards. Returns 0 or the first failure: the close's code, the copy's, or a code of
-// sqluhUnlock.
+// Closes the file, puts a restored image in force and copies it over the shadow, releases the lock
+// and frees the handle, whatever fails on the way; the caller's pointer, which may have been null,
+// is null afterwards. 0 after a restore means that the image is in place. Returns 0 or the first
+// failure: with the old history in force, the code of the piece that failed, sqloNLCKLost, or what
+// kept the image from being put in force; the close's code, the copy's, or a code of sqluhUnlock.
 int sqluhClose(SQLUH_HANDLE** handle);
 
 // Takes the directory's lock for the handle, without limit of time; puts an empty history file
@@ -547,14 +551,17 @@ int sqluhBeginBatch(SQLUH_HANDLE** handle, char* directory);
 
 // Commits (bit 0 of flags set) or abandons the batch, and closes the handle in every case; null is
 // accepted. Returns 0 or the first failure: a code of sqluhWriteHeader, of
-// sqluhReplayWorkInShadow or of sqluhClose, or a sync's code. After a failed commit the next open
+// sqluhReplayWorkInShadow or of sqluhClose, a sync's code, or sqloNLCKLost, and nothing of the
+// batch stays, when the lock was taken away during it. After a failed commit the next open
 // settles whether the batch survived. A handle without an open file or without the lock is only
 // closed: nothing is committed, and 0 does not mean that it was.
 int sqluhEndBatch(SQLUH_HANDLE** handle, unsigned int flags);
 
-// Copies the history file of one directory over that of another, whose lock is not taken; each
-// directory: at most 1011 bytes. Returns 0; HISTORY_FILE_RECREATED, and nothing copied, when the
-// source was unusable; sqluhPathTooLong; a failure of sqluhOpen or sqluhClose; the copy's code.
+// Copies the history file of one directory over that of another, whose lock is not taken and which
+// has no shadow afterwards; each directory: at most 1011 bytes. Stopped at any moment, the target
+// holds its old or the new history. Returns 0; HISTORY_FILE_RECREATED, and nothing copied, when the
+// source was unusable; sqluhPathTooLong; a failure of sqluhOpen or sqluhClose; the copy's or the
+// deletion's code; what kept a file of the target from being looked at or marked.
 int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory);
 
 } // extern "C"
@@ -616,9 +623,11 @@ int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned
                              unsigned char* buffer, unsigned int* bytesRead);
 
 // Writes a piece of a backup image, length bytes for offset, over the open history file; the piece
-// at offset 0 comes first and replaces the file. Whatever comes back, sqluhClose then copies the
-// history file over the shadow. Returns 0; the code of the failing close, delete, open, file query,
-// seek or write, unmapped; a short write's transfer code; a lock code, of the new file's lock.
+// at offset 0 comes first and replaces the file, which nobody can open until sqluhClose has found
+// every piece written, puts it in force and copies it over the shadow. Until then, and after any
+// failure, the old history is in force. An image whose own header says 'P' is safe only when the
+// close has returned. Returns 0; the code of the failing close, delete, open, mark, seek or write,
+// unmapped; a short write's transfer code; a lock code, of the new file's lock.
 int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned char* buffer,
                                unsigned int length);
 

@@ -15,6 +15,8 @@ enum : int {
     DISK_FULL = static_cast<int>(0x850F000C),       // a write found no space
     sqloSystemError = static_cast<int>(0x83000000), // or-ed with the errno of the failed call
 };
+// What a file marked by sqlomark is refused with: ENODATA.
+enum : int { sqloFileIncomplete = static_cast<int>(0x8300003D) };
 // What an open that creates may return beside 0: done, the file was there before.
 enum : int { sqloFileExisted = 0x070F00CB };
 
@@ -32,7 +34,7 @@ enum : unsigned int {
     sqloOpenUpdate = 0x4C,      // read and write an existing file
     sqloOpenShadow = 0x0C,      // read and write an existing file
     sqloOpenTouch = 0x19,       // write; create if missing, never truncate
-    sqloOpenNew = 0x5A,         // read and write; create or truncate
+    sqloOpenNew = 0x5A,         // read and write; create, or empty and take off the mark
     sqloOpenReplacement = 0x0F, // read and write; create
 };
 enum : unsigned int { sqloPermissions = 0640 };
@@ -59,8 +61,11 @@ extern "C" {
 
 // Opens a regular file and fills *fh, which is the caller's to close. options: one of the words
 // above; permissions: bits of a file that this call creates. A file created by it is durably in its
-// directory when the call returns. Returns 0 or sqloFileExisted with the file open; or, with *fh
-// sqloNoFile, DISK_FULL when a created file's name could not be stored, or sqloSystemError.
+// directory when the call returns. A file that sqlomove was refused for, and that could not be
+// opened since, is not emptied instead. Returns 0 or sqloFileExisted with the file open; or, with
+// *fh sqloNoFile, sqloFileIncomplete for a marked file that shall neither be made nor emptied,
+// DISK_FULL when a created file's name could not be stored, the code of the refused move, or
+// sqloSystemError.
 int sqloopenp(const char* path, unsigned int options, unsigned int permissions, SQLO_FHANDLE* fh);
 
 // Closes a file. Its handle is of no use afterwards, whatever comes back.
@@ -85,16 +90,31 @@ int sqlochgfileptr(SQLO_FHANDLE fh, long long offset, unsigned int origin, long 
 // be lost, also when a second call returns 0. Returns 0, DISK_FULL or sqloSystemError.
 int sqlosync(SQLO_FHANDLE fh);
 
+// sqlomark marks an open, empty file as incomplete, durably. A marked file can be made, emptied,
+// moved and replaced by a copy, which all but the move take the mark off, but neither opened for
+// what is in it nor copied. sqlounmark takes the mark off a whole file; a stop at any moment leaves
+// the file marked, or without its first bytes, or whole, and durable but for those bytes. Return 0,
+// DISK_FULL or sqloSystemError.
+int sqlomark(SQLO_FHANDLE fh);
+int sqlounmark(SQLO_FHANDLE fh);
+
+// Makes sure that target, which is not changed, has room to become a copy of source. Returns 0
+// (also for a target that does not exist, and where the file system reserves nothing), DISK_FULL or
+// sqloSystemError.
+int sqloreserve(const char* source, const char* target);
+
 // Makes target a durable copy of source, keeping target's inode if it exists. The source is made
-// durable first; the target's first 8 bytes, by which it is recognised, are written last, so that
-// nobody takes a copy that stopped part-way for a whole one. A copy of a file onto itself is
-// refused. options: 0. Returns 0, DISK_FULL or sqloSystemError; the target then is as it was or
-// empty, or is whole when only its closing failed.
+// durable and the target's room reserved first; the target's first 8 bytes, by which it is
+// recognised, are written last, so that nobody takes a copy that stopped part-way for a whole one.
+// A copy of a file onto itself, or of a marked file, is refused. options: 0. Returns 0,
+// sqloFileIncomplete, DISK_FULL, the code of a move that target was refused for, or
+// sqloSystemError; the target then is as it was or empty, or is whole when only its closing failed.
 int sqlocopy(const char* source, const char* target, unsigned int options);
 
 // Renames source to target, durably. A target that holds anything is first kept under its own name
 // with ".1", ".2", ... appended: whoever moves a damaged file aside loses nothing by doing it
-// twice. Returns 0, DISK_FULL or sqloSystemError.
+// twice. A file that cannot be opened and read is refused: it may be sound. Returns 0, DISK_FULL or
+// sqloSystemError.
 int sqlomove(const char* source, const char* target);
 
 // Deletes a file, durably. options: 0. Returns 0, DISK_FULL or sqloSystemError.

@@ -5,6 +5,7 @@
 #include <cstdarg>
 #include <cstddef>
 #include <cstdint>
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include "sqo/sqlo.h"
@@ -30,17 +31,41 @@ inline int storeFailure(int number)
 int osseOpen(const char* path, int flags, mode_t permissions);
 
 // Opens a regular file; anything else (directory, pipe, device) is refused without blocking. flags
-// with O_CREAT create a missing file. Returns 0 or a code.
-int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor);
+// with O_CREAT create a missing file. Returns 0 with the file's status, or a code.
+int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor,
+                    struct stat* status);
 
 // Transfers at an offset until count bytes are done or, reading, the file ends; *done is the number
 // of bytes transferred, also on failure. Returns 0 or a code.
 int osseReadAt(int descriptor, void* buffer, size_t count, off_t offset, size_t* done);
 int osseWriteAt(int descriptor, const void* buffer, size_t count, off_t offset, size_t* done);
 
-// Barriers; nothing happens while ZQ3SYNC is "off". osseSyncDirectoryOf takes the path of a file.
+// A file's first bytes are what a reader recognises it by; they are written last. Few, so that what
+// a device writes at once holds all of them, whatever the size of its sectors.
+static constexpr size_t markLength = 8;
+
+// Writes a few bytes and waits until they are on the disk, in one call: no process can stop between
+// the two and leave the bytes to be seen by others and lost with the power. Returns 0 or a code.
+int osseWriteDurably(int descriptor, const void* buffer, size_t count, off_t offset);
+
+// Barriers; nothing happens while ZQ3SYNC is "off". osseSyncDirectoryOf takes the path of a file,
+// osseSyncMode makes a changed mode durable, too.
 int osseSync(int descriptor);
+int osseSyncMode(int descriptor);
 int osseSyncDirectoryOf(const char* path);
+
+// The mark of an incomplete file, in its mode: a permission bit that means nothing else on a file.
+inline bool osseIsMarked(const struct stat* status)
+{
+    return (status->st_mode & S_ISVTX) != 0;
+}
+// Sets it or takes it off. Returns 0 or a code.
+int osseSetMark(int descriptor, const struct stat* status, bool marked);
+
+// What a move was refused for must not be emptied instead: remembers the code of the refusal until
+// the file can be opened or moved. osseRefusal returns it, or 0.
+void osseRefuse(const struct stat* status, int code);
+int osseRefusal(const struct stat* status);
 
 // Text of one log or trace record in a buffer of fixed size, so that running out of memory can be
 // logged too. What does not fit is cut, and the cut is marked.

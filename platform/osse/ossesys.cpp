@@ -6,7 +6,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
-#include <sys/stat.h>
+#include <pthread.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 int osseOpen(const char* path, int flags, mode_t permissions)
@@ -26,21 +27,19 @@ int osseOpen(const char* path, int flags, mode_t permissions)
     return descriptor;
 }
 
-int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor)
+int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descriptor,
+                    struct stat* status)
 {
     *descriptor = -1;
-    if (path == nullptr)
-        return systemFailure(EINVAL);
     const int opened = osseOpen(path, flags, permissions);
     if (opened < 0)
         return systemFailure(errno);
 
-    struct stat status;
     int rc = 0;
-    if (fstat(opened, &status) != 0)
+    if (fstat(opened, status) != 0)
         rc = systemFailure(errno);
-    else if (!S_ISREG(status.st_mode))
-        rc = systemFailure(S_ISDIR(status.st_mode) ? EISDIR : EINVAL);
+    else if (!S_ISREG(status->st_mode))
+        rc = systemFailure(S_ISDIR(status->st_mode) ? EISDIR : EINVAL);
     if (rc != 0) {
         close(opened);
         return rc;
@@ -92,11 +91,31 @@ static bool barriersAreOff()
     return value != nullptr && strcmp(value, "off") == 0;
 }
 
+int osseWriteDurably(int descriptor, const void* buffer, size_t count, off_t offset)
+{
+    iovec bytes = {const_cast<void*>(buffer), count};
+    ssize_t put = -1;
+    do
+        put = barriersAreOff() ? pwrite(descriptor, buffer, count, offset)
+                               : pwritev2(descriptor, &bytes, 1, offset, RWF_DSYNC);
+    while (put < 0 && errno == EINTR);
+    if (put < 0)
+        return storeFailure(errno);
+    return static_cast<size_t>(put) == count ? 0 : systemFailure(EIO);
+}
+
 // A sync that failed, even an interrupted one, is not repeated: the system reports the loss of
 // written data once, and a second sync may succeed without it.
 int osseSync(int descriptor)
 {
     if (barriersAreOff() || fdatasync(descriptor) == 0)
+        return 0;
+    return storeFailure(errno);
+}
+
+int osseSyncMode(int descriptor)
+{
+    if (barriersAreOff() || fsync(descriptor) == 0)
         return 0;
     return storeFailure(errno);
 }
@@ -121,4 +140,50 @@ int osseSyncDirectoryOf(const char* path)
     const int rc = fsync(descriptor) == 0 ? 0 : storeFailure(errno);
     close(descriptor);
     return rc;
+}
+
+int osseSetMark(int descriptor, const struct stat* status, bool marked)
+{
+    const mode_t mode = status->st_mode & ~static_cast<mode_t>(S_ISVTX | S_IFMT);
+    if (osseIsMarked(status) == marked)
+        return 0;
+    return fchmod(descriptor, marked ? mode | S_ISVTX : mode) == 0 ? 0 : systemFailure(errno);
+}
+
+struct refusedFile {
+    dev_t device;
+    ino_t inode;
+    int code; // 0: no longer refused
+};
+static refusedFile refusedFiles[16]; // a move is rare, and a refused one rarer
+static unsigned int nextRefused;
+static pthread_mutex_t refusedMutex = PTHREAD_MUTEX_INITIALIZER;
+
+// The file's element, or null. The mutex is held.
+static refusedFile* findRefused(const struct stat* status)
+{
+    for (refusedFile& file : refusedFiles)
+        if (file.code != 0 && file.device == status->st_dev && file.inode == status->st_ino)
+            return &file;
+    return nullptr;
+}
+
+void osseRefuse(const struct stat* status, int code)
+{
+    pthread_mutex_lock(&refusedMutex);
+    refusedFile* file = findRefused(status);
+    if (file == nullptr && code != 0)
+        file = &refusedFiles[nextRefused++ % 16];
+    if (file != nullptr)
+        *file = {status->st_dev, status->st_ino, code};
+    pthread_mutex_unlock(&refusedMutex);
+}
+
+int osseRefusal(const struct stat* status)
+{
+    pthread_mutex_lock(&refusedMutex);
+    const refusedFile* file = findRefused(status);
+    const int code = file == nullptr ? 0 : file->code;
+    pthread_mutex_unlock(&refusedMutex);
+    return code;
 }

@@ -4,8 +4,8 @@
 //
 //   R0  the source                     before the target is emptied
 //   D   the target's name              before there is anything under it
-//   CH  the target's body              before the mark that vouches for it
-//   R4  the target's mark, and so all  before the copy returns
+//   CH  the target's body              before the first bytes that vouch for it
+//   R4  the first bytes, and so all    in one call with their writing
 #include "osse.h"
 
 #include <climits>
@@ -13,12 +13,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
-// A file's mark, its first bytes, is what a reader recognises it by; it is written last. Short, so
-// that what a device writes at once holds all of it, whatever the size of its sectors.
-static constexpr size_t markLength = 8;
 static constexpr size_t copyLength = size_t{256} * 1024;
 
 // Reads the whole source once and keeps nothing: a source that cannot be read to its end must not
@@ -34,7 +30,7 @@ static int checkReadable(int source, unsigned char* buffer)
     }
 }
 
-// Copies what follows the mark; *length is the number of bytes.
+// Copies what follows the first bytes; *length is the number of bytes.
 static int copyBody(int source, int target, unsigned char* buffer, off_t* length)
 {
     *length = 0;
@@ -50,27 +46,37 @@ static int copyBody(int source, int target, unsigned char* buffer, off_t* length
     }
 }
 
-// Replaces what the target holds. The order is what makes a stop harmless: with the target empty
-// and its body durable before the mark exists, no mark ever stands before another file's body.
-static int replaceContents(int source, int target, off_t targetSize, unsigned char* buffer)
+// Makes sure that the target will find room for so many bytes, without changing it. A file system
+// that reserves nothing is believed to have it.
+static int reserveRoom(int target, off_t size)
 {
-    unsigned char mark[markLength];
-    size_t markRead;
-    int rc = osseReadAt(source, mark, markLength, 0, &markRead);
+    int result = 0;
+    do
+        result = size == 0 ? 0 : fallocate(target, FALLOC_FL_KEEP_SIZE, 0, size);
+    while (result != 0 && errno == EINTR);
+    return result == 0 || errno == EOPNOTSUPP ? 0 : storeFailure(errno);
+}
+
+// Replaces what the target holds. The order is what makes a stop harmless: with the target empty
+// and its body durable before the first bytes exist, they never stand before another file's body.
+static int replaceContents(int source, int target, const struct stat* was, unsigned char* buffer)
+{
+    unsigned char first[markLength];
+    size_t firstRead;
+    int rc = osseReadAt(source, first, markLength, 0, &firstRead);
     if (rc != 0)
         return rc;
     if (ftruncate(target, 0) != 0)
         return storeFailure(errno);
 
     off_t bodyLength;
-    size_t markWritten;
     rc = copyBody(source, target, buffer, &bodyLength);
-    if (rc == 0 && (bodyLength != 0 || targetSize != 0))
-        rc = osseSync(target); // CH
     if (rc == 0)
-        rc = osseWriteAt(target, mark, markRead, 0, &markWritten);
+        rc = osseSetMark(target, was, false);
+    if (rc == 0 && (bodyLength != 0 || was->st_size != 0))
+        rc = osseSyncMode(target); // CH, for a mark that went off before, too
     if (rc == 0)
-        rc = osseSync(target); // R4
+        rc = osseWriteDurably(target, first, firstRead, 0); // R4
 
     // A copy that failed must not look like one that was done; it also gives back the space.
     if (rc != 0) {
@@ -80,24 +86,26 @@ static int replaceContents(int source, int target, off_t targetSize, unsigned ch
 }
 
 // The target keeps its inode: it is opened and emptied, not replaced.
-static int copyToTarget(int source, const char* targetPath, unsigned char* buffer)
+static int copyToTarget(int source, const struct stat* from, const char* targetPath,
+                        unsigned char* buffer)
 {
     int target;
-    int rc = osseOpenRegular(targetPath, O_WRONLY | O_CREAT, sqloPermissions, &target);
+    struct stat to;
+    int rc = osseOpenRegular(targetPath, O_WRONLY | O_CREAT, sqloPermissions, &target, &to);
     if (rc != 0)
         return rc;
 
-    struct stat from, to;
-    if (fstat(source, &from) != 0 || fstat(target, &to) != 0)
-        rc = systemFailure(errno);
-    else if (from.st_dev == to.st_dev && from.st_ino == to.st_ino)
+    rc = osseRefusal(&to);
+    if (from->st_dev == to.st_dev && from->st_ino == to.st_ino)
         rc = systemFailure(EINVAL);
     // D, also for a target that was there: whoever made it may have stopped before this. A target
-    // with a mark then never loses its name.
+    // with its first bytes then never loses its name.
     if (rc == 0)
         rc = osseSyncDirectoryOf(targetPath);
     if (rc == 0)
-        rc = replaceContents(source, target, to.st_size, buffer);
+        rc = reserveRoom(target, from->st_size);
+    if (rc == 0)
+        rc = replaceContents(source, target, &to, buffer);
     if (close(target) != 0 && errno != EINTR && rc == 0)
         rc = storeFailure(errno);
     return rc;
@@ -108,20 +116,36 @@ OSSE_EXPORT int sqlocopy(const char* sourcePath, const char* targetPath, unsigne
     if (options != 0)
         return systemFailure(EINVAL);
     int source;
-    int rc = osseOpenRegular(sourcePath, O_RDONLY, 0, &source);
+    struct stat from;
+    int rc = osseOpenRegular(sourcePath, O_RDONLY, 0, &source, &from);
     if (rc != 0)
         return rc;
 
-    rc = osseSync(source); // R0
     unsigned char* buffer = static_cast<unsigned char*>(malloc(copyLength));
-    if (rc == 0 && buffer == nullptr)
+    if (buffer == nullptr)
         rc = systemFailure(ENOMEM);
+    if (rc == 0)
+        rc = osseIsMarked(&from) ? int{sqloFileIncomplete} : osseSync(source); // R0
     if (rc == 0)
         rc = checkReadable(source, buffer);
     if (rc == 0)
-        rc = copyToTarget(source, targetPath, buffer);
+        rc = copyToTarget(source, &from, targetPath, buffer);
     free(buffer);
     close(source);
+    return rc;
+}
+
+OSSE_EXPORT int sqloreserve(const char* sourcePath, const char* targetPath)
+{
+    int target;
+    struct stat from, to;
+    if (stat(sourcePath, &from) != 0)
+        return systemFailure(errno);
+    int rc = osseOpenRegular(targetPath, O_WRONLY, 0, &target, &to);
+    if (rc != 0)
+        return rc == systemFailure(ENOENT) ? 0 : rc;
+    rc = reserveRoom(target, from.st_size);
+    close(target);
     return rc;
 }
 
@@ -175,6 +199,23 @@ static bool areInOneDirectory(const char* a, const char* b)
     return lengthA == lengthB && memcmp(a, b, static_cast<size_t>(lengthA)) == 0;
 }
 
+// A file that cannot be read just now may be sound: it stays where it is looked for.
+static int checkMovable(const char* path, const struct stat* status)
+{
+    int source;
+    struct stat opened;
+    unsigned char byte;
+    size_t got;
+    if (!S_ISREG(status->st_mode))
+        return 0;
+    int rc = osseOpenRegular(path, O_RDONLY, 0, &source, &opened);
+    if (rc != 0)
+        return rc;
+    rc = osseReadAt(source, &byte, 1, 0, &got);
+    close(source);
+    return rc;
+}
+
 OSSE_EXPORT int sqlomove(const char* source, const char* target)
 {
     // Looked at first: a source that is missing, or is the target, must not displace the target.
@@ -184,7 +225,10 @@ OSSE_EXPORT int sqlomove(const char* source, const char* target)
     if (lstat(target, &to) == 0 && from.st_dev == to.st_dev && from.st_ino == to.st_ino)
         return systemFailure(EINVAL);
 
-    int rc = renameKeepingTarget(source, target);
+    int rc = checkMovable(source, &from);
+    if (rc == 0)
+        rc = renameKeepingTarget(source, target);
+    osseRefuse(&from, rc);
     if (rc == 0)
         rc = osseSyncDirectoryOf(target);
     if (rc == 0 && !areInOneDirectory(source, target))

@@ -9,7 +9,6 @@
 #include <cstring>
 #include <fcntl.h>
 #include <pthread.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 // A read-ahead starts small, so that reading a header stays cheap, and grows while the file is read
@@ -59,7 +58,6 @@ static int flagsOfWord(unsigned int options)
     case sqloOpenTouch:
         return O_WRONLY | O_CREAT;
     case sqloOpenNew:
-        return O_RDWR | O_CREAT | O_TRUNC;
     case sqloOpenReplacement:
         return O_RDWR | O_CREAT;
     default:
@@ -91,6 +89,26 @@ static int enterFile(int descriptor, SQLO_FHANDLE* fh)
     return rc;
 }
 
+// Of a file that an open empties. One that the open made is empty already.
+static int emptyFile(int descriptor, const struct stat* status)
+{
+    int rc = status->st_size == 0 ? 0 : osseRefusal(status);
+    if (rc == 0 && ftruncate(descriptor, 0) != 0)
+        rc = systemFailure(errno);
+    if (rc == 0 && osseIsMarked(status))
+        rc = osseSetMark(descriptor, status, false);
+    return rc == 0 && osseIsMarked(status) ? osseSyncMode(descriptor) : rc;
+}
+
+// Of a file that is opened for what is in it.
+static int admitFile(const struct stat* status)
+{
+    if (osseIsMarked(status))
+        return sqloFileIncomplete;
+    osseRefuse(status, 0);
+    return 0;
+}
+
 OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int permissions,
                           SQLO_FHANDLE* fh)
 {
@@ -100,7 +118,12 @@ OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int p
         return systemFailure(EINVAL);
 
     int descriptor;
-    int rc = osseOpenRegular(path, flags, permissions, &descriptor);
+    struct stat status;
+    int rc = osseOpenRegular(path, flags, permissions, &descriptor, &status);
+    if (rc == 0 && options == sqloOpenNew)
+        rc = emptyFile(descriptor, &status);
+    else if (rc == 0 && (flags & O_CREAT) == 0)
+        rc = admitFile(&status);
     // D, also for a file that was there: whoever made it may have stopped before this.
     if (rc == 0 && (flags & O_CREAT) != 0)
         rc = osseSyncDirectoryOf(path);
@@ -266,4 +289,41 @@ OSSE_EXPORT int sqlosync(SQLO_FHANDLE fh)
 {
     const openFile* file = findFile(fh);
     return file == nullptr ? systemFailure(EBADF) : osseSync(file->descriptor);
+}
+
+OSSE_EXPORT int sqlomark(SQLO_FHANDLE fh)
+{
+    const openFile* file = findFile(fh);
+    struct stat status;
+    if (file == nullptr)
+        return systemFailure(EBADF);
+    int rc = fstat(file->descriptor, &status) == 0 ? 0 : systemFailure(errno);
+    if (rc == 0)
+        rc = osseSetMark(file->descriptor, &status, true);
+    return rc == 0 ? osseSyncMode(file->descriptor) : rc; // MB
+}
+
+// A mode cannot be changed and made durable in one call, contents can: while the mode changes, the
+// first bytes are missing, and their return is what counts.
+OSSE_EXPORT int sqlounmark(SQLO_FHANDLE fh)
+{
+    const openFile* file = findFile(fh);
+    struct stat status;
+    static const unsigned char blank[markLength] = {};
+    unsigned char mark[markLength];
+    size_t length, put;
+    if (file == nullptr)
+        return systemFailure(EBADF);
+    int rc = fstat(file->descriptor, &status) == 0 ? 0 : systemFailure(errno);
+    if (rc == 0)
+        rc = osseReadAt(file->descriptor, mark, markLength, 0, &length);
+    if (rc == 0)
+        rc = osseWriteAt(file->descriptor, blank, length, 0, &put);
+    if (rc == 0)
+        rc = osseSync(file->descriptor); // MZ
+    if (rc == 0)
+        rc = osseSetMark(file->descriptor, &status, false);
+    if (rc == 0)
+        rc = osseSyncMode(file->descriptor); // MM
+    return rc == 0 ? osseWriteAt(file->descriptor, mark, length, 0, &put) : rc;
 }

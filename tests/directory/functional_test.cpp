@@ -8,8 +8,7 @@ class FunctionalTest : public DirectoryTest
     void checkOnly(const scenario& s)
     {
         store(filesOf(s.before));
-        EXPECT_EQ(filesOf(s.after).size() == 2,
-                  sqluhCheckIfHistoryFilesAreUseable(directory.data()));
+        EXPECT_EQ(s.outcomes[0] != 0, sqluhCheckIfHistoryFilesAreUseable(directory.data()));
         const std::string touched = s.before[0] == '-' ? "empty" : s.before.substr(0, 1);
         EXPECT_TRUE(load() == filesOf(touched + s.before.substr(1)));
     }

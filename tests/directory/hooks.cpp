@@ -5,6 +5,7 @@
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/uio.h>
 
 static std::string service; // the OS-services call that is under way
 
@@ -38,6 +39,9 @@ HOOK(sqloseek, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* a
 HOOK(sqlochgfileptr, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* at),
      (fh, offset, origin, at), 0, code)
 HOOK(sqlosync, (SQLO_FHANDLE fh), (fh), 0, code)
+HOOK(sqlomark, (SQLO_FHANDLE fh), (fh), 0, code)
+HOOK(sqlounmark, (SQLO_FHANDLE fh), (fh), 0, code)
+HOOK(sqloreserve, (const char* from, const char* to), (from, to), 0, code)
 HOOK(sqlocopy, (const char* from, const char* to, unsigned word), (from, to, word), 0, code)
 HOOK(sqlomove, (const char* from, const char* to), (from, to), 0, code)
 HOOK(sqlodelete, (const char* path, unsigned word), (path, word), 0, code)
@@ -66,13 +70,22 @@ extern "C" int semctl(int id, int number, int command, ...) noexcept
 
 // --- System calls under the files ----------------------------------------------------------------
 
+// Whether the test wants the system call to fail. Logs are none of its business.
+static bool fails(const char* call, const char* path = "")
+{
+    const int number = onSystemCall && path != std::string("/dev/null") ? onSystemCall(call) : 0;
+    errno = number != 0 ? number : errno;
+    return number != 0;
+}
+
 // What a call on an open file is to be logged as.
 static diskOp opOn(int fd, diskKind kind)
 {
     struct stat status;
     std::error_code ignored;
+    static const auto real = next(&fstat, "fstat64");
     const auto path = std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd), ignored);
-    return {kind, fstat(fd, &status) == 0 ? status.st_ino : 0, 0, "", path.string()};
+    return {kind, real(fd, &status) == 0 ? status.st_ino : 0, 0, "", path.string()};
 }
 
 // Lets a call happen as far as it may, logs it, and stops after it where it shall.
@@ -98,8 +111,28 @@ template <typename call> static auto perform(diskOp op, call happen) -> decltype
     return -1;
 }
 
+extern "C" ssize_t pread(int fd, void* buffer, size_t count, off_t offset)
+{
+    static const auto real = next(&pread, "pread64");
+    return fails("pread") ? -1 : real(fd, buffer, count, offset);
+}
+
+extern "C" int fstat(int fd, struct stat* status) noexcept
+{
+    static const auto real = next(&fstat, "fstat64");
+    return fails("fstat") ? -1 : real(fd, status);
+}
+
+extern "C" int fallocate(int fd, int mode, off_t offset, off_t length)
+{
+    static const auto real = next(&fallocate, "fallocate64");
+    return fails("fallocate") ? -1 : real(fd, mode, offset, length);
+}
+
 extern "C" ssize_t pwrite(int fd, const void* buffer, size_t count, off_t offset)
 {
+    if (fails("pwrite"))
+        return -1;
     static const auto real = next(&pwrite, "pwrite64");
     diskOp op = opOn(fd, diskWrite);
     op.at = static_cast<size_t>(offset);
@@ -110,6 +143,8 @@ extern "C" ssize_t pwrite(int fd, const void* buffer, size_t count, off_t offset
 extern "C" int ftruncate(int fd, off_t length) noexcept
 {
     static const auto real = next(&ftruncate, "ftruncate64");
+    if (fails("ftruncate"))
+        return -1;
     diskOp op = opOn(fd, diskTruncate);
     op.at = static_cast<size_t>(length);
     return perform(op, [&](size_t) { return real(fd, length); });
@@ -123,6 +158,8 @@ extern "C" int open(const char* path, int flags, ...)
     va_start(rest, flags);
     const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
     va_end(rest);
+    if (fails("open", path))
+        return -1;
     const bool exists = access(path, F_OK) == 0;
     if (!disk.watching || (flags & (exists ? O_TRUNC : O_CREAT)) == 0)
         return real(path, flags, mode);
@@ -139,36 +176,84 @@ extern "C" int open(const char* path, int flags, ...)
 extern "C" int unlink(const char* path) noexcept
 {
     static const auto real = next(&unlink, "unlink");
-    return perform({diskUnlink, 0, 0, "", path}, [&](size_t) { return real(path); });
+    return fails("unlink")
+               ? -1
+               : perform({diskUnlink, 0, 0, "", path}, [&](size_t) { return real(path); });
 }
 
 extern "C" int rename(const char* path, const char* newPath) noexcept
 {
     static const auto real = next(&rename, "rename");
-    return perform({diskRename, 0, 0, "", path, newPath},
-                   [&](size_t) { return real(path, newPath); });
+    return fails("rename") ? -1 : perform({diskRename, 0, 0, "", path, newPath}, [&](size_t) {
+        return real(path, newPath);
+    });
 }
 
-// Of a batch B1 to B4; of a copy that of the source, of the target's head, or of its body.
-static std::string barrierName(int fd)
+// Of a batch B1 to B4; of a copy that of the source or of the body; those of a mark.
+static std::string barrierName(int fd, bool withMode)
 {
     const auto ofBatch = [](const diskOp& op) { return op.barrier.starts_with('B'); };
+    if (service == "sqlosync" && disk.log.size() > 1 && disk.log.end()[-2].kind == diskNames)
+        return "N";
+    if (service == "sqlosync" && disk.replacing)
+        return "RP";
     if (service == "sqlosync")
         return std::string("B") + char('1' + std::ranges::count_if(disk.log, ofBatch));
-    if (disk.log.empty() || (fcntl(fd, F_GETFL) & O_ACCMODE) == O_RDONLY)
-        return "R0";
-    return disk.log.back().kind == diskWrite && disk.log.back().at == 0 ? "R4" : "CH";
+    if (service == "sqlomark")
+        return "MB";
+    if (service == "sqlounmark")
+        return withMode ? "MM" : "MZ";
+    return (fcntl(fd, F_GETFL) & O_ACCMODE) == O_RDONLY ? "R0" : "CH";
 }
 
 // Nothing waits for a real disk here: what a sync does is in the log.
-extern "C" int fdatasync(int fd)
+static int syncFile(int fd, bool withMode)
 {
+    if (fails("sync"))
+        return -1;
     diskOp op = opOn(fd, diskSync);
-    op.barrier = barrierName(fd);
+    op.at = withMode;
+    op.barrier = barrierName(fd, withMode);
     return perform(op, [](size_t) { return 0; });
 }
 
-extern "C" int fsync(int)
+extern "C" int fdatasync(int fd)
 {
-    return perform({diskNames, 0, 0, "", "", "", "D"}, [](size_t) { return 0; });
+    return syncFile(fd, false);
+}
+
+extern "C" int fsync(int fd)
+{
+    const diskOp op = opOn(fd, diskNames);
+    if (std::filesystem::is_regular_file(op.name))
+        return syncFile(fd, true);
+    return fails("sync") ? -1
+                         : perform({diskNames, 0, 0, "", "", "", "D"}, [](size_t) { return 0; });
+}
+
+// The write that waits, too: one call, in which no process can stop.
+extern "C" ssize_t pwritev2(int fd, const iovec* bytes, int, off_t offset, int)
+{
+    if (without == "one call") {
+        const ssize_t put = pwrite(fd, bytes->iov_base, bytes->iov_len, offset);
+        return put < 0 || syncFile(fd, false) != 0 ? -1 : put;
+    }
+    static const auto real = next(&pwrite, "pwrite64");
+    if (fails("pwritev2"))
+        return -1;
+    diskOp op = opOn(fd, diskWrite);
+    op.at = static_cast<size_t>(offset);
+    op.bytes.assign(static_cast<const char*>(bytes->iov_base), bytes->iov_len);
+    op.barrier = "R4";
+    return perform(op, [&](size_t part) { return real(fd, bytes->iov_base, part, offset); });
+}
+
+extern "C" int fchmod(int fd, mode_t mode) noexcept
+{
+    static const auto real = next(&fchmod, "fchmod");
+    if (without == "mark" || fails("fchmod"))
+        return without == "mark" ? 0 : -1;
+    diskOp op = opOn(fd, diskMode);
+    op.at = (mode & S_ISVTX) != 0;
+    return perform(op, [&](size_t) { return real(fd, mode); });
 }

@@ -7,6 +7,7 @@
 #include <random>
 #include <sys/mman.h>
 #include <sys/wait.h>
+#include <thread>
 #include <utility>
 
 // Of one path in some thousands of millions the system makes this key, which nobody shares.
@@ -102,7 +103,7 @@ class LockTest : public ProcessTest
         EXPECT_EQ(row.held ? 0 : sqloSystemError | EINVAL, sqloNLCKUnlock(&holder));
     }
 
-    // The pid of a creator that ended just before the given call of its setup.
+    // The pid of a creator, a zombie now, that ended just before the given call of its setup.
     pid_t creatorThatDiesBefore(int step)
     {
         const pid_t creator = inChild([&] {
@@ -111,7 +112,9 @@ class LockTest : public ProcessTest
             };
             return sqloNLCKLock(&lock, 0, -1);
         });
-        EXPECT_EQ(77, WEXITSTATUS(waitFor(creator)));
+        siginfo_t info;
+        EXPECT_EQ(0, waitid(P_PID, static_cast<id_t>(creator), &info, WEXITED | WNOWAIT));
+        EXPECT_EQ(77, info.si_status);
         return creator;
     }
 };
@@ -157,26 +160,29 @@ TEST_F(LockTest, ForeignSetsAreLeftAlone)
 TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
 {
     store(filesOf("empty"));
+    setenv("ZQ3DIAGLOG", logPath.c_str(), 1);
     lockState();
     for (const int step : {SETVAL, -1, IPC_STAT, IPC_SET}) {
         const pid_t creator = creatorThatDiesBefore(step);
         SQLO_NLCKSTATE state = lockState();
-        if (step == SETVAL) {
-            // No operation yet, so no pid: only the set's age tells.
-            EXPECT_EQ(sqloNLCKSettingUp, state.state);
-            EXPECT_EQ(sqloNLCKBusy, sqloNLCKRemoveDead(&lock, &state));
-            sleep(4);
-            state = lockState();
-        }
-        EXPECT_EQ(sqloNLCKSetupDied, state.state) << step;
-        EXPECT_EQ(step == SETVAL ? 0 : creator, state.pid) << step;
         // Whoever wants the lock meanwhile waits, and gets it when the set is gone.
         const pid_t waiter =
             inChild([&] { return sqloNLCKLock(&lock, 0, 0) != 0 || sqloNLCKUnlock(&lock) != 0; });
+        if (step == SETVAL) {
+            // No operation yet, so no pid: only the set's age tells. The waiter tells, too, once.
+            EXPECT_EQ(sqloNLCKSettingUp, state.state);
+            EXPECT_EQ(sqloNLCKBusy, sqloNLCKRemoveDead(&lock, &state));
+            sleep(5);
+            state = lockState();
+            EXPECT_EQ(1u, takeLog().size());
+        }
+        EXPECT_EQ(sqloNLCKSetupDied, state.state) << step;
+        EXPECT_EQ(step == SETVAL ? 0 : creator, state.pid) << step;
         usleep(5000);
         EXPECT_EQ(0, waitpid(waiter, nullptr, WNOHANG));
         EXPECT_EQ(0, sqloNLCKRemoveDead(&lock, &state));
         EXPECT_EQ(0, waitFor(waiter));
+        waitFor(creator);
     }
 }
 
@@ -288,6 +294,15 @@ TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
     const SQLO_NLCKSTATE stale = lockState();
     EXPECT_EQ(sqloNLCKStale, stale.state);
     EXPECT_EQ(sqloNLCKBusy, sqloNLCKRemoveDead(&lock, &held)); // no longer what was seen
+    // Whoever does not know the directory finds the set as well.
+    SQLO_NLCK other;
+    SQLO_NLCKSTATE found = {};
+    for (int index = 0; found.id != stale.id;)
+        ASSERT_EQ(0, sqloNLCKNext(&index, &other, &found));
+    EXPECT_EQ(sqloNLCKStale, found.state);
+    EXPECT_EQ(lock.key, other.key);
+    for (int index = 0, rc = 0; rc != END_OF_FILE;)
+        ASSERT_LE(0, (rc = sqloNLCKNext(&index, &other, &found)) == END_OF_FILE ? 0 : rc);
     EXPECT_EQ(0, sqloNLCKRemoveDead(&lock, &stale));
     EXPECT_EQ("", faultOf({10}));
 }
@@ -314,26 +329,130 @@ TEST_F(ProcessTest, NobodyGetsInWhileTheHolderOfANewFileWorks)
     }
 }
 
-// Between the creation of the new file and its lock another process may find nothing but damage,
-// and move the new file aside.
-TEST_F(ProcessTest, ARestoreDoesNotFollowAFileThatWasMovedAside)
+// A restore of two entries over ten, with something done by another process between the creation of
+// the new file and its lock.
+class RestoreTest : public ProcessTest
 {
+  protected:
+    template <typename use> int restoreMeeting(use other)
+    {
+        store(filesOf(" 10/ 10"));
+        EXPECT_EQ(0, sqluhOpen(&handle, directory.data(), SQLUH_OPEN_UPDATE));
+        bool entered = false;
+        onCall = [&](const std::string& call, int) {
+            if (call == "semget" && !std::exchange(entered, true))
+                other();
+            return 0;
+        };
+        const int rc = restore(handle, samples.at(2));
+        onCall = nullptr;
+        EXPECT_TRUE(entered);
+        return rc;
+    }
+
     SQLUH_HANDLE* handle = nullptr;
+};
+
+// It may find nothing but damage, and move the new file aside; and then fail to make its own.
+TEST_F(RestoreTest, DoesNotFollowAFileThatWasMovedAside)
+{
+    for (const int failure : {0, int{DISK_FULL}}) {
+        EXPECT_EQ(0, restoreMeeting([&] {
+                      spill(shadowPath, "junk");
+                      EXPECT_EQ(0, waitFor(inChild([&] {
+                                    onCall = [&](const std::string& call, int) {
+                                        return call == "sqlowrite" ? failure : 0;
+                                    };
+                                    return openAndClose() != (failure == 0 ? 2160 : failure);
+                                })));
+                  }));
+        EXPECT_EQ(0, sqluhClose(&handle));
+        EXPECT_TRUE(samples.at(2) == slurp(historyPath) && samples.at(2) == slurp(shadowPath));
+        EXPECT_EQ(0, removeSetsLeft());
+    }
+}
+
+// It may die in a batch on the new file: what it has left is not copied.
+TEST_F(RestoreTest, LeavesTheShadowToADeadProcessBatch)
+{
+    EXPECT_EQ(sqloNLCKOwnerDied, restoreMeeting([&] {
+                  waitFor(inChild([&] {
+                      SQLUH_HANDLE* batch = nullptr;
+                      return sqluhBeginBatch(&batch, directory.data()) + append(batch, 1);
+                  }));
+              }));
+    EXPECT_EQ(sqloNLCKOwnerDied, sqluhClose(&handle));
+    const SQLO_NLCKSTATE state = lockState();
+    EXPECT_EQ(0, sqloNLCKRemoveDead(&lock, &state));
+    EXPECT_EQ("", faultOf({10}));
+}
+
+// No room for the shadow, or an administrator's hand at the lock: the old history stays.
+TEST_F(RestoreTest, IsRefusedWhereItCouldNotBeFinished)
+{
+    for (const bool isFull : {true, false}) {
+        EXPECT_EQ(0, restoreMeeting([] {}));
+        const std::string shadow = slurp(shadowPath);
+        if (isFull)
+            onSystemCall = [](const std::string& call) { return call == "fallocate" ? ENOSPC : 0; };
+        else
+            EXPECT_EQ(0, semctl(handle->namedLock.id, 0, IPC_RMID));
+        EXPECT_EQ(isFull ? int{DISK_FULL} : int{sqloNLCKLost}, sqluhClose(&handle));
+        onSystemCall = nullptr;
+        EXPECT_TRUE(shadow == slurp(shadowPath));
+        EXPECT_EQ("", faultOf({10}));
+    }
+}
+
+// The lock taken away, by its removal or by a step that fakes the holder's death: the holder's
+// batch is refused, and what others did meanwhile stays.
+TEST_F(ProcessTest, ABatchWhoseLockWasTakenAwayIsRefused)
+{
+    for (const bool isRemoved : {true, false}) {
+        SQLUH_HANDLE* handle = nullptr;
+        store(filesOf(" 10/ 10"));
+        ASSERT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
+        EXPECT_EQ(0, append(handle, 2));
+        EXPECT_EQ(0, waitFor(inChild([&] {
+                      sembuf step = {0, 1, 0};
+                      if (!isRemoved)
+                          return semop(handle->namedLock.id, &step, 1) != 0 ||
+                                 batch(1) != sqloNLCKOwnerDied ||
+                                 lockState().state != sqloNLCKFaked;
+                      return semctl(handle->namedLock.id, 0, IPC_RMID) != 0 || batch(1) != 0;
+                  })));
+        EXPECT_EQ(sqloNLCKLost, sqluhEndBatch(&handle, sqluhCommit));
+        EXPECT_EQ("", faultOf({isRemoved ? 11u : 10u}));
+    }
+}
+
+// No descriptor, or no right: a sound pair stays where it is.
+TEST_F(ProcessTest, APairThatCannotBeOpenedIsNotMovedAside)
+{
+    for (const int error : {EMFILE, EACCES}) {
+        const Files before = filesOf(" 10/ 10");
+        store(before);
+        bool isEmpty = false;
+        onSystemCall = [&](const std::string& call) { return call == "open" ? error : 0; };
+        EXPECT_EQ(sqloSystemError | error, openAndClose());
+        EXPECT_EQ(sqloSystemError | error, sqluhIsHistoryFileEmpty(directory.data(), &isEmpty));
+        EXPECT_EQ(sqloSystemError | error, batch(1));
+        onSystemCall = nullptr;
+        EXPECT_TRUE(load() == before);
+    }
+}
+
+TEST_F(ProcessTest, AThreadDoesNotWaitForItself)
+{
     store(filesOf(" 10/ 10"));
-    ASSERT_EQ(0, sqluhOpen(&handle, directory.data(), SQLUH_OPEN_UPDATE));
-    spill(shadowPath, "junk");
-    bool entered = false;
-    onCall = [&](const std::string& call, int) {
-        if (call == "semget" && !std::exchange(entered, true)) {
-            EXPECT_EQ(0, waitFor(inChild([&] { return openAndClose() != 2160; })));
-        }
-        return 0;
-    };
-    EXPECT_EQ(0, restore(handle, samples.at(2)));
-    EXPECT_TRUE(entered);
-    onCall = nullptr;
-    EXPECT_EQ(0, sqluhClose(&handle));
-    EXPECT_EQ(samples.at(2), slurp(historyPath));
-    EXPECT_EQ(samples.at(2), slurp(shadowPath));
-    EXPECT_EQ(0, removeSetsLeft());
+    SQLUH_HANDLE* handle = nullptr;
+    ASSERT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
+    EXPECT_EQ(sqloNLCKDeadlock, batch(1));
+    int other = -1;
+    std::thread waiter([&] { other = openAndClose(); });
+    usleep(20000);
+    EXPECT_EQ(-1, other);
+    EXPECT_EQ(0, sqluhEndBatch(&handle, sqluhCommit));
+    waiter.join();
+    EXPECT_EQ(0, other);
 }

@@ -1,11 +1,13 @@
 // The OS-services layer: files against a naive model, copies and moves under a log of the system
 // calls, memory, records. Every test has a directory of its own.
 #include <algorithm>
+#include <cstdarg>
 #include <random>
 
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/uio.h>
 #include <sys/wait.h>
 
 #include "sqo/sqlpd.h"
@@ -140,6 +142,7 @@ TEST_F(osse, ResizedBlockKeepsItsBytesAndGainsZeros)
 // The system calls made, and the one of them to fail.
 static std::string calls;
 static int untilFailure = -1, failure = 0;
+static bool noDescriptor;
 
 static bool fails(const std::string& call)
 {
@@ -158,9 +161,23 @@ extern "C" ssize_t pwrite(int descriptor, const void* bytes, size_t count, off_t
     return REAL(pwrite)(descriptor, bytes, std::min(count, size_t{2000}), offset);
 }
 
+extern "C" ssize_t pwritev2(int descriptor, const iovec* bytes, int, off_t offset, int)
+{
+    if (fails("write and wait for " + std::to_string(bytes->iov_len)))
+        return -1;
+    return REAL(pwrite)(descriptor, bytes->iov_base, bytes->iov_len, offset);
+}
+
 extern "C" int ftruncate(int descriptor, off_t length) noexcept
 {
     return fails("truncate") ? -1 : REAL(ftruncate)(descriptor, length);
+}
+
+extern "C" int fallocate(int descriptor, int mode, off_t offset, off_t length)
+{
+    if (fails("reserve " + std::to_string(length)))
+        return -1;
+    return REAL(fallocate)(descriptor, mode, offset, length);
 }
 
 extern "C" int fdatasync(int)
@@ -168,33 +185,53 @@ extern "C" int fdatasync(int)
     return fails("sync") ? -1 : 0;
 }
 
-extern "C" int fsync(int)
+extern "C" int fsync(int descriptor)
 {
-    return fails("sync directory") ? -1 : 0;
+    struct stat status;
+    fstat(descriptor, &status);
+    return fails(S_ISDIR(status.st_mode) ? "sync directory" : "sync all") ? -1 : 0;
 }
 
-TEST_F(osse, CopyWritesTheMarkLastAndAFailedOneLeavesNone)
+extern "C" int open(const char* path, int flags, ...)
 {
-#define BEGUN "sync; sync directory; truncate; "
-    const struct {
-        size_t size, left;
-        int failingCall, failure, rc;
-        const char* calls;
-    } rows[] = {
-        {4000, 4000, -1, 0, 0,
-         BEGUN "write 3992 at 8; write 1992 at 2008; sync; write 8 at 0; sync; "},
-        {8, 8, -1, 0, 0, BEGUN "sync; write 8 at 0; sync; "},
-        {2000, 5000, 0, EIO, failed | EIO, "sync; "},
-        {2000, 5000, 1, EIO, failed | EIO, "sync; sync directory; "},
-        {2000, 2000, 3, EINTR, 0,
-         BEGUN "write 1992 at 8; write 1992 at 8; sync; write 8 at 0; sync; "},
-        {2000, 0, 3, ENOSPC, DISK_FULL, BEGUN "write 1992 at 8; truncate; "},
-        {2000, 0, 4, EIO, failed | EIO, BEGUN "write 1992 at 8; sync; truncate; "},
-    };
+    va_list rest;
+    va_start(rest, flags);
+    const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
+    va_end(rest);
+    errno = EMFILE;
+    return noDescriptor ? -1 : REAL(open)(path, flags, mode);
+}
+
+struct copyRow {
+    size_t size, left;
+    int failingCall, failure, rc;
+    std::string calls;
+};
+static const std::string empty = "sync; sync directory; reserve ",
+                         end = "sync all; write and wait for 8; ";
+static const std::vector<copyRow> copyRows = {
+    {4000, 4000, -1, 0, 0, empty + "4000; truncate; write 3992 at 8; write 1992 at 2008; " + end},
+    {8, 8, -1, 0, 0, empty + "8; truncate; " + end},
+    {2000, 5000, 0, EIO, failed | EIO, "sync; "},
+    {2000, 5000, 1, EIO, failed | EIO, "sync; sync directory; "},
+    {2000, 5000, 2, ENOSPC, DISK_FULL, empty + "2000; "},
+    {2000, 2000, 2, EOPNOTSUPP, 0, empty + "2000; truncate; write 1992 at 8; " + end},
+    {2000, 5000, 3, EIO, failed | EIO, empty + "2000; truncate; "},
+    {2000, 2000, 4, EINTR, 0, empty + "2000; truncate; write 1992 at 8; write 1992 at 8; " + end},
+    {2000, 0, 4, ENOSPC, DISK_FULL, empty + "2000; truncate; write 1992 at 8; truncate; "},
+    {2000, 0, 5, EIO, failed | EIO,
+     empty + "2000; truncate; write 1992 at 8; sync all; truncate; "},
+    {2000, 0, 6, EIO, failed | EIO,
+     empty + "2000; truncate; write 1992 at 8; " + end + "truncate; "},
+};
+
+TEST_F(osse, CopyWritesTheFirstBytesLastAndAFailedOneLeavesNone)
+{
     const std::string link = directory + "link";
     spill(file, "");
     std::filesystem::create_hard_link(file, link);
-    for (const auto& row : rows) {
+    for (const copyRow& row : copyRows) {
+        SCOPED_TRACE(row.calls);
         spill(source, pattern(row.size, 1));
         spill(file, pattern(5000, 2));
         calls.clear();
@@ -207,6 +244,53 @@ TEST_F(osse, CopyWritesTheMarkLastAndAFailedOneLeavesNone)
         EXPECT_TRUE(slurp(link) == slurp(file)) << "the target's inode has changed";
         EXPECT_EQ(sqlocopy(link.c_str(), file.c_str(), 0), failed | EINVAL);
     }
+}
+
+// A marked file can be written, moved, emptied and replaced, but is nobody's source.
+TEST_F(osse, AMarkedFileIsRefusedUntilItIsWhole)
+{
+    const std::string bytes = pattern(5000, 1);
+    for (const bool whole : {true, false}) {
+        std::filesystem::remove(file);
+        EXPECT_EQ(sqloopenp(file.c_str(), 0x5A, 0640, &fh), 0);
+        EXPECT_EQ(sqlomark(fh), 0);
+        EXPECT_EQ(sqlowrite(fh, bytes.data(), 5000, &done), 0);
+        SQLO_FHANDLE second = sqloNoFile;
+        for (const unsigned int word : {0x14u, 0x4Cu, 0x0Cu})
+            EXPECT_EQ(sqloopenp(file.c_str(), word, 0640, &second), sqloFileIncomplete);
+        EXPECT_EQ(sqlocopy(file.c_str(), source.c_str(), 0), sqloFileIncomplete);
+        EXPECT_TRUE(slurp(file) == bytes);
+        spill(source, "source of a copy");
+        calls.clear();
+        EXPECT_EQ(whole ? sqlounmark(fh) : sqlocopy(source.c_str(), file.c_str(), 0), 0);
+        EXPECT_EQ(calls, whole ? "write 8 at 0; sync; sync all; write 8 at 0; "
+                               : empty + "16; truncate; write 8 at 8; " + end);
+        EXPECT_TRUE(slurp(file) == (whole ? bytes : "source of a copy"));
+        EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &second), 0);
+        EXPECT_EQ(sqloclose(second) + sqloclose(fh), 0);
+        EXPECT_EQ(sqlomark(fh), failed | EBADF);
+        EXPECT_EQ(sqlounmark(fh), failed | EBADF);
+    }
+}
+
+// What cannot be opened may be sound: it is neither moved nor, because of that, emptied.
+TEST_F(osse, AFileThatCannotBeOpenedIsNotMovedNorEmptied)
+{
+    spill(file, "sound");
+    spill(source, "new");
+    noDescriptor = true;
+    EXPECT_EQ(sqlomove(file.c_str(), (file + ".a").c_str()), failed | EMFILE);
+    noDescriptor = false;
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x5A, 0640, &fh), failed | EMFILE);
+    EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), failed | EMFILE);
+    EXPECT_EQ(slurp(file), "sound");
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh) + sqloclose(fh), 0);
+    EXPECT_EQ(sqloreserve(source.c_str(), file.c_str()), 0);
+    EXPECT_EQ(sqloreserve((source + "-").c_str(), file.c_str()), failed | ENOENT);
+    EXPECT_EQ(sqloreserve(source.c_str(), (file + "-").c_str()), 0);
+    EXPECT_EQ(slurp(file), "sound");
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x5A, 0640, &fh) + sqloclose(fh), 0);
+    EXPECT_EQ(slurp(file), "");
 }
 
 TEST_F(osse, MoveKeepsAnOccupiedTargetUnderANumber)
