@@ -415,27 +415,28 @@ void putJsonField(const recordField* field, const historyRecord* record, jsonWri
 
 #define LETTER(name, key, rule, member, settle, words)                                             \
     {                                                                                              \
-        name, key, formLetter, rule, 1, offsetof(historyRecord, data.member), 1, 0, 0, takeLetter, \
+        name, key, formLetter, rule, 1, 1, offsetof(historyRecord, data.member), 0, 0, takeLetter, \
             settle, words, nullptr                                                                 \
     }
 #define TEXT(name, key, rule, member, size, length)                                                \
     {                                                                                              \
-        name, key, formBuffer, rule, 1, offsetof(historyRecord, data.member), size, 0, 0,          \
+        name, key, formBuffer, rule, 1, size, offsetof(historyRecord, data.member), 0, 0,          \
             takeTextValue, settleEmpty, nullptr, length                                            \
     }
 #define STRING(name, key, rule, member, settle)                                                    \
     {                                                                                              \
-        name, key, formString, rule, 1, offsetof(historyRecord, member),                           \
-            sizeof historyRecord::member - 1, 0, 0, takeTextValue, settle, nullptr, nullptr        \
+        name, key, formString, rule, 1, sizeof historyRecord::member - 1,                          \
+            offsetof(historyRecord, member), 0, 0, takeTextValue, settle, nullptr, nullptr         \
     }
 #define COLUMNS(name, key, rule, member)                                                           \
     {                                                                                              \
-        name, key, formColumns, rule, 1, offsetof(historyRecord, event.member),                    \
-            sizeof sqlca::member, 0, 0, takeTextValue, settleUsual, nullptr, nullptr               \
+        name, key, formColumns, rule, 1, sizeof sqlca::member,                                     \
+            offsetof(historyRecord, event.member), 0, 0, takeTextValue, settleUsual, nullptr,      \
+            nullptr                                                                                \
     }
 #define NUMBER(name, key, member, size, count, least, most, take, settle)                          \
     {                                                                                              \
-        name, key, formNumbers, anyText, count, offsetof(historyRecord, member), size, least,      \
+        name, key, formNumbers, anyText, count, size, offsetof(historyRecord, member), least,      \
             most, take, settle, nullptr, nullptr                                                   \
     }
 #define WIDTH(field) entryFields[field].width
@@ -463,14 +464,13 @@ const recordField recordFields[numRecordFields] = {
            settleNoteLength),
     NUMBER("Long text length", nullptr, entry.longTextLength, 4, 1, 0, UINT32_MAX, takeNumbers,
            settleLongTextLength),
-    {"Log position", "logPosition", formBytes, anyText, 1,
-     offsetof(historyRecord, data.logPosition), sizeof zq3HistoryData::logPosition, 0, 0, takeBytes,
-     settleEmpty, nullptr, nullptr},
+    {"Log position", "logPosition", formBytes, anyText, 1, sizeof zq3HistoryData::logPosition,
+     offsetof(historyRecord, data.logPosition), 0, 0, takeBytes, settleEmpty, nullptr, nullptr},
     NUMBER("Node", "node", data.entryNode, 2, 1, 0, UINT16_MAX, takeNumbers, nullptr),
     NUMBER("Number", "number", data.entryNumber, 4, 1, 0, UINT32_MAX, takeEntryNumber, nullptr),
-    {"Tablespace", "tablespaces", formNames, shortName, 1,
-     offsetof(historyRecord, data.tablespaceBuffers), INT32_MAX, 0, 0, takeTextValue, nullptr,
-     nullptr, nullptr},
+    {"Tablespace", "tablespaces", formNames, shortName, 1, INT32_MAX,
+     offsetof(historyRecord, data.tablespaceBuffers), 0, 0, takeTextValue, nullptr, nullptr,
+     nullptr},
     NUMBER("SQLCODE", "sqlcode", event.sqlcode, 4, 1, INT32_MIN, INT32_MAX, takeNumbers, nullptr),
     COLUMNS("SQLSTATE", "sqlstate", anyText, sqlstate),
     COLUMNS("SQLCA id", "id", anyText, sqlcaid),

@@ -40,8 +40,8 @@ struct recordField {
     fieldForm form;
     textRule rule;
     uint16_t count;        // of the numbers
+    uint32_t size;         // most characters or bytes of the member; bytes of each number
     size_t at;             // of the member in historyRecord
-    uint32_t size;         // most characters or bytes of it; bytes of each number
     long long least, most; // of a number
     // Takes a value into the record. Returns 0; valueRefused with value->expected filled; or
     // sqloSystemError with ENOMEM.

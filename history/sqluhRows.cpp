@@ -165,7 +165,7 @@ static int shareNames(sqluhRows* rows, const SQLUH_ENTRY* entry, const SQLUH_WOR
         rows->lastNames = *known;
     }
     *names = rows->lastNames;
-    if (rc == 0)
+    if (*names != nullptr)
         proven->tailAt = proven->tablespacesAt + (*names)->length;
     return rc;
 }

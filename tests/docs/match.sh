@@ -40,8 +40,17 @@ same "options of zq3ckrst(1)" "$options" \
 same "options completed for zq3ckrst" "$(grep -v '[u?]' <<<"$options")" \
   "$(grep -oP 'compgen -W "\K-d[^"]*' completion/zq3ckrst.bash | grep -o '[a-z]')"
 messages=$(tr -d '\n' <tool/zq3ckrst.h | grep -oP 'planMessage \K.*?;')
-same "sites in zq3ckrst(1)" "$(grep -oP ', *\K\d+(?=\})' <<<"$messages")" \
-  "$(grep -oP '^\.It Li .* Pq \\-\d+[,;] \K.*' man/zq3ckrst.1 | grep -oP '\d+')"
+declare -A codes
+while read -r name code; do codes[$name]=$code; done \
+  < <(grep -oP '^    \w+ = -\d+(?=,)' tool/zq3ckrst.h | tr -d =)
+same "messages of zq3ckrst(1)" \
+  "$(grep -oP '= \{\K"[^}]*' <<<"$messages" | sed -E 's/\\n/ /g; s/^"([^".%]*[^".% ]).*" *, *(\w+), *([0-9]+)$/\2 \3 \1/' |
+    while read -r code rest; do echo "${codes[$code]} $rest"; done)" \
+  "$(sed -nE 's/^\.It Li (\\&)?([^\\]*[^\\ ]).* Pq \\(-[0-9]+)[,;] (.*)/\3 \2, \4/p' man/zq3ckrst.1 |
+    sed 's/ Ar [^,]*,/,/; s/ and /, /' |
+    while IFS=', ' read -r code rest; do
+      for site in $(grep -oP '\d+' <<<"$rest"); do echo "$code $site ${rest%%,*}"; done
+    done)"
 mapfile -t texts < <(grep -oP '= \{"\K[^"%\\]*' <<<"$messages" | sed 's/ *$//')
 holds man/zq3ckrst.1 "${texts[@]}"
 holds docs/troubleshooting.md "${texts[@]}"
@@ -67,7 +76,36 @@ holds completion/zq3hist.bash "${words[@]}" # options it takes from the help
 mapfile -t texts < <(grep -ohP '^ *(\{|[A-Z]+\()"\K[A-Z][^"]*' admin/fields.cpp)
 holds man/zq3hist.1 "${texts[@]}"
 
+# The variables that the programs and what they load read. ZQ3SYNC says nothing to who only looks.
+variables() { grep -rohP 'getenv\("\K\w+' "$@"; }
+documented() { sed -n '/^\.Sh ENVIRONMENT/,/^\.El/s/^\.It Ev //p' "$1"; }
+same "variables in zq3ckrst(1)" "$(variables tool platform | grep -v ZQ3SYNC)" \
+  "$(documented man/zq3ckrst.1)"
+same "variables in zq3hist(1)" "$(variables admin platform/osse)" "$(documented man/zq3hist.1)"
+
+# The header's fields as the library has them: width by width from the format text, with the members
+# in the order they are printed; a member's image offset follows from the members before it.
+headerFields() {
+  local -A image=([at]=0)
+  local at=0 bits member count width
+  while read -r bits member count; do
+    image[$member]=${image[at]}
+    image[at]=$((image[at] + ${bits:-8} / 8 * ${count:-1}))
+  done < <(sed -n '/^struct SQLUH_HEADER {/,/^}/p' history/sqluhist.h |
+    sed -nE 's/^    char /    uint8_t /; s/^    uint([0-9]+)_t (\w+)(\[([0-9]+)\])?;.*/\1 \2 \4/p')
+  while read -r width member; do
+    echo "$at $width ${image[$member]} $member"
+    at=$((at + width + 1))
+  done < <(paste -d ' ' \
+    <(sed -n '/ headerFormat\[\] =/,/;$/p' history/sqluhist.h | grep -oP '%-?\K(\d+|c)' | tr c 1) \
+    <(tr -d '\n' <history/sqluhHeader.cpp | grep -oP 'buffer, headerFormat, \K[^"]*' |
+      grep -oP 'header->\K\w+') | grep ' .')
+}
+
 # zq3rhist(5) and the log records.
+same "fields of a header in zq3rhist(5)" "$(headerFields)" \
+  "$(sed -n '/^\.Ss Header/,/^\.El/p' man/zq3rhist.5 | grep -oP '^\.It \K\d+ Ta \d+ Ta \d+ Ta \w+' |
+    sed 's/ Ta / /g')"
 same "fields of an entry in zq3rhist(5)" \
   "$(tr -d '\n' <history/sqluhist.h | grep -oP 'entryFields\[\w+\] = \{\K.*?(?=\};)' |
     grep -oP '\{\K\d+, \d+' | tr -d ,)" \
