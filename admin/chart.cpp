@@ -40,6 +40,11 @@ const char* wordsForCell(char cell)
     }
 }
 
+const char* timestampOfColumn(const chartColumn* column)
+{
+    return column->image != nullptr ? column->image->timestamp : column->missing;
+}
+
 // --- Columns -------------------------------------------------------------------------------------
 
 // An image that is missing, and the position of the image whose column it stands before.

@@ -43,6 +43,9 @@ bool isNeededCell(char cell);
 char kindOfCell(char cell);
 const char* wordsForCell(char cell);
 
+// The timestamp of a column's image; null: unknown.
+const char* timestampOfColumn(const chartColumn* column);
+
 // Makes the rows anew out of what some columns show, negative ones aside; null: all columns.
 void groupRows(imageChart* chart, const int* columns, int numColumns);
 

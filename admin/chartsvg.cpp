@@ -97,7 +97,7 @@ static void putTooltip(const svgLayout* layout, int column)
 {
     const imageChart* chart = layout->chart;
     const chartColumn* shown = &chart->columns[column];
-    const char* timestamp = shown->image != nullptr ? shown->image->timestamp : shown->missing;
+    const char* timestamp = timestampOfColumn(shown);
     char text[readableCapacity] = "A full image";
     char title[rowTitleCapacity];
     fputs("<title>", layout->out);
@@ -134,11 +134,6 @@ static void putColumn(const svgLayout* layout, int column, int x, int y)
 
 // --- Bands ---------------------------------------------------------------------------------------
 
-static const char* timestampOf(const chartColumn* column)
-{
-    return column->image != nullptr ? column->image->timestamp : column->missing;
-}
-
 static void putText(const svgLayout* layout, const char* name, int x, int y, const char* text)
 {
     fprintf(layout->out, "<text class=\"%s\" x=\"%d\" y=\"%d\">", name, x, y);
@@ -151,7 +146,7 @@ static void putLabels(const svgLayout* layout, int first, int last, int y)
     const char* before = "";
     int end = 0;
     for (int column = first; column < last; column++) {
-        const char* timestamp = timestampOf(&layout->chart->columns[column]);
+        const char* timestamp = timestampOfColumn(&layout->chart->columns[column]);
         int x = margin + layout->titleWidth + (column - first) * layout->pitch;
         char label[readableCapacity];
         if (timestamp == nullptr || x < end)

@@ -65,46 +65,60 @@ static bool chooseColumns(chartView* view, int room)
     return allocated;
 }
 
+// How long a title is with its escapes (putEscaped).
+static int lengthOfTitle(const char* title)
+{
+    int length = 0;
+    for (; *title != '\0'; title++)
+        length += *title == '\n' || *title == '\\' ? 2 : *title < ' ' || *title > '~' ? 4 : 1;
+    return length;
+}
+
 static void measureTitles(chartView* view)
 {
     view->titleWidth = 0;
     char title[rowTitleCapacity];
     for (int i = 0; i < view->chart->numRows; i++) {
         titleOfRow(view->chart, &view->chart->rows[i], title);
-        int length = static_cast<int>(strlen(title));
+        int length = lengthOfTitle(title);
         view->titleWidth = length > view->titleWidth ? length : view->titleWidth;
     }
 }
 
 // --- The head ------------------------------------------------------------------------------------
 
+static int lastMark(const char* marks, int end)
+{
+    while (marks[end] != '|')
+        end--;
+    return end;
+}
+
 // Two lines: labels where there is room, and marks at their columns.
 static void putLabels(const chartView* view, int width)
 {
-    char marks[1024];
+    char labels[1024], marks[sizeof labels];
     const char* before = "";
-    int at = view->titleWidth + 2, end = 0, numMarks = 0;
-    printf("%*s", at, "");
+    int at = view->titleWidth + 2, end = 0;
+    memset(labels, ' ', sizeof labels);
     memset(marks, ' ', sizeof marks);
     for (int i = 0; i < view->numColumns; i++, at += view->pitch) {
         const chartColumn* column =
             view->columns[i] == noColumn ? nullptr : &view->chart->columns[view->columns[i]];
-        const char* timestamp = column == nullptr          ? nullptr
-                                : column->image != nullptr ? column->image->timestamp
-                                                           : column->missing;
+        const char* timestamp = column != nullptr ? timestampOfColumn(column) : nullptr;
         char label[readableCapacity];
         if (timestamp == nullptr || strlen(timestamp) != timestampLength || at < end)
             continue;
         int length = makeLabel(timestamp, before, label);
-        if (at + length > width || at >= static_cast<int>(sizeof marks))
+        if (at + length > width || at + length > static_cast<int>(sizeof labels))
             continue;
-        printf("%*s%s", end == 0 ? at - view->titleWidth - 2 : at - end + 1, "", label);
+        memcpy(labels + at, label, static_cast<size_t>(length));
+        marks[at] = '|';
         end = at + length + 1;
         before = timestamp;
-        marks[at] = '|';
-        numMarks = at + 1;
     }
-    printf("\n%.*s\n", numMarks, marks);
+    if (end != 0)
+        printf("%.*s\n%.*s|\n", end - 1, labels, lastMark(marks, end), marks);
 }
 
 // --- Cells ---------------------------------------------------------------------------------------
@@ -135,7 +149,7 @@ static void putRow(const chartView* view, const chartRow* row)
     char title[rowTitleCapacity];
     titleOfRow(view->chart, row, title);
     putEscaped(stdout, title, strlen(title));
-    printf("%*s", view->titleWidth - static_cast<int>(strlen(title)) + 2, "");
+    printf("%*s", view->titleWidth - lengthOfTitle(title) + 2, "");
     for (int i = 0; i < view->numColumns; i++) {
         char cell = cellInView(view, row, i);
         printf("%*s", i == 0 ? 0 : view->pitch - 1, "");

@@ -239,6 +239,126 @@ TEST_F(QuestionTest, AnswersInFull)
         EXPECT_EQ(row.output, run(row.arguments)) << row.arguments;
 }
 
+// Names of any bytes, colors, widths, and the picture.
+TEST_F(QuestionTest, ChartsAreDrawnForTheirPlace)
+{
+    const struct {
+        const char* before;
+        const char* arguments;
+        const char* output;
+    } rows[] = {
+        {"", "images -d s",
+         "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
+         "20250101000000  delta        database              1       1  incomplete: <A>&\\x07 "
+         "lacks a full image\n"
+         "20250102000000  full         database              2       1  complete\n"
+         "2 images, 1 incomplete; newest that can be restored: 20250102000000\n"
+         "[0]"},
+        {"", "plan S/ -d s latest",
+         "zq3hist: plan takes a timestamp such as 20250111010000 or '2025-01-11 01:00:00', not S/\n"
+         "Try 'zq3hist --help'.\n"
+         "[2]"},
+        {"", "chart --color S",
+         "What the newest state needs\n"
+         "\n"
+         "          2025-01-01\n"
+         "          |\n"
+         "<A>&\\x07  \033[2md\033[0m  \033[2m.\033[0m\n"
+         "2 others  \033[2m.\033[0m  \033[1;34mF\033[0m\n"
+         "\n"
+         "F I D  needed: full, incremental, delta\n"
+         "f i d  not needed\n"
+         ".      not in the image\n"
+         "[0]"},
+        {"COLUMNS=12 ", "chart w",
+         "What the newest state needs\n"
+         "\n"
+         "A  :DDDDDDDD\n"
+         "\n"
+         "F I D  needed: full, incremental, delta\n"
+         ":      5 images left out\n"
+         "[0]"},
+        {"COLUMNS=30 ", "chart w 20250101020000",
+         "What 2025-01-01 02:00:00 needs\n"
+         "\n"
+         "   2024-12-31\n"
+         "   |\n"
+         "A  F  D  D  D\n"
+         "\n"
+         "F I D  needed: full, incremental, delta\n"
+         "[0]"},
+        {"NO_COLOR=1 ", "chart --color=auto w",
+         "What the newest state needs\n"
+         "\n"
+         "   2024-12-31  2025-01-01  07:00 09:00 11:00\n"
+         "   |           |           |     |     |\n"
+         "A  F  d  d  d  I  D  D  D  D  D  D  D  D\n"
+         "\n"
+         "F I D  needed: full, incremental, delta\n"
+         "f i d  not needed\n"
+         "[0]"},
+        {"", "chart --svg - S",
+         "<svg xmlns=\"http://www.w3.org/2000/svg\" viewBox=\"0 0 400 180\" width=\"100%\" "
+         "style=\"max-width:800px;height:auto\">\n"
+         "<style>text{font-family:sans-serif;fill:#222}.h{font-size:15px;font-weight:bold}.s{font-"
+         "size:11px}.n{font-size:10px}.t{font-size:9px;fill:#555}path{stroke:#999;fill:none}.F{"
+         "fill:#0072b2}.I{fill:#e69f00}.D{fill:#009e73}.f{fill:#b3d4ea}.i{fill:#f7d99c}.d{fill:#"
+         "b0dfcf}.X{fill:#fff;stroke:#aaa}.M{fill:#fff;stroke:#d55e00;stroke-width:2}.lF,.lI,.lD,."
+         "lf,.li,.ld,.lX,.lM{font-size:10px;text-anchor:middle;font-weight:bold}.lF,.lD{fill:#fff}."
+         "lf,.li,.ld{fill:#555;font-weight:normal}.lX{fill:#888}.lM{fill:#d55e00}</style>\n"
+         "<rect width=\"100%\" height=\"100%\" fill=\"#fff\"/>\n"
+         "<text class=\"h\" x=\"10\" y=\"24\">What the newest state needs</text>\n"
+         "<text class=\"s\" x=\"10\" y=\"41\">2 images, the oldest first</text>\n"
+         "<rect class=\"F\" x=\"10\" y=\"52\" width=\"12\" height=\"14\"/><text class=\"lF\" "
+         "x=\"16.0\" y=\"63\">F</text><text class=\"t\" x=\"26\" y=\"62\">full, needed</text>\n"
+         "<rect class=\"I\" x=\"110\" y=\"52\" width=\"12\" height=\"14\"/><text class=\"lI\" "
+         "x=\"116.0\" y=\"63\">I</text><text class=\"t\" x=\"126\" y=\"62\">incremental, "
+         "needed</text>\n"
+         "<rect class=\"D\" x=\"250\" y=\"52\" width=\"12\" height=\"14\"/><text class=\"lD\" "
+         "x=\"256.0\" y=\"63\">D</text><text class=\"t\" x=\"266\" y=\"62\">delta, needed</text>\n"
+         "<rect class=\"f\" x=\"10\" y=\"71\" width=\"12\" height=\"14\"/><text class=\"lf\" "
+         "x=\"16.0\" y=\"82\">f</text><text class=\"t\" x=\"26\" y=\"81\">full, not needed</text>\n"
+         "<rect class=\"i\" x=\"110\" y=\"71\" width=\"12\" height=\"14\"/><text class=\"li\" "
+         "x=\"116.0\" y=\"82\">i</text><text class=\"t\" x=\"126\" y=\"81\">incremental, not "
+         "needed</text>\n"
+         "<rect class=\"d\" x=\"250\" y=\"71\" width=\"12\" height=\"14\"/><text class=\"ld\" "
+         "x=\"256.0\" y=\"82\">d</text><text class=\"t\" x=\"266\" y=\"81\">delta, not "
+         "needed</text>\n"
+         "<rect class=\"M\" x=\"10\" y=\"90\" width=\"12\" height=\"14\"/><text class=\"lM\" "
+         "x=\"16.0\" y=\"101\">?</text><text class=\"t\" x=\"26\" y=\"100\">missing</text>\n"
+         "<rect class=\"X\" x=\"110\" y=\"90\" width=\"12\" height=\"14\"/><text class=\"lX\" "
+         "x=\"116.0\" y=\"101\">x</text><text class=\"t\" x=\"126\" y=\"100\">discarded by a "
+         "restore</text>\n"
+         "<path d=\"M66.5 127v4\"/><text class=\"t\" x=\"66\" y=\"125\">2025-01-01</text>\n"
+         "<text class=\"n\" x=\"10\" y=\"143\">&#60;A&#62;&#38;\\x07</text>\n"
+         "<text class=\"n\" x=\"10\" y=\"160\">2 others</text>\n"
+         "<g><title>2025-01-01 00:00:00: delta, database\n"
+         "&#60;A&#62;&#38;\\x07: not needed</title><rect class=\"d\" x=\"66\" y=\"132\" "
+         "width=\"42\" height=\"14\"/><text class=\"ld\" x=\"87.0\" y=\"143\">d</text></g>\n"
+         "<g><title>2025-01-02 00:00:00: full, database\n"
+         "2 others: full, needed</title><rect class=\"F\" x=\"110\" y=\"149\" width=\"42\" "
+         "height=\"14\"/><text class=\"lF\" x=\"131.0\" y=\"160\">F</text></g>\n"
+         "</svg>\n"
+         "[0]"},
+        {"", "chart --color=red w",
+         "zq3hist: --color takes always, never or auto, not red\n"
+         "Try 'zq3hist --help'.\n"
+         "[2]"},
+    };
+    setenv("ZQ3DBPATH", ".", 1);
+    run("load S/",
+        stanza("backup", 20250101000000, "Type: delta\n", {"<A>&\\x07"}) +
+            stanza("backup", 20250102000000, "", {"B", "C"}),
+        "mkdir S; ");
+    std::string thirteen = stanza("backup", 20241231000000, "", {"A"});
+    for (int hour = 0; hour < 12; hour++)
+        thirteen += stanza("backup", 20250101000000 + hour * 10000,
+                           hour == 3 ? "Type: incremental\n" : "Type: delta\n", {"A"});
+    run("load w/", thirteen, "mkdir w; ");
+    for (const auto& row : rows)
+        EXPECT_EQ(row.output, run(row.arguments, "", row.before)) << row.arguments;
+}
+
 TEST_F(QuestionTest, AChecksLineBeginsWithTheGravest)
 {
     const auto hoursAgo = [](int hours) {
@@ -363,4 +483,6 @@ TEST_F(QuestionTest, EveryQuestionAboutAYearIsAnsweredWithinASecond)
         EXPECT_LT(seconds, 1) << question;
         printf("%-35s %.3f s\n", question, seconds);
     }
+    EXPECT_EQ("[1]", run("images h/ >pipe", "", "mkfifo pipe; head -1 pipe >first & "))
+        << "whoever reads only the beginning is not told of it";
 }
