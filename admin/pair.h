@@ -95,8 +95,8 @@ struct partReport {
     bool complete;  // reading ended where the file ends
 };
 
-// Whether an entry with this objectPart goes into the part.
-typedef bool (*partFilter)(const void* context, const char* objectPart);
+// Whether an entry goes into the part. Of its texts, only objectPart is there.
+typedef bool (*partFilter)(const void* context, const zq3HistoryData* entry);
 
 // Writes a new history file of those entries of the one at source that the filter takes, byte for
 // byte, up to one that cannot be read; null: all. A source without a readable header has none. The

@@ -67,7 +67,7 @@ static int copyEntries(partWriter* writer, partFilter filter, const void* contex
         return 0;
     while (rc == 0 && (rc = sqluhNextEntry(&walk)) == 0) {
         report->total++;
-        if (filter == nullptr || filter(context, objectPart))
+        if (filter == nullptr || filter(context, &data))
             rc = copyEntry(writer, &entry, walk.offset);
     }
     report->complete = rc == END_OF_FILE && !walk.cutShort;

@@ -8,40 +8,87 @@
 
 struct prunePlan {
     char from[timestampWidth + 1];   // the entries before it go
-    char needer[timestampWidth + 1]; // the image that needs what stays before the time asked for
+    char needer[timestampWidth + 1]; // what needs an entry that is older than the time asked for
+    bool keepRenames;
 };
 
-// Images that stay must keep theirs: each may move the beginning back, for those older ones too
-// that stay because of it.
+static void moveBack(prunePlan* plan, const char* from, const char* needer)
+{
+    if (strcmp(from, plan->from) >= 0)
+        return;
+    snprintf(plan->from, sizeof plan->from, "%s", from);
+    snprintf(plan->needer, sizeof plan->needer, "%s", needer);
+}
+
+// The newest state stays, however old it is: that of the newest image that can be restored, and of
+// the tablespaces that the next images will hold.
+static void keepNewest(const chainWalk* walk, prunePlan* plan)
+{
+    const historyEntry* entries = walk->history->entries;
+    int newest = walk->newestComplete;
+    if (newest >= 0)
+        moveBack(plan, entries[newest].timestamp, entries[newest].timestamp);
+    for (int i = 0; i < walk->numTablespaces; i++)
+        if (isAlive(walk, i)) {
+            const char* image = entries[walk->links[walk->tablespaces[i].head].image].timestamp;
+            moveBack(plan, image, image);
+        }
+}
+
+// Images that stay must keep what they need, and restores that stay the image that they used, on
+// which the next image builds. Each may move the beginning back, for those older ones, too, that
+// stay because of it.
+static void keepNeeded(const imageCatalog* catalog, const chainWalk* walk, prunePlan* plan)
+{
+    const historyEntry* entries = catalog->history.entries;
+    for (int i = catalog->history.numEntries - 1; i >= 0; i--) {
+        bool isRestore = entries[i].operation == zq3OperationRestore;
+        int image = isImage(&entries[i]) ? i
+                    : isRestore          ? findImage(catalog, entries[i].backupId)
+                                         : -1;
+        if (image >= 0 && strcmp(entries[i].timestamp, plan->from) >= 0)
+            moveBack(plan, entries[walk->images[image].oldest].timestamp, entries[i].timestamp);
+    }
+}
+
+// The planner heeds no rename if the first one is older than all images. So a rename must not come
+// to stand first, and one that stands there must stay.
+static void keepRenames(const imageCatalog* catalog, prunePlan* plan)
+{
+    const historyEntry* entries = catalog->history.entries;
+    plan->keepRenames = !catalog->renamesCount;
+    for (int i = 0; i < catalog->history.numEntries; i++)
+        if (isImage(&entries[i]) && strcmp(entries[i].timestamp, plan->from) >= 0) {
+            snprintf(plan->from, sizeof plan->from, "%s", entries[i].timestamp);
+            return;
+        }
+}
+
 static int findBeginning(historyPlace* place, const char* before, prunePlan* plan)
 {
     imageCatalog catalog = {};
     chainWalk walk = {};
     int rc = readCatalog(place, nullptr, &catalog);
-    const historyData* history = &catalog.history;
     if (rc == 0)
-        rc = walkChains(&catalog, history->numEntries - 1, &walk);
+        rc = walkChains(&catalog, catalog.history.numEntries - 1, &walk);
     snprintf(plan->from, sizeof plan->from, "%s", before);
-    for (int i = history->numEntries - 1; rc == 0 && i >= 0; i--) {
-        const char* timestamp = history->entries[i].timestamp;
-        if (!isImage(&history->entries[i]) || strcmp(timestamp, plan->from) < 0)
-            continue;
-        const char* oldest = history->entries[walk.images[i].oldest].timestamp;
-        if (strcmp(oldest, plan->from) < 0) {
-            memcpy(plan->from, oldest, sizeof plan->from);
-            memcpy(plan->needer, timestamp, sizeof plan->needer);
-        }
+    if (rc == 0) {
+        keepNewest(&walk, plan);
+        keepNeeded(&catalog, &walk, plan);
+        keepRenames(&catalog, plan);
     }
     freeChains(&walk);
     freeCatalog(&catalog);
     return rc;
 }
 
-static bool stays(const void* context, const char* objectPart)
+static bool stays(const void* context, const zq3HistoryData* entry)
 {
     const prunePlan* plan = static_cast<const prunePlan*>(context);
-    return strspn(objectPart, "0123456789") < timestampWidth ||
-           memcmp(objectPart, plan->from, timestampWidth) >= 0;
+    const char* timestamp = entry->objectPart.data;
+    return strspn(timestamp, "0123456789") < timestampWidth ||
+           memcmp(timestamp, plan->from, timestampWidth) >= 0 ||
+           (plan->keepRenames && entry->operation == zq3OperationRename);
 }
 
 // What pruning would come to.
@@ -61,7 +108,7 @@ static int rehearsePruning(const historyPlace* place, const prunePlan* plan, par
     for (uint32_t row = 0; rc == 0 && row < committed->numRows; row++) {
         sqluhGetCommitted(committed, row, &entry, false);
         part->total++;
-        part->kept += stays(plan, objectPart);
+        part->kept += stays(plan, &data);
     }
     sqluhFreeCommitted(&committed);
     return rc;
@@ -73,8 +120,7 @@ static void tellPart(const prunePlan* plan, const partReport* part, bool dryRun)
     printf("%u of %u entries %sremoved, those before %s; %u %s\n", part->total - part->kept,
            part->total, would, plan->from, part->kept, dryRun ? "would stay" : "stay");
     if (plan->needer[0] != '\0')
-        printf("The entries from %s on stay because the image %s needs them\n", plan->from,
-               plan->needer);
+        printf("The entries from %s on stay because %s needs them\n", plan->from, plan->needer);
 }
 
 // What the plan was made from must be what is pruned.

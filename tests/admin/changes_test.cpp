@@ -252,16 +252,16 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "h/zq3rhist.bak\n[3]",
          "3 1"},
         {"", "prune --before 20250107000000 h/",
-         "2 of 3 entries removed, those before 20250107000000; 1 stay\n" KEPT("asc")
+         "2 of 3 entries removed, those before 20250107010000; 1 stay\n" KEPT("asc")
              KEPT("bak") "[0]",
          "1 1 3 3"},
         {"", "prune --before '2025-01-06 01:00:00' h/",
          "0 of 3 entries removed, those before 20250105010000; 3 stay\n"
-         "The entries from 20250105010000 on stay because the image 20250106010000 needs "
+         "The entries from 20250105010000 on stay because 20250106010000 needs "
          "them\n[0]",
          "3 3"},
         {"", "prune --dry-run --before 20250107000000 h/",
-         "2 of 3 entries would be removed, those before 20250107000000; 1 would stay\n[0]", "3 3"},
+         "2 of 3 entries would be removed, those before 20250107010000; 1 would stay\n[0]", "3 3"},
         {SPOIL("bak", "2000"), "prune --before 20250107000000 h/",
          "zq3hist: cannot prune the history: the entry at offset 1803 is damaged, h/zq3rhist.bak\n"
          "zq3hist: hint: zq3hist repair h/  # makes the shadow anew from the history file\n[3]",
