@@ -141,7 +141,7 @@ static void showJsonRow(imageList* list, const imageRow* row)
         putJsonNumber(json, "sqlcode", row->unused->sqlcode);
         putJsonBytes(json, "status", &row->unused->status, 1);
     } else {
-        putJsonNumber(json, "imageCount", row->chains->numImages);
+        putJsonNumber(json, "neededCount", row->chains->numImages);
         putJsonBool(json, "complete", row->chains->numIncomplete == 0);
         beginJson(json, "missing", '[');
         for (int i = 0; i < row->chains->numLinks; i++) {

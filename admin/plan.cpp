@@ -202,7 +202,7 @@ static void showJsonPlan(const planRequest* request)
         if (isNeeded(plan, row))
             showJsonLine(&json, plan, row, position++);
     endJson(&json, ']');
-    putJsonNumber(&json, "imageCount", plan->numImages);
+    putJsonNumber(&json, "neededCount", plan->numImages);
     beginJson(&json, "missing", '[');
     for (int column = 0; column < plan->stages.numTablespaces; column++) {
         const char* image;

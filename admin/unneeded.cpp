@@ -71,7 +71,7 @@ static void showMarked(markedImages* marked, const commandLine* line, bool mark,
     }
     if (line->json) {
         endJson(&json, ']');
-        putJsonNumber(&json, "imageCount", count);
+        putJsonNumber(&json, "imageCount", marked->walk.numImages);
         endJsonLine(&json);
     } else {
         printf("%d of %d images%s%s\n", count, marked->walk.numImages, summary, value);

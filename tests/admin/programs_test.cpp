@@ -52,7 +52,7 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
          "\"database\",\"tablespaceCount\":2,\"tablespaces\":[\"A\",\"B\"],\"whole\":true,"
          "\"neededBy\":[\"20250106010000\"]},{\"position\":2,\"timestamp\":"
          "\"20250106010000\",\"kind\":\"delta\",\"scope\":\"database\",\"tablespaceCount\":"
-         "2,\"tablespaces\":[\"A\",\"B\"],\"whole\":true,\"neededBy\":[]}],\"imageCount\":2,"
+         "2,\"tablespaces\":[\"A\",\"B\"],\"whole\":true,\"neededBy\":[]}],\"neededCount\":2,"
          "\"missing\":[],\"gap\":null,\"newestRestorable\":\"20250106010000\"}\n[0]"},
         {"", "backup h/ image", "2 entries backed up\n[0]"},
         {"", "copy h/ copy", "2 entries copied\n[0]"},
