@@ -1,0 +1,163 @@
+// The reader of the committed history beside writers that are stopped anywhere, and the other way
+// round.
+#include "directory/fixture.h"
+
+#include <ctime>
+#include <dlfcn.h>
+
+// What the clock that stamps files is made to say beside the truth.
+static time_t clockAhead;
+
+extern "C" int clock_gettime(clockid_t id, timespec* time) noexcept
+{
+    static const auto real =
+        reinterpret_cast<int (*)(clockid_t, timespec*)>(dlsym(RTLD_NEXT, "clock_gettime"));
+    const int rc = real(id, time);
+    if (id == CLOCK_REALTIME_COARSE)
+        time->tv_sec += clockAhead;
+    return rc;
+}
+
+class ReaderTest : public DirectoryTest
+{
+  protected:
+    // The number of entries that a read gives, whole and each its own; or the read's code.
+    int read()
+    {
+        SQLUH_COMMITTED* committed = nullptr;
+        const auto hook = std::move(onCall);
+        onCall = nullptr;
+        const bool watching = std::exchange(disk.watching, false);
+        int result = sqluhReadCommitted(directory.c_str(), &committed);
+        if (committed != nullptr) {
+            result =
+                committed->failure != 0 ? committed->failure : static_cast<int>(committed->numRows);
+            zq3HistoryData data = {};
+            SQLUH_ENTRY entry = {};
+            entry.data = &data;
+            for (uint32_t row = 0; row < committed->numRows; row++) {
+                sqluhGetCommitted(committed, row, &entry, false);
+                EXPECT_EQ(row + 1, data.entryNumber);
+            }
+        }
+        sqluhFreeCommitted(&committed);
+        disk.watching = watching;
+        onCall = hook;
+        reads++;
+        return result;
+    }
+
+    // What a read may give while the scenario is under way: its outcomes, or what it gave before;
+    // of files that nobody could use, a refusal, whichever.
+    std::set<int> allowed(const scenario& s)
+    {
+        std::set<int> results(s.outcomes.begin(), s.outcomes.end());
+        store(filesOf(s.before));
+        if (const int before = read(); before >= 0)
+            results.insert(before);
+        else
+            results.insert({HISTORY_FILE_DAMAGED, HISTORY_FILE_MISSING});
+        return results;
+    }
+
+    // A restore has no letter of its own: stopped between two pieces it shows the first entries.
+    static bool isPartOf(const scenario& s, int result)
+    {
+        return s.action.starts_with("restore") &&
+               (result < 0 || result < static_cast<int>(s.outcomes.back()));
+    }
+
+    static std::string statesOf(const std::string& path)
+    {
+        struct stat status;
+        return stat(path.c_str(), &status) != 0
+                   ? "none"
+                   : std::to_string(status.st_ino) + "/" + std::to_string(status.st_size) + "/" +
+                         std::to_string(status.st_ctim.tv_sec) + "." +
+                         std::to_string(status.st_ctim.tv_nsec);
+    }
+
+    // A tick of the clock that stamps files, so that what was written before it looks old.
+    static void nextTick()
+    {
+        const timespec tick = {0, 10000000};
+        nanosleep(&tick, nullptr);
+    }
+
+    unsigned int reads = 0;
+};
+
+// Nothing happens beside these reads, so the clock need not be waited for.
+TEST_F(ReaderTest, EveryStopOfAWriterShowsTheStateBeforeOrAfter)
+{
+    clockAhead = 3600;
+    std::set<Files> seen;
+    for (const scenario& s : scenarios) {
+        const std::set<int> results = allowed(s);
+        store(filesOf(s.before));
+        watch([&] { return run(s); });
+        const std::vector<diskOp> whole = disk.log;
+        for (size_t i = 0; i < whole.size(); i++)
+            for (size_t cut : {size_t{0}, size_t{1}, size_t{200}, size_t{1024}, SIZE_MAX}) {
+                if (cut != 0 && cut != SIZE_MAX && cut >= whole[i].bytes.size())
+                    continue;
+                store(filesOf(s.before));
+                watch([&] { return run(s); }, {static_cast<int>(i), cut});
+                removeSetsLeft();
+                if (!seen.insert(load()).second)
+                    continue;
+                const Files before = load();
+                const std::string states = statesOf(historyPath) + statesOf(shadowPath);
+                const int result = read();
+                EXPECT_TRUE(results.contains(result) || isPartOf(s, result))
+                    << s.action << " on " << s.before << " stopped at " << i << " + " << cut << ", "
+                    << momentOf(whole, i) << ": " << result;
+                EXPECT_TRUE(before == load());
+                EXPECT_EQ(states, statesOf(historyPath) + statesOf(shadowPath));
+                EXPECT_EQ(0, removeSetsLeft());
+            }
+    }
+    clockAhead = 0;
+    printf("%u reads of %zu states\n", reads, seen.size());
+    EXPECT_GT(seen.size(), 200u);
+}
+
+// A writer runs through while the reader stands before one of its calls.
+TEST_F(ReaderTest, AWriterThatRunsThroughAReadCostsAtMostARetry)
+{
+    const std::vector<scenario> writers = {
+        {"commit 1", " 10/ 10", "", {10, 11}}, {"commit 6", " 10/ 10", "", {10, 16}},
+        {"abandon 1", " 10/ 10", "", {10}},    {"restore 2", " 10/ 10", "", {10, 12}},
+        {"open", "C12/ 10", "", {12}},         {"open", "P10+900/ 10", "", {10}},
+        {"open", "junk/C12", "", {12}},        {"open", " 10/-", "", {10}},
+    };
+    unsigned int stops = 0;
+    for (const scenario& s : writers)
+        for (int stop = 0, calls = 1; stop < calls; stop += static_cast<int>(slowdown)) {
+            store(filesOf(s.before));
+            nextTick();
+            SQLUH_COMMITTED* committed = nullptr;
+            calls = 0;
+            onCall = [&](const std::string&, int) {
+                if (calls++ == stop) {
+                    const auto hook = std::move(onCall);
+                    onCall = nullptr;
+                    EXPECT_GE(run(s), 0);
+                    onCall = hook;
+                }
+                return 0;
+            };
+            const int rc = sqluhReadCommitted(directory.c_str(), &committed);
+            onCall = nullptr;
+            ASSERT_GE(rc, 0) << s.action << " on " << s.before << " at call " << stop;
+            EXPECT_EQ(0, committed->failure) << s.action << " on " << s.before << " at " << stop;
+            EXPECT_TRUE(std::ranges::count(s.outcomes, committed->numRows) != 0)
+                << s.action << " on " << s.before << " at call " << stop << ": "
+                << committed->numRows;
+            sqluhFreeCommitted(&committed);
+            EXPECT_EQ(0, removeSetsLeft());
+            stops++;
+        }
+    printf("a writer ran at %u stops of a reader\n", stops);
+    EXPECT_GT(stops, 150u / slowdown);
+}
