@@ -2,8 +2,10 @@
 // round.
 #include "directory/fixture.h"
 
+#include <csignal>
 #include <ctime>
 #include <dlfcn.h>
+#include <sys/wait.h>
 
 // What the clock that stamps files is made to say beside the truth.
 static time_t clockAhead;
@@ -160,4 +162,76 @@ TEST_F(ReaderTest, AWriterThatRunsThroughAReadCostsAtMostARetry)
         }
     printf("a writer ran at %u stops of a reader\n", stops);
     EXPECT_GT(stops, 150u / slowdown);
+}
+
+// --- Several processes ---------------------------------------------------------------------------
+
+// Runs in a process of its own, which ends with 0 when it returns true.
+template <typename use> static pid_t inAProcess(use run)
+{
+    const pid_t child = fork();
+    if (child == 0)
+        _exit(run() ? 0 : 1);
+    return child;
+}
+
+TEST_F(ReaderTest, BesideBusyWritersEveryReadGivesWholeBatches)
+{
+    enum { numWriters = 3, numBatches = 400 / static_cast<int>(slowdown) };
+    store(filesOf(" 9/ 9"));
+    std::vector<pid_t> writers;
+    for (int i = 0; i < numWriters; i++)
+        writers.push_back(inAProcess([&] {
+            for (int k = 0; k < numBatches; k++)
+                if (batch(3) != 0)
+                    return false;
+            return true;
+        }));
+    unsigned int rows = 9, whileWriting = 0;
+    for (size_t ended = 0; ended < writers.size(); whileWriting++) {
+        SQLUH_COMMITTED* committed = nullptr;
+        ASSERT_GE(sqluhReadCommitted(directory.c_str(), &committed), 0);
+        EXPECT_EQ(0, committed->failure);
+        EXPECT_EQ(0u, committed->numRows % 3);
+        EXPECT_GE(committed->numRows, rows);
+        rows = committed->numRows;
+        sqluhFreeCommitted(&committed);
+        int status = 0;
+        while (waitpid(-1, &status, WNOHANG) > 0) {
+            EXPECT_EQ(0, status);
+            ended++;
+        }
+    }
+    printf("%u reads beside %d writers of %d batches\n", whileWriting, numWriters, numBatches);
+    EXPECT_EQ(9 + numWriters * numBatches * 3, read());
+}
+
+TEST_F(ReaderTest, ReadersThatAreEndedLeaveNothing)
+{
+    Files files = filesOf(" 10/ 10");
+    for (auto& [name, bytes] : files)
+        for (int i = 0; i < 200; i++)
+            bytes += samples[10].substr(headerLength);
+    store(files);
+    nextTick();
+    const std::string states = statesOf(historyPath) + statesOf(shadowPath);
+    unsigned int seed = 1;
+    for (int i = 0; i < 300; i++) {
+        const pid_t reader = inAProcess([&] {
+            SQLUH_COMMITTED* committed = nullptr;
+            while (sqluhReadCommitted(directory.c_str(), &committed) >= 0)
+                sqluhFreeCommitted(&committed);
+            return false;
+        });
+        const timespec time = {0, rand_r(&seed) % 3000 * 1000};
+        nanosleep(&time, nullptr);
+        const int signals[] = {SIGKILL, SIGINT, SIGPIPE};
+        kill(reader, signals[i % 3]);
+        int status = 0;
+        waitpid(reader, &status, 0);
+        EXPECT_TRUE(WIFSIGNALED(status)) << "it ended by itself";
+        ASSERT_TRUE(lockKeyIsFree(historyPath)) << "after " << i;
+    }
+    EXPECT_EQ(states, statesOf(historyPath) + statesOf(shadowPath));
+    EXPECT_TRUE(files == load());
 }
