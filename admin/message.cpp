@@ -119,10 +119,6 @@ static constexpr explanation explanations[] = {
      "zq3hist verify DIR  # names the damage and what mends it"},
     {HISTORY_FILE_MISSING, exitDamaged, "the directory holds no history file",
      "zq3hist restore DIR FILE  # FILE: a backup; without one, zq3hist load DIR FILE begins anew"},
-    {HISTORY_FILE_RECREATED, exitDamaged,
-     "neither file could be used; both were moved aside and an empty history was made",
-     "zq3hist restore DIR FILE  # FILE: a backup, if DIR/" SQLUH_SAVED_HISTORY_NAME
-     " or DIR/" SQLUH_SAVED_SHADOW_NAME " is of no use"},
     {sqloNLCKKeyFailure, exitFailed, "no lock key can be made of the history file",
      "ls -ld DIR DIR/" SQLUH_HISTORY_NAME "  # it may be missing or out of reach"},
     {sqloNLCKKeyConflict, exitLocked, "another program's semaphore set has the lock's key",

@@ -21,8 +21,8 @@ class QuestionTest : public ProgramTest
     }
 };
 
-static std::string stanza(const std::string& operation, long timestamp, const std::string& rest,
-                          const std::vector<std::string>& names = {})
+static std::string stanza(const std::string& operation, long long timestamp,
+                          const std::string& rest, const std::vector<std::string>& names = {})
 {
     std::string text =
         "Operation: " + operation + "\nTimestamp: " + std::to_string(timestamp) + "\n" + rest;
@@ -37,12 +37,12 @@ static std::string anyHistory(std::mt19937& random, std::string* onHand)
     static const char* const types[] = {"full", "incremental", "delta", "delta"};
     static const std::vector<std::string> names = {"A", "B", "C", "D"};
     std::string text;
-    for (long time = 20250101000000; time < 20250101000040; time++) {
+    for (long long time = 20250101000000; time < 20250101000040; time++) {
         std::vector<std::string> some;
         for (const std::string& name : names)
             if (random() % 3 != 0)
                 some.push_back(name);
-        long earlier = 20250101000000 + static_cast<long>(random() % 40);
+        long long earlier = 20250101000000 + static_cast<long long>(random() % 40);
         switch (random() % 12) {
         case 0:
             text += stanza("restore", time, "Id: " + std::to_string(earlier) + "\n", some);
@@ -449,9 +449,9 @@ TEST_F(QuestionTest, AChecksLineBeginsWithTheGravest)
         tm day;
         char text[16];
         strftime(text, sizeof text, "%Y%m%d%H%M%S", gmtime_r(&seconds, &day));
-        return std::stol(text);
+        return std::stoll(text);
     };
-    long full = hoursAgo(30), delta = hoursAgo(3);
+    long long full = hoursAgo(30), delta = hoursAgo(3);
     std::string three = "newest that can be restored: " + std::to_string(delta) + ", 3 hours old";
     std::string thirty = "newest that can be restored: " + std::to_string(full) + ", 30 hours old";
     const struct {
@@ -528,8 +528,8 @@ static std::string aYear()
         time_t seconds = 1704067200 + hour * 3600; // from 2024-01-01, a Monday
         tm day;
         gmtime_r(&seconds, &day);
-        long time = (day.tm_year + 1900) * 10000000000 + (day.tm_mon + 1) * 100000000 +
-                    day.tm_mday * 1000000 + day.tm_hour * 10000;
+        long long time = (day.tm_year + 1900) * 10000000000 + (day.tm_mon + 1) * 100000000 +
+                         day.tm_mday * 1000000 + day.tm_hour * 10000;
         bool daily = day.tm_hour == 1, weekly = daily && day.tm_wday == 0;
         if (weekly && day.tm_yday == 308)
             continue;
