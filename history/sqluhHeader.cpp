@@ -90,7 +90,57 @@ static int readHeaderText(SQLO_FHANDLE fh, char* buffer, const char* operation)
     return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), operation);
 }
 
-// Fields 1 to 13. What a damaged text leaves out stays zero: the checksum tells.
+// Where the writer puts fields 1 to 13.
+struct headerPlaces {
+    formatPlace field[13];
+};
+static constexpr headerPlaces placesOfHeader(void)
+{
+    headerPlaces places = {};
+    for (unsigned int i = 0; i < 13; i++)
+        places.field[i] = placeInFormat(headerFormat, i);
+    return places;
+}
+static constexpr headerPlaces places = placesOfHeader();
+
+// The number of a header's field, which stands as the writer writes it, a colon after it; false
+// when it does not.
+static inline bool takeHeaderColumns(const char* text, unsigned int field, uint32_t* number)
+{
+    const formatPlace place = places.field[field];
+    return text[place.at + place.width] == ':' &&
+           hexColumns(text + place.at + place.width - headerNumberWidth, number);
+}
+
+// Fields 1 to 13 of a header as the writer writes it; false for any other.
+static bool takeHeaderFields(const char* text, SQLUH_HEADER* header)
+{
+    uint32_t numbers[12];
+    uint32_t high[3];
+    bool taken = true;
+    for (unsigned int field = 0; field < 12; field++)
+        taken &= takeHeaderColumns(text, field, &numbers[field]);
+    for (unsigned int i = 0; i < 3; i++)
+        taken &= hexColumns(text + places.field[i + 1].at, &high[i]);
+    if (!taken)
+        return false;
+    header->checksum = numbers[0];
+    header->offset1 = uint64_t{high[0]} << 32 | numbers[1];
+    header->offset2 = uint64_t{high[1]} << 32 | numbers[2];
+    header->offset3 = uint64_t{high[2]} << 32 | numbers[3];
+    header->entryCount = numbers[4];
+    header->number6 = numbers[5];
+    header->number7 = numbers[6];
+    header->number8 = numbers[7];
+    header->number9 = numbers[8];
+    header->number10 = numbers[9];
+    header->number11 = numbers[10];
+    header->nodeNumber = static_cast<uint16_t>(numbers[11]);
+    header->status = text[places.field[12].at];
+    return true;
+}
+
+// The same, however they stand. What a damaged text leaves out stays zero: the checksum tells.
 static void scanHeaderFields(const char* text, SQLUH_HEADER* header)
 {
     unsigned long long offsets[3] = {};
@@ -117,14 +167,23 @@ static void scanHeaderFields(const char* text, SQLUH_HEADER* header)
     header->status = status;
 }
 
+// A number as the writer writes it, or as strtoul takes it.
+static uint32_t headerNumber(const char* text, int base)
+{
+    uint32_t number = 0;
+    if (base == 10 ? decimalColumns(text, &number) : hexColumns(text, &number))
+        return number;
+    return numberAt(text, headerNumberWidth, base);
+}
+
 // The fields after the status letter, which stand at places that depend on the version. Returns
 // the place of field 17.
 static uint32_t takeVersionedFields(const char* text, SQLUH_HEADER* header)
 {
-    header->version = numberAt(text + headerVersionAt, headerNumberWidth, 10);
+    header->version = headerNumber(text + headerVersionAt, 10);
     if (header->version < versionWithNumber15)
         return headerMaxCommandAt6010000;
-    header->number15 = numberAt(text + headerNumber15At, headerNumberWidth, 16);
+    header->number15 = headerNumber(text + headerNumber15At, 16);
     if (header->version < versionWithTimestamp)
         return headerMaxCommandAt7020200;
     if (text[headerTimestampAt] == SQLUH_EMPTY_WORD[0]) {
@@ -141,10 +200,11 @@ static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header,
                        const char* operation)
 {
     memset(header, 0, sizeof *header);
-    scanHeaderFields(text, header);
+    if (!takeHeaderFields(text, header))
+        scanHeaderFields(text, header);
     uint32_t maxCommandAt = takeVersionedFields(text, header);
     if (text[maxCommandAt] != ' ') {
-        header->maxCommandLength = numberAt(text + maxCommandAt, headerNumberWidth, 16);
+        header->maxCommandLength = headerNumber(text + maxCommandAt, 16);
         return 0;
     }
     uint32_t longest = 0;

@@ -70,6 +70,7 @@ struct heldLock {
 
 // A lock that finds no slot is held all the same, only without what the table is for.
 static heldLock heldLocks[256];
+static unsigned int numHeld;
 static pthread_mutex_t heldLocksMutex = PTHREAD_MUTEX_INITIALIZER;
 
 static void beforeFork()
@@ -90,6 +91,7 @@ static void afterForkInChild()
             close(held.file);
         held.thread = 0;
     }
+    numHeld = 0;
     pthread_mutex_unlock(&heldLocksMutex);
 }
 
@@ -111,8 +113,10 @@ static void enterHeld(const SQLO_NLCK* lock)
 {
     pthread_mutex_lock(&heldLocksMutex);
     heldLock* held = findHeld(nullptr);
-    if (held != nullptr)
+    if (held != nullptr) {
         *held = {*lock, gettid(), -1};
+        numHeld++;
+    }
     pthread_mutex_unlock(&heldLocksMutex);
 }
 
@@ -122,8 +126,10 @@ static void forgetHeld(const SQLO_NLCK* lock)
     heldLock* held = findHeld(lock);
     if (held != nullptr && held->file != -1)
         close(held->file);
-    if (held != nullptr)
+    if (held != nullptr) {
         held->thread = 0;
+        numHeld--;
+    }
     pthread_mutex_unlock(&heldLocksMutex);
 }
 
@@ -338,8 +344,8 @@ int sqloNLCKCheckDeadlock(const SQLO_NLCK* lock)
     pdtEntry();
 
     int rc = 0;
-    const pid_t me = gettid();
     pthread_mutex_lock(&heldLocksMutex);
+    const pid_t me = numHeld == 0 ? -1 : gettid();
     for (const heldLock& held : heldLocks)
         if (held.thread == me && held.lock.key == lock->key && sqloNLCKCheckHeld(&held.lock) == 0)
             rc = sqloNLCKDeadlock;
