@@ -490,7 +490,9 @@ int sqluhReadCommitted(const char* directory, SQLUH_COMMITTED** out)
     pairRead read = {};
     *out = nullptr;
     read.history.fh = read.shadow.fh = sqloNoFile;
-    int rc = sqluhJoinPath(read.history.path, pathCapacity, directory, SQLUH_HISTORY_NAME);
+    int rc = sqluhCheckDirectory(directory);
+    if (rc == 0)
+        rc = sqluhJoinPath(read.history.path, pathCapacity, directory, SQLUH_HISTORY_NAME);
     if (rc == 0)
         rc = sqluhJoinPath(read.shadow.path, pathCapacity, directory, SQLUH_SHADOW_NAME);
     if (rc == 0) {

@@ -292,7 +292,10 @@ int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOu
 {
     pdtEntry();
 
-    int rc = logged(sqluhHandleAllocAndInit(directory, handleOut));
+    *handleOut = nullptr;
+    int rc = logged(sqluhCheckDirectory(directory));
+    if (rc == 0)
+        rc = logged(sqluhHandleAllocAndInit(directory, handleOut));
     if (rc == 0)
         rc = logged(sqluhLock(*handleOut));
     if (rc == 0)

@@ -201,6 +201,8 @@ int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory)
     // Told before the source is opened.
     int rc = strlen(targetDirectory) <= maxDirectoryLength ? 0 : sqluhPathTooLong;
     if (rc == 0)
+        rc = sqluhCheckDirectory(targetDirectory);
+    if (rc == 0)
         rc = sqluhOpen(&handle, sourceDirectory, SQLUH_OPEN_READ);
     if (rc == 0)
         rc = copyInto(handle->historyPath, targetDirectory, __func__);

@@ -108,6 +108,12 @@ bool sqluhIsHistEntryIncrOrDelta(char operationType)
 
 // --- Paths ---------------------------------------------------------------------------------------
 
+int sqluhCheckDirectory(const char* directory)
+{
+    size_t length = strlen(directory);
+    return length == 0 || directory[length - 1] == '/' ? 0 : sqluhPathNoSeparator;
+}
+
 int sqluhJoinPath(char* path, size_t capacity, const char* directory, const char* name)
 {
     int length = ossSnprintf(path, capacity, "%s%s", directory, name);

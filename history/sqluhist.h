@@ -10,6 +10,7 @@
 // A code is 0, a negative failure, or a positive warning that still delivers. The comments name all
 // that can come back; of those passed up,
 //   a call's code   is what the OS-services call returned (sqo/sqlo.h), unchanged;
+//   path code       is sqluhPathTooLong or sqluhPathNoSeparator;
 //   transfer code   is that of a failed or short read or write as sqlzGetZRCInfo maps it,
 //                   HISTORY_FILE_DAMAGED where it maps it to 0;
 //   lock code       is sqloNLCKKeyFailure, sqloNLCKKeyConflict, sqloNLCKOwnerDied,
@@ -33,8 +34,12 @@ enum : int {
     HISTORY_WARNING = 2172,           // an error turned into a warning by sqluh_build_warning
 };
 
-// What a path that does not fit the fixed path buffers is refused with.
-enum : int { sqluhPathTooLong = sqloSystemError | 36 }; // ENAMETOOLONG
+// What a path is refused with.
+enum : int {
+    sqluhPathTooLong = sqloSystemError | 36,     // ENAMETOOLONG: it does not fit the path buffers
+    sqluhPathNoSeparator = sqloSystemError | 22, // EINVAL: a directory without its last separator,
+                                                 // whose files would stand beside it
+};
 
 // --- The files -----------------------------------------------------------------------------------
 
@@ -413,7 +418,7 @@ enum : unsigned int { SQLUH_OPEN_READ = 4, SQLUH_OPEN_UPDATE = 12 };
 // open it again in another thread. A file that cannot be opened or read counts as damaged, whatever
 // the reason, but two are not given up while one of them may be sound. Returns 0 or
 // HISTORY_FILE_RECREATED with an open handle, to be released by sqluhClose; or with null stored
-// HISTORY_FILE_DAMAGED; sqluhPathTooLong; a lock code; an allocation's code; what kept a file from
+// HISTORY_FILE_DAMAGED; a path code; a lock code; an allocation's code; what kept a file from
 // being looked at; a failure of sqluhCreate.
 int sqluhOpen(SQLUH_HANDLE** handleOut, char* directory, unsigned int accessMode);
 
@@ -442,8 +447,8 @@ int sqluhCreate(char* directory);
 // Allocates a handle, takes the lock, examines both files and, if optToRecover, repairs them. The
 // handle is the caller's to unlock and free, also after a failure, unless null is stored; no file
 // is open through it. Returns 0; HISTORY_FILE_RECREATED; HISTORY_FILE_DAMAGED when neither file can
-// be used and none may be repaired, or a repair failed; a code of sqluhHandleAllocAndInit, with
-// null stored; a lock code; a failure of sqluhRecoverFromFatalError.
+// be used and none may be repaired, or a repair failed; sqluhPathNoSeparator or a code of
+// sqluhHandleAllocAndInit, with null stored; a lock code; a failure of sqluhRecoverFromFatalError.
 int sqluhAllocateHandleVerifyHistoryFilesAndOptToRecover(SQLUH_HANDLE** handleOut, char* directory,
                                                          bool optToRecover);
 
@@ -560,7 +565,7 @@ int sqluhEndBatch(SQLUH_HANDLE** handle, unsigned int flags);
 // Copies the history file of one directory over that of another, whose lock is not taken and which
 // has no shadow afterwards; each directory: at most 1011 bytes. Stopped at any moment, the target
 // holds its old or the new history. Returns 0; HISTORY_FILE_RECREATED, and nothing copied, when the
-// source was unusable; sqluhPathTooLong; a failure of sqluhOpen or sqluhClose; the copy's or the
+// source was unusable; a path code; a failure of sqluhOpen or sqluhClose; the copy's or the
 // deletion's code; what kept a file of the target from being looked at or marked.
 int sqluhCopyHistoryFile(char* sourceDirectory, char* targetDirectory);
 
@@ -590,7 +595,7 @@ struct SQLUH_COMMITTED {
 // directory: with its last separator, at most 1011 bytes. Stores what was read, the caller's until
 // sqluhFreeCommitted, and returns 0; HISTORY_READ_FROM_SHADOW; HISTORY_READ_PAST_DAMAGE. Or stores
 // null and returns HISTORY_FILE_MISSING when neither file is there; HISTORY_FILE_DAMAGED when
-// neither can be used; sqluhPathTooLong; sqloNLCKBusy, or another lock code, when writers kept it
+// neither can be used; a path code; sqloNLCKBusy, or another lock code, when writers kept it
 // off for some seconds; an allocation's code; sqloSystemError with the errno of what kept it from
 // opening or reading a file that may be sound.
 int sqluhReadCommitted(const char* directory, SQLUH_COMMITTED** out);

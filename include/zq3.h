@@ -3,25 +3,35 @@
 // libzq3.so.1 provides the three calls. The same zq3HistoryData record carries one entry of the
 // recovery history through the whole system: a scan fills it, the planner reads it, the
 // history-file library reads entries into it and writes them from it.
+//
+// The header is C11 as well as C++.
 #pragma once
 
-#include <cstddef>
-#include <cstdint>
+#include <assert.h>
+#include <stddef.h>
+#include <stdint.h>
 
 #include "sqo/sqlca.h"
 
+// The type of an enumeration's members, where the language can tell it.
+#ifdef __cplusplus
+#define ZQ3_OF(type) : type
+#else
+#define ZQ3_OF(type)
+#endif
+
 // The interface version that every scan call passes as its first argument.
-enum : unsigned int { zq3Version = 6010000 };
+enum ZQ3_OF(unsigned int) { zq3Version = 6010000 };
 
 // A text in a buffer of the caller's.
-struct textBuffer {
+typedef struct textBuffer {
     char* data;        // the caller's buffer; null: the caller does not want this text
     uint32_t capacity; // bytes in the buffer, room for the terminator included
     uint32_t length;   // length of the text; may exceed what the buffer could take
-};
+} textBuffer;
 
 // Room that holds every text of an entry, terminators included.
-enum : uint32_t {
+enum ZQ3_OF(uint32_t) {
     zq3ObjectPartCapacity = 18,
     zq3SecondTimestampCapacity = 15,
     zq3LogNameCapacity = 13, // firstText, lastText
@@ -34,7 +44,7 @@ enum : uint32_t {
 };
 
 // Letters of an entry; others occur, and mean nothing to this system.
-enum : char {
+enum ZQ3_OF(char) {
     zq3OperationBackup = 'B',
     zq3OperationRestore = 'R',
     zq3OperationCreate = 'A', // of a tablespace
@@ -51,7 +61,7 @@ enum : char {
 };
 
 // One entry of the recovery history. Every buffer it points to belongs to whoever set it up.
-struct zq3HistoryData {
+typedef struct zq3HistoryData {
     char eyecatcher[8];
     textBuffer objectPart;      // 14-digit timestamp and 3-digit sequence number
     textBuffer secondTimestamp; // 14-digit timestamp
@@ -77,10 +87,10 @@ struct zq3HistoryData {
     char status;
     char auxCode;
     char reserved2[3];
-};
+} zq3HistoryData;
 
 // Argument of zq3HistoryOpenScan.
-struct zq3HistoryOpenStruct {
+typedef struct zq3HistoryOpenStruct {
     char* databaseAlias;     // plain name of 1 to 8 characters, terminated
     char* timestamp;         // null: every entry; nothing else is taken
     char* objectName;        // null: every entry; nothing else is taken
@@ -88,28 +98,33 @@ struct zq3HistoryOpenStruct {
     uint32_t maxTablespaces; // out: largest number of names that one entry of the scan lists
     uint16_t callerAction;   // 0
     uint16_t handle;         // out: the scan, for the two other calls
-};
+} zq3HistoryOpenStruct;
 
 // Argument of zq3HistoryGetEntry.
-struct zq3HistoryFetchStruct {
+typedef struct zq3HistoryFetchStruct {
     zq3HistoryData* historyRecord; // filled by the call; its buffers are the caller's
     uint16_t handle;               // from zq3HistoryOpenStruct
     uint16_t callerAction;         // 2: the next entry
-};
+} zq3HistoryFetchStruct;
 
-static_assert(offsetof(zq3HistoryData, commandText) == 8 + 9 * sizeof(textBuffer));
-static_assert(offsetof(zq3HistoryData, logPosition) == 8 + 10 * sizeof(textBuffer));
-static_assert(offsetof(zq3HistoryData, eventSqlca) == 8 + 10 * sizeof(textBuffer) + 16);
+static_assert(offsetof(zq3HistoryData, commandText) == 8 + 9 * sizeof(textBuffer), "layout");
+static_assert(offsetof(zq3HistoryData, logPosition) == 8 + 10 * sizeof(textBuffer), "layout");
+static_assert(offsetof(zq3HistoryData, eventSqlca) == 8 + 10 * sizeof(textBuffer) + 16, "layout");
 static_assert(sizeof(void*) != 4 ||
-              (sizeof(textBuffer) == 12 && sizeof(zq3HistoryData) == 168 &&
-               sizeof(zq3HistoryOpenStruct) == 24 && sizeof(zq3HistoryFetchStruct) == 8));
+                  (sizeof(textBuffer) == 12 && sizeof(zq3HistoryData) == 168 &&
+                   sizeof(zq3HistoryOpenStruct) == 24 && sizeof(zq3HistoryFetchStruct) == 8),
+              "layout");
 static_assert(sizeof(void*) != 4 || (offsetof(zq3HistoryData, tablespaceBuffers) == 148 &&
-                                     offsetof(zq3HistoryData, operation) == 160));
+                                     offsetof(zq3HistoryData, operation) == 160),
+              "layout");
 static_assert(sizeof(void*) != 8 ||
-              (sizeof(textBuffer) == 16 && sizeof(zq3HistoryData) == 216 &&
-               sizeof(zq3HistoryOpenStruct) == 40 && sizeof(zq3HistoryFetchStruct) == 16));
+                  (sizeof(textBuffer) == 16 && sizeof(zq3HistoryData) == 216 &&
+                   sizeof(zq3HistoryOpenStruct) == 40 && sizeof(zq3HistoryFetchStruct) == 16),
+              "layout");
 
+#ifdef __cplusplus
 extern "C" {
+#endif
 
 // All three: version is zq3Version, the record and ca are the caller's. Returns 0 when the call
 // could be made; the outcome is then ca->sqlcode: 0, a negative failure or a positive warning. Any
@@ -138,4 +153,6 @@ int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca* ca);
 // close; the scan has ended all the same.
 int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca);
 
+#ifdef __cplusplus
 } // extern "C"
+#endif

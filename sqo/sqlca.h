@@ -1,11 +1,14 @@
 // The SQL communication area, which every layer carries: the outcome of a call, or of the operation
 // that an entry records.
+//
+// The header is C11 as well as C++.
 #pragma once
 
-#include <cstddef>
-#include <cstdint>
+#include <assert.h>
+#include <stddef.h>
+#include <stdint.h>
 
-struct sqlca {
+typedef struct sqlca {
     char sqlcaid[8];    // identifier, no terminator
     int32_t sqlcabc;    // length of this record in bytes
     int32_t sqlcode;    // 0 success, negative failure, positive warning
@@ -15,5 +18,5 @@ struct sqlca {
     int32_t sqlerrd[6]; // diagnostic values
     char sqlwarn[11];   // warning letters
     char sqlstate[5];   // state, no terminator
-};
-static_assert(sizeof(sqlca) == 136 && offsetof(sqlca, sqlcode) == 12);
+} sqlca;
+static_assert(sizeof(sqlca) == 136 && offsetof(sqlca, sqlcode) == 12, "layout");
