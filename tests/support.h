@@ -52,6 +52,7 @@ class HistoryTest : public testing::Test
 {
   protected:
     std::string root, directory, historyPath, shadowPath, logPath;
+    std::vector<std::string> namedOperations; // that the records of takeLog name, neighbours once
 
     HistoryTest()
     {
@@ -81,17 +82,24 @@ class HistoryTest : public testing::Test
 
     // The records logged since the last call without time, process and function: the text, then
     // " [LABEL: N bytes]" for each dump. Levels other than Error stand in front; of an
-    // administration message only its number is kept.
+    // administration message only its number is kept. Every record names a public operation, as
+    // their names begin.
     std::vector<std::string> takeLog()
     {
         static const std::string admin = "Administration message ";
         std::vector<std::string> records;
         std::ifstream in(logPath);
+        namedOperations.clear();
         for (std::string line; std::getline(in, line);) {
             if (!line.starts_with("    ")) {
                 size_t level = line.find(" level=") + 7, function = line.find(" function=");
                 std::string name = line.substr(level, function - level) + " ";
-                std::string text = line.substr(line.find(':', function) + 1).erase(0, 1);
+                size_t end = line.find(':', function);
+                std::string text = line.substr(end + 1).erase(0, 1);
+                std::string operation = line.substr(function + 10, end - function - 10);
+                EXPECT_TRUE(operation.starts_with("sqlu") || operation.starts_with("sqlo")) << line;
+                if (namedOperations.empty() || namedOperations.back() != operation)
+                    namedOperations.push_back(operation);
                 if (text.starts_with(admin))
                     text.erase(admin.size() + 4);
                 records.push_back((name == "Error " ? "" : name) + text);
