@@ -81,10 +81,9 @@ TEST_F(Formats, EveryFieldIsReadAndWrittenByteForByte)
     EXPECT_EQ(0, sqluhVerifyOneEntry(handle.fileHandle, &r.workArea)); // with names for no buffer
 }
 
-TEST_F(Formats, SectionsAndPlaceholdersByteForByte)
+TEST_F(Formats, PlaceholdersAndCommandsByteForByte)
 {
     entryBuilder b;
-    const auto sections = [&] { return written(b.build()).substr(768); };
     b.data.object = b.data.operationType = b.data.auxCode = '\0';
     b.data.entryNode = 42;
     b.data.entryNumber = 7;
@@ -98,7 +97,12 @@ TEST_F(Formats, SectionsAndPlaceholdersByteForByte)
         b.command.assign(length, 'c');
         EXPECT_EQ(commandEntry(length), written(b.build()));
     }
-    b.command.clear();
+}
+
+TEST_F(Formats, SectionsByteForByte)
+{
+    entryBuilder b;
+    const auto sections = [&] { return written(b.build()).substr(768); };
     b.longText = std::string(300, 'l');
     EXPECT_EQ(std::string(255, 'l') + "\n", sections());
     b.longText.clear();
@@ -129,30 +133,49 @@ static void expectText(const std::string& source, size_t width, const textBuffer
     ASSERT_EQ(expected.substr(0, std::max(text.capacity, 1u) - 1), text.data ? text.data : "");
 }
 
-TEST_F(Formats, EntriesComeBackAsTheyWereWritten)
+// The i-th entry of many: every combination of the optional sections, every length in each.
+static void fillEntry(entryBuilder* b, size_t i)
 {
-    static const size_t lengths[] = {1, 17, 30, 31, 254, 255, 256, 257, 511, 900},
-                        widths[] = {17, 14, 12, 12, 24, 900, 900, 255, 30, 900};
+    static const size_t lengths[] = {1, 17, 30, 31, 254, 255, 256, 257, 511, 900};
     const auto text = [](size_t length, size_t seed) {
         std::string letters;
         while (letters.size() < length)
             letters += static_cast<char>('a' + (letters.size() * letters.size() + seed) % 26);
         return letters;
     };
+    for (size_t t = 0; t < 10; t++)
+        *b->texts()[t] = text((i >> t % 5 & 1) * lengths[(i + t) % 10], t);
+    for (size_t name = 0; name < i % 9; name++)
+        b->tablespaces.push_back(text(lengths[(i + name) % 10], name));
+    b->withSqlca = i % 4 != 0;
+    b->ca.sqlcode = static_cast<int32_t>(i % 7 * i % 5 * 429496729);
+    b->ca.sqlerrd[1] = i % 2 == 0 ? INT32_MIN : -12345;
+    b->ca.sqlerrml = 0x1F;
+    memcpy(b->ca.sqlerrmc, text(78, i).data(), 78);
+    b->data.entryNumber = static_cast<uint32_t>(i << 24);
+}
+
+// What a reader with buffers of this capacity has of an entry that was written.
+static void expectSame(entryBuilder& b, entryReader& r, uint32_t capacity)
+{
+    static const size_t widths[] = {17, 14, 12, 12, 24, 900, 900, 255, 30, 900};
     sqlca initial;
     sqloinca(&initial);
+    ASSERT_EQ(std::max(capacity + 512, b.entry.size), r.workArea.size);
+    ASSERT_EQ(b.withSqlca && b.ca.sqlcode != 0 ? 0x40u : 0u, r.flags);
+    for (size_t t = 0; t < 10; t++)
+        ASSERT_NO_FATAL_FAILURE(expectText(*b.texts()[t], widths[t], r.texts()[t]));
+    for (size_t name = 0; name < std::min(b.tablespaces.size(), r.tablespaceBuffers.size()); name++)
+        ASSERT_NO_FATAL_FAILURE(expectText(b.tablespaces[name], 900, r.tablespaceBuffers[name]));
+    ASSERT_TRUE(sameNumbers(b.entry, r.entry));
+    ASSERT_EQ(0, memcmp(b.withSqlca ? &b.ca : &initial, &r.ca, sizeof initial));
+}
+
+TEST_F(Formats, EntriesComeBackAsTheyWereWritten)
+{
     for (size_t i = 0; i < 120; i++) {
         entryBuilder b;
-        for (size_t t = 0; t < 10; t++) // every combination of the optional sections
-            *b.texts()[t] = text((i >> t % 5 & 1) * lengths[(i + t) % 10], t);
-        for (size_t name = 0; name < i % 9; name++)
-            b.tablespaces.push_back(text(lengths[(i + name) % 10], name));
-        b.withSqlca = i % 4 != 0;
-        b.ca.sqlcode = static_cast<int32_t>(i % 7 * i % 5 * 429496729);
-        b.ca.sqlerrd[1] = i % 2 == 0 ? INT32_MIN : -12345;
-        b.ca.sqlerrml = 0x1F;
-        memcpy(b.ca.sqlerrmc, text(78, i).data(), 78);
-        b.data.entryNumber = static_cast<uint32_t>(i << 24);
+        fillEntry(&b, i);
         const long long at = positionOf(handle.fileHandle);
         ASSERT_EQ(0, sqluhWriteEntry(&handle, b.build()));
         b.entry.noteLength = std::min(b.entry.noteLength, 30u);
@@ -162,15 +185,7 @@ TEST_F(Formats, EntriesComeBackAsTheyWereWritten)
             sqloseek(handle.fileHandle, at, sqloFromStart, nullptr);
             ASSERT_EQ(i % 9 > capacity / 64 ? 2165 : 0, r.read(handle.fileHandle));
             ASSERT_EQ(at + b.entry.size, positionOf(handle.fileHandle));
-            ASSERT_EQ(std::max(capacity + 512, b.entry.size), r.workArea.size);
-            ASSERT_EQ(b.withSqlca && b.ca.sqlcode != 0 ? 0x40u : 0u, r.flags);
-            for (size_t t = 0; t < 10; t++)
-                ASSERT_NO_FATAL_FAILURE(expectText(*b.texts()[t], widths[t], r.texts()[t]));
-            for (size_t name = 0; name < std::min(i % 9, r.tablespaceBuffers.size()); name++)
-                ASSERT_NO_FATAL_FAILURE(
-                    expectText(b.tablespaces[name], 900, r.tablespaceBuffers[name]));
-            ASSERT_TRUE(sameNumbers(b.entry, r.entry));
-            ASSERT_EQ(0, memcmp(b.withSqlca ? &b.ca : &initial, &r.ca, sizeof initial));
+            ASSERT_NO_FATAL_FAILURE(expectSame(b, r, capacity)) << i << " " << capacity;
         }
     }
     EXPECT_EQ("", joined(takeLog()));
@@ -188,7 +203,7 @@ TEST_F(Formats, FiltersSetTheirBits)
         {1024, nullptr, "SCHEMA1", nullptr, nullptr, 0x41},
         {1024, nullptr, "SCHEMA12", "T1", nullptr, 0x42},
         {1024, nullptr, "SCHEMA", "", "TS", 0x40},
-        {1024, nullptr, nullptr, nullptr, "TS3", 0x44}, // behind what the caller has room for
+        {1024, nullptr, nullptr, nullptr, "TS3", 0x44}, // after what the caller has room for
         {1024, "20260102030406", nullptr, nullptr, nullptr, 0x48},
         {1024, "20260102030405999", nullptr, nullptr, nullptr, 0x50},
         {1024, "2026010203040", nullptr, nullptr, nullptr, 0x60},

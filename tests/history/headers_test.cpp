@@ -49,7 +49,7 @@ TEST_F(Headers, EveryVersionIsReadByItsOwnRulesAndWrittenInTheCurrentForm)
         const char* checksum;
         unsigned int version, offset3;
         std::string tail;
-        const char *writtenChecksum, *written; // behind number 15
+        const char *writtenChecksum, *written; // after number 15
     } rows[] = {
         // clang-format off
         {"83CB7C76", 9010300, 0, current, "83CB7C76", "20260102030405:0000CAFE:"}, // of 92 bytes
