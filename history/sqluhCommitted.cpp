@@ -55,6 +55,7 @@ struct pairRead {
     lookedFile history, shadow;
     timespec clock;  // when it began: what the system stamps files with
     timespec offset; // of that clock from the one that is never set
+    bool foreign;    // the times of a file are not this system's own
     SQLUH_COMMITTED* result;
 };
 
@@ -326,8 +327,9 @@ static int readQuietly(pairRead* read, bool* proven)
 {
     int rc = beginRead(read);
     *proven = rc != 0;
-    if (rc == 0 && isOlder(&read->history, read->clock) && isOlder(&read->shadow, read->clock) &&
-        hasOwnTimes(&read->history) && hasOwnTimes(&read->shadow)) {
+    read->foreign = !hasOwnTimes(&read->history) || !hasOwnTimes(&read->shadow);
+    if (rc == 0 && !read->foreign && isOlder(&read->history, read->clock) &&
+        isOlder(&read->shadow, read->clock)) {
         rc = readChosen(read);
         *proven = nobodyWrote(read);
     }
@@ -447,7 +449,7 @@ static int readUnlocked(pairRead* read, bool* done)
 {
     int rc = 0;
     int doubts = 0;
-    for (int tries = 0; !*done && tries < quietTries; tries++) {
+    for (int tries = 0; !*done && !read->foreign && tries < quietTries; tries++) {
         endRead(read);
         rc = readQuietly(read, done);
         if (*done && isDoubtful(read, rc) && ++doubts < doubtfulLooks) {

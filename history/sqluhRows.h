@@ -26,7 +26,7 @@ struct sqluhRows {
 int sqluhAddRow(sqluhRows* rows, const SQLUH_ENTRY* entry, const SQLUH_WORKAREA* workArea,
                 sqluhProvenEntry* proven);
 
-// Copies a row out, as sqluhReadEntry would have read the entry; checksum and size are 0.
+// Copies a row out, as sqluhReadEntry would have read the entry.
 // asWritten: letters, note and long text as they stand in the file, so that writing them gives the
 // same bytes. Returns 0 or TABLESPACE_LIST_TRUNCATED.
 int sqluhTakeRow(const sqluhRow* row, SQLUH_ENTRY* entry, bool asWritten);

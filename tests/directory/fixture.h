@@ -19,6 +19,9 @@ inline std::function<int(const std::string& call, int command)> onCall;
 // The same for each system call under the files: an errno, or 0.
 inline std::function<int(const std::string& call)> onSystemCall;
 
+// What the system is made to tell as every file's change time, in whole seconds; 0: the truth.
+inline time_t changeTime;
+
 enum diskKind {
     diskWrite,
     diskTruncate,

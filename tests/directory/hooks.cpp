@@ -120,7 +120,19 @@ extern "C" ssize_t pread(int fd, void* buffer, size_t count, off_t offset)
 extern "C" int fstat(int fd, struct stat* status) noexcept
 {
     static const auto real = next(&fstat, "fstat64");
-    return fails("fstat") ? -1 : real(fd, status);
+    const int rc = fails("fstat") ? -1 : real(fd, status);
+    if (changeTime != 0)
+        status->st_ctim = {changeTime, 0};
+    return rc;
+}
+
+extern "C" int stat(const char* path, struct stat* status) noexcept
+{
+    static const auto real = next(&stat, "stat64");
+    const int rc = real(path, status);
+    if (changeTime != 0)
+        status->st_ctim = {changeTime, 0};
+    return rc;
 }
 
 extern "C" int fallocate(int fd, int mode, off_t offset, off_t length)

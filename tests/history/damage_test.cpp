@@ -2,6 +2,7 @@
 
 #include <random>
 
+#include "history/sqluhRows.h"
 #include "records.h"
 #include "scanaside.h"
 
@@ -172,4 +173,71 @@ TEST_F(Damage, ReaderTakesWhatTheScanningFormatTakes)
     }
     EXPECT_GT(taken, 2000);
     sqloclose(fh);
+}
+
+// Whether both hold the same, in all of their buffers.
+static bool holdTheSame(entryReader& a, entryReader& b)
+{
+    bool same = sameNumbers(a.entry, b.entry) && a.storage == b.storage &&
+                memcmp(&a.ca, &b.ca, sizeof a.ca) == 0 &&
+                memcmp(a.data.logPosition, b.data.logPosition, sizeof a.data.logPosition) == 0 &&
+                memcmp(a.data.eyecatcher, b.data.eyecatcher, sizeof a.data.eyecatcher) == 0;
+    for (int i = 0; i < 10; i++)
+        same &= a.texts()[i].length == b.texts()[i].length;
+    for (size_t i = 0; i < a.tablespaceBuffers.size(); i++)
+        same &= a.tablespaceBuffers[i].length == b.tablespaceBuffers[i].length;
+    return same;
+}
+
+// A quarter of them mutated, the others as they came; few enough kinds that many share their lists.
+static std::vector<std::string> mixedEntries(size_t count)
+{
+    std::mt19937 random(815);
+    std::vector<std::string> kinds = {full,
+                                      with(79, "00000002"),
+                                      with(1035, "0000000a"),
+                                      with(1044, zero + "ATALOG"),
+                                      commandEntry(256, "00000101000000", {"A", "BB", "C"}),
+                                      commandEntry(0, "20260102030405", {"A", "BB", "D"}),
+                                      with(768, zeros),
+                                      with(1100, "   "),
+                                      mutatedEntries(1)[0]};
+    std::vector<std::string> records(count);
+    for (std::string& record : records) {
+        record = kinds[random() % kinds.size()];
+        if (random() % 4 == 0)
+            record = stamped(record.replace(9 + random() % (record.size() - 9), 1, 1,
+                                            "0 \n:1F-\0"[random() % 8]));
+    }
+    return records;
+}
+
+TEST_F(Damage, RowsHoldWhatTheReaderReads)
+{
+    setenv("ZQ3DIAGLOG", "/dev/null", 1);
+    sqluhRows rows = {};
+    sqluhProvenEntry proven;
+    sqluhBeginProving(&proven, true);
+    entryReader prover(8, 0, 512);
+    uint32_t taken = 0;
+    for (const std::string& record : mixedEntries(8000)) {
+        spill(historyPath, record);
+        SQLO_FHANDLE fh = open(sqloOpenRead);
+        const bool roomy = taken % 2 == 0;
+        entryReader read(roomy ? 600 : 7, roomy ? 32 : 1), row(roomy ? 600 : 7, roomy ? 32 : 1);
+        const int rc = read.read(fh);
+        sqloseek(fh, 0, sqloFromStart, nullptr);
+        int added = sqluhProveEntry(fh, &prover.entry, &prover.workArea, &proven, nullptr);
+        if (added == 0)
+            added = sqluhAddRow(&rows, &prover.entry, &prover.workArea, &proven);
+        sqloclose(fh);
+        ASSERT_EQ(rc == TABLESPACE_LIST_TRUNCATED ? 0 : rc, added) << record;
+        if (added != 0)
+            continue;
+        ASSERT_EQ(rc, sqluhTakeRow(rows.rows[taken++], &row.entry, false)) << record;
+        ASSERT_TRUE(holdTheSame(read, row)) << record;
+    }
+    EXPECT_GT(taken, 4000u);
+    EXPECT_EQ(taken, rows.count);
+    sqluhFreeRows(&rows);
 }
