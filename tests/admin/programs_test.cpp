@@ -279,8 +279,8 @@ TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)
 // The locks of a node that no other test has: of a process that died, and of this one.
 TEST_F(ProgramTest, LocksWithoutAFileAreRemovedWhereTheirOwnersDied)
 {
-    const int32_t node = 77 << 24, place = getpid() & 0x7FFFFF;
-    SQLO_NLCK dead = {node + (1 << 24) + place, -1}, alive = dead;
+    const uint32_t node = 245, place = static_cast<uint32_t>(getpid()) & 0x7FFFFF;
+    SQLO_NLCK dead = {static_cast<int32_t>((node + 1) << 24 | place), -1}, alive = dead;
     alive.key ^= 1;
     if (fork() == 0) {
         sqloNLCKLock(&dead, 0, 0);
@@ -292,6 +292,6 @@ TEST_F(ProgramTest, LocksWithoutAFileAreRemovedWhereTheirOwnersDied)
     snprintf(removed, sizeof removed, "Removed the lock with the key 0x%08X\n",
              static_cast<unsigned int>(dead.key));
     EXPECT_EQ(removed + std::string("1 locks removed, 1 left alone\n[0]"),
-              run("unlock --all", "", "export ZQ3NODE=77; "));
+              run("unlock --all", "", "export ZQ3NODE=245; "));
     EXPECT_EQ(0, sqloNLCKUnlock(&alive));
 }
