@@ -61,11 +61,11 @@ extern "C" {
 
 // Opens a regular file and fills *fh, which is the caller's to close. options: one of the words
 // above; permissions: bits of a file that this call creates. A file created by it is durably in its
-// directory when the call returns. A file that sqlomove was refused for, and that could not be
-// opened since, is not emptied instead. Returns 0 or sqloFileExisted with the file open; or, with
+// directory when the call returns. A file that this thread could not open or move may be sound:
+// until an open of it succeeds, the thread neither empties nor moves it nor copies over it, and the
+// code of the failure comes back instead. Returns 0 or sqloFileExisted with the file open; or, with
 // *fh sqloNoFile, sqloFileIncomplete for a marked file that shall neither be made nor emptied,
-// DISK_FULL when a created file's name could not be stored, the code of the refused move, or
-// sqloSystemError.
+// DISK_FULL when a created file's name could not be stored, that code, or sqloSystemError.
 int sqloopenp(const char* path, unsigned int options, unsigned int permissions, SQLO_FHANDLE* fh);
 
 // Closes a file. Its handle is of no use afterwards, whatever comes back.
@@ -107,7 +107,7 @@ int sqloreserve(const char* source, const char* target);
 // durable and the target's room reserved first; the target's first 8 bytes, by which it is
 // recognised, are written last, so that nobody takes a copy that stopped part-way for a whole one.
 // A copy of a file onto itself, or of a marked file, is refused. options: 0. Returns 0,
-// sqloFileIncomplete, DISK_FULL, the code of a move that target was refused for, or
+// sqloFileIncomplete, DISK_FULL, the code with which target could not be opened before, or
 // sqloSystemError; the target then is as it was or empty, or is whole when only its closing failed.
 int sqlocopy(const char* source, const char* target, unsigned int options);
 

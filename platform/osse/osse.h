@@ -62,8 +62,9 @@ inline bool osseIsMarked(const struct stat* status)
 // Sets it or takes it off. Returns 0 or a code.
 int osseSetMark(int descriptor, const struct stat* status, bool marked);
 
-// What a move was refused for must not be emptied instead: remembers the code of the refusal until
-// the file can be opened or moved. osseRefusal returns it, or 0.
+// What this thread could not open may be sound and must not be moved, emptied or copied over by it:
+// osseRefuse remembers the code of the failure, until it is called with 0. osseRefusal returns it,
+// or 0, also for an empty file, which has nothing to lose.
 void osseRefuse(const struct stat* status, int code);
 int osseRefusal(const struct stat* status);
 

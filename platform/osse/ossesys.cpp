@@ -6,7 +6,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
-#include <pthread.h>
 #include <sys/uio.h>
 #include <unistd.h>
 
@@ -155,11 +154,10 @@ struct refusedFile {
     ino_t inode;
     int code; // 0: no longer refused
 };
-static refusedFile refusedFiles[16]; // a move is rare, and a refused one rarer
-static unsigned int nextRefused;
-static pthread_mutex_t refusedMutex = PTHREAD_MUTEX_INITIALIZER;
+// Each thread's own: what one of them could not open is no reason to refuse it to another.
+static thread_local refusedFile refusedFiles[16];
+static thread_local unsigned int nextRefused;
 
-// The file's element, or null. The mutex is held.
 static refusedFile* findRefused(const struct stat* status)
 {
     for (refusedFile& file : refusedFiles)
@@ -170,20 +168,15 @@ static refusedFile* findRefused(const struct stat* status)
 
 void osseRefuse(const struct stat* status, int code)
 {
-    pthread_mutex_lock(&refusedMutex);
     refusedFile* file = findRefused(status);
     if (file == nullptr && code != 0)
         file = &refusedFiles[nextRefused++ % 16];
     if (file != nullptr)
         *file = {status->st_dev, status->st_ino, code};
-    pthread_mutex_unlock(&refusedMutex);
 }
 
 int osseRefusal(const struct stat* status)
 {
-    pthread_mutex_lock(&refusedMutex);
-    const refusedFile* file = findRefused(status);
-    const int code = file == nullptr ? 0 : file->code;
-    pthread_mutex_unlock(&refusedMutex);
-    return code;
+    const refusedFile* file = status->st_size == 0 ? nullptr : findRefused(status);
+    return file == nullptr ? 0 : file->code;
 }

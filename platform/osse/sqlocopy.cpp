@@ -199,20 +199,24 @@ static bool areInOneDirectory(const char* a, const char* b)
     return lengthA == lengthB && memcmp(a, b, static_cast<size_t>(lengthA)) == 0;
 }
 
-// A file that cannot be read just now may be sound: it stays where it is looked for.
+// A file that cannot be read just now, be it for want of memory, may be sound: it stays where it is
+// looked for. So does one that could not be opened when it was looked at last.
 static int checkMovable(const char* path, const struct stat* status)
 {
-    int source;
+    int source = -1;
     struct stat opened;
-    unsigned char byte;
     size_t got;
     if (!S_ISREG(status->st_mode))
         return 0;
-    int rc = osseOpenRegular(path, O_RDONLY, 0, &source, &opened);
-    if (rc != 0)
-        return rc;
-    rc = osseReadAt(source, &byte, 1, 0, &got);
-    close(source);
+    unsigned char* buffer = static_cast<unsigned char*>(malloc(copyLength));
+    int rc = buffer == nullptr ? systemFailure(ENOMEM) : osseRefusal(status);
+    if (rc == 0)
+        rc = osseOpenRegular(path, O_RDONLY, 0, &source, &opened);
+    if (rc == 0)
+        rc = osseReadAt(source, buffer, copyLength, 0, &got);
+    if (source != -1)
+        close(source);
+    free(buffer);
     return rc;
 }
 

@@ -92,7 +92,7 @@ static int enterFile(int descriptor, SQLO_FHANDLE* fh)
 // Of a file that an open empties. One that the open made is empty already.
 static int emptyFile(int descriptor, const struct stat* status)
 {
-    int rc = status->st_size == 0 ? 0 : osseRefusal(status);
+    int rc = osseRefusal(status);
     if (rc == 0 && ftruncate(descriptor, 0) != 0)
         rc = systemFailure(errno);
     if (rc == 0 && osseIsMarked(status))
@@ -103,10 +103,16 @@ static int emptyFile(int descriptor, const struct stat* status)
 // Of a file that is opened for what is in it.
 static int admitFile(const struct stat* status)
 {
-    if (osseIsMarked(status))
-        return sqloFileIncomplete;
     osseRefuse(status, 0);
-    return 0;
+    return osseIsMarked(status) ? int{sqloFileIncomplete} : 0;
+}
+
+// Of a file that could not be opened: the reason may lie outside it (no descriptor, no right).
+static void refuseUnopened(const char* path, int code)
+{
+    struct stat status;
+    if (stat(path, &status) == 0)
+        osseRefuse(&status, code);
 }
 
 OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int permissions,
@@ -120,6 +126,8 @@ OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int p
     int descriptor;
     struct stat status;
     int rc = osseOpenRegular(path, flags, permissions, &descriptor, &status);
+    if (rc != 0)
+        refuseUnopened(path, rc);
     if (rc == 0 && options == sqloOpenNew)
         rc = emptyFile(descriptor, &status);
     else if (rc == 0 && (flags & O_CREAT) == 0)

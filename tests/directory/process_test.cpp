@@ -356,14 +356,14 @@ class RestoreTest : public ProcessTest
 // It may find nothing but damage, and move the new file aside; and then fail to make its own.
 TEST_F(RestoreTest, DoesNotFollowAFileThatWasMovedAside)
 {
-    for (const int failure : {0, int{DISK_FULL}}) {
+    for (const bool isFull : {false, true}) {
         EXPECT_EQ(0, restoreMeeting([&] {
                       spill(shadowPath, "junk");
                       EXPECT_EQ(0, waitFor(inChild([&] {
-                                    onCall = [&](const std::string& call, int) {
-                                        return call == "sqlowrite" ? failure : 0;
+                                    onSystemCall = [&](const std::string& call) {
+                                        return isFull && call == "pwrite" ? ENOSPC : 0;
                                     };
-                                    return openAndClose() != (failure == 0 ? 2160 : failure);
+                                    return openAndClose() != (isFull ? int{DISK_FULL} : 2160);
                                 })));
                   }));
         EXPECT_EQ(0, sqluhClose(&handle));
@@ -426,20 +426,38 @@ TEST_F(ProcessTest, ABatchWhoseLockWasTakenAwayIsRefused)
     }
 }
 
-// No descriptor, or no right: a sound pair stays where it is.
-TEST_F(ProcessTest, APairThatCannotBeOpenedIsNotMovedAside)
+// No descriptor, or no right, be it for a moment: what may be sound is neither moved aside nor
+// replaced.
+TEST_F(ProcessTest, AFileThatCannotBeOpenedStays)
 {
-    for (const int error : {EMFILE, EACCES}) {
-        const Files before = filesOf(" 10/ 10");
-        store(before);
-        bool isEmpty = false;
-        onSystemCall = [&](const std::string& call) { return call == "open" ? error : 0; };
-        EXPECT_EQ(sqloSystemError | error, openAndClose());
-        EXPECT_EQ(sqloSystemError | error, sqluhIsHistoryFileEmpty(directory.data(), &isEmpty));
-        EXPECT_EQ(sqloSystemError | error, batch(1));
-        onSystemCall = nullptr;
-        EXPECT_TRUE(load() == before);
-    }
+    const struct {
+        const char* before;
+        unsigned int opens; // that fail; after the lock's own, history and shadow are opened twice
+        bool isRepair;
+        unsigned int outcome;
+    } rows[] = {{" 10/ 10", ~0u, false, 10},
+                {" 10/ 10", 0b11110, false, 10},
+                {"junk/ 10", 0b10100, false, 10},
+                {"C12/ 10", 0b01010, true, 12}};
+    for (const auto& row : rows)
+        for (const int error : {EMFILE, EACCES}) {
+            SCOPED_TRACE(testing::Message() << row.before << " " << row.opens << " " << error);
+            store(filesOf(row.before));
+            unsigned int opens = 0;
+            onSystemCall = [&](const std::string& call) {
+                return call == "open" && (row.opens >> std::min(opens++, 31u) & 1) != 0 ? error : 0;
+            };
+            const int rc = row.isRepair ? int{HISTORY_FILE_DAMAGED} : sqloSystemError | error;
+            bool isEmpty = false;
+            EXPECT_EQ(rc, openAndClose());
+            opens = 0;
+            EXPECT_EQ(rc, sqluhIsHistoryFileEmpty(directory.data(), &isEmpty));
+            opens = 0;
+            EXPECT_EQ(rc, batch(1));
+            onSystemCall = nullptr;
+            EXPECT_TRUE(row.isRepair || load() == filesOf(row.before));
+            EXPECT_EQ("", faultOf({row.outcome}));
+        }
 }
 
 TEST_F(ProcessTest, AThreadDoesNotWaitForItself)

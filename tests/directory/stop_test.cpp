@@ -87,6 +87,8 @@ TEST_F(StopTest, EveryStopLeavesTheOldOrTheNewHistory)
 
 // --- Failures ------------------------------------------------------------------------------------
 
+static const int errors[] = {EIO, ENOSPC, EMFILE, ENOMEM, EACCES};
+
 class FailureTest : public DirectoryTest
 {
   protected:
@@ -200,7 +202,7 @@ class FailureTest : public DirectoryTest
 TEST_F(FailureTest, EveryFailureIsReportedAndLeavesTheOldOrTheNewHistory)
 {
     for (const scenario& s : scenarios)
-        for (const int error : {EIO, ENOSPC, ENOMEM})
+        for (const int error : errors)
             for (const bool lasts : {false, true})
                 failEach(s, error, lasts, false);
     printf("%u failures tried\n", tried);
@@ -212,7 +214,7 @@ TEST_F(FailureTest, EverySystemCallMayFailOnceOrFromThenOn)
 {
     unsetenv("ZQ3SYNC");
     for (const scenario& s : scenarios)
-        for (const int error : {EIO, ENOSPC, EMFILE, ENOMEM, EACCES})
+        for (const int error : errors)
             for (const bool lasts : {false, true})
                 failEach(s, error, lasts, true);
     printf("%u failures of system calls tried\n", tried);
