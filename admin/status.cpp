@@ -40,6 +40,8 @@ static const char* lockWords(int state)
         return "held";
     case sqloNLCKStale:
         return "left by a process that died while it held it";
+    case sqloNLCKFaked:
+        return "held, though another process freed it";
     default:
         return "another program's semaphore set has its key";
     }
@@ -122,8 +124,8 @@ static void putJsonFile(jsonWriter* json, const char* key, const fileReport* fil
 static void showJson(const historyPlace* place, const directoryReport* report)
 {
     static const char* const repairs[] = {"none", "shadow", "history", "anew"};
-    static const char* const states[] = {"free", "being taken", "setup died",
-                                         "held", "holder died", "foreign"};
+    static const char* const states[] = {"free",        "being taken", "setup died", "held",
+                                         "holder died", "foreign",     "freed"};
     jsonWriter json = {};
     beginAnswer(&json);
     putJsonText(&json, "directory", place->directory);

@@ -35,6 +35,11 @@ static int failAlive(const historyPlace* place, const SQLO_NLCKSTATE* state)
 {
     if (state->state == sqloNLCKHeld)
         fail(place->directory, "the lock is held by process %d and was left alone", state->pid);
+    else if (state->state == sqloNLCKFaked)
+        fail(place->directory,
+             "the lock's holder lives, though process %d freed the lock; it was "
+             "left alone",
+             state->pid);
     else
         fail(place->directory, "the lock is just being taken and was left alone");
     return exitLocked;

@@ -62,10 +62,11 @@ extern "C" {
 // Opens a regular file and fills *fh, which is the caller's to close. options: one of the words
 // above; permissions: bits of a file that this call creates. A file created by it is durably in its
 // directory when the call returns. A file that this thread could not open or move may be sound:
-// until an open of it succeeds, the thread neither empties nor moves it nor copies over it, and the
-// code of the failure comes back instead. Returns 0 or sqloFileExisted with the file open; or, with
-// *fh sqloNoFile, sqloFileIncomplete for a marked file that shall neither be made nor emptied,
-// DISK_FULL when a created file's name could not be stored, that code, or sqloSystemError.
+// until an open of it succeeds, or somebody changes it, the thread neither empties nor moves it nor
+// copies over it, and the code of the failure comes back instead. Returns 0 or sqloFileExisted with
+// the file open; or, with *fh sqloNoFile, sqloFileIncomplete for a marked file that shall neither
+// be made nor emptied, DISK_FULL when a created file's name could not be stored, that code, or
+// sqloSystemError.
 int sqloopenp(const char* path, unsigned int options, unsigned int permissions, SQLO_FHANDLE* fh);
 
 // Closes a file. Its handle is of no use afterwards, whatever comes back.

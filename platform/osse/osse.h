@@ -63,8 +63,8 @@ inline bool osseIsMarked(const struct stat* status)
 int osseSetMark(int descriptor, const struct stat* status, bool marked);
 
 // What this thread could not open may be sound and must not be moved, emptied or copied over by it:
-// osseRefuse remembers the code of the failure, until it is called with 0. osseRefusal returns it,
-// or 0, also for an empty file, which has nothing to lose.
+// osseRefuse remembers the code of the failure, until it is called with 0 or the file changes.
+// osseRefusal returns it, or 0, also for an empty file, which has nothing to lose.
 void osseRefuse(const struct stat* status, int code);
 int osseRefusal(const struct stat* status);
 

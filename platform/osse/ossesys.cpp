@@ -3,6 +3,7 @@
 #include "osse.h"
 
 #include <climits>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
@@ -124,15 +125,11 @@ int osseSyncDirectoryOf(const char* path)
     if (barriersAreOff())
         return 0;
 
+    // The system has taken the path, so it fits.
     char directory[PATH_MAX] = ".";
     const char* slash = strrchr(path, '/');
-    if (slash != nullptr) {
-        const size_t length = static_cast<size_t>(slash - path) + 1;
-        if (length >= sizeof directory)
-            return systemFailure(ENAMETOOLONG);
-        memcpy(directory, path, length);
-        directory[length] = '\0';
-    }
+    if (slash != nullptr)
+        snprintf(directory, sizeof directory, "%.*s", static_cast<int>(slash - path) + 1, path);
     const int descriptor = osseOpen(directory, O_RDONLY | O_DIRECTORY, 0);
     if (descriptor < 0)
         return systemFailure(errno);
@@ -149,9 +146,12 @@ int osseSetMark(int descriptor, const struct stat* status, bool marked)
     return fchmod(descriptor, marked ? mode | S_ISVTX : mode) == 0 ? 0 : systemFailure(errno);
 }
 
+// A file is known by when it was changed, too: another one may get its inode, and whoever changes
+// it has opened it.
 struct refusedFile {
     dev_t device;
     ino_t inode;
+    timespec changed;
     int code; // 0: no longer refused
 };
 // Each thread's own: what one of them could not open is no reason to refuse it to another.
@@ -161,7 +161,8 @@ static thread_local unsigned int nextRefused;
 static refusedFile* findRefused(const struct stat* status)
 {
     for (refusedFile& file : refusedFiles)
-        if (file.code != 0 && file.device == status->st_dev && file.inode == status->st_ino)
+        if (file.code != 0 && file.device == status->st_dev && file.inode == status->st_ino &&
+            memcmp(&file.changed, &status->st_ctim, sizeof file.changed) == 0)
             return &file;
     return nullptr;
 }
@@ -172,7 +173,7 @@ void osseRefuse(const struct stat* status, int code)
     if (file == nullptr && code != 0)
         file = &refusedFiles[nextRefused++ % 16];
     if (file != nullptr)
-        *file = {status->st_dev, status->st_ino, code};
+        *file = {status->st_dev, status->st_ino, status->st_ctim, code};
 }
 
 int osseRefusal(const struct stat* status)

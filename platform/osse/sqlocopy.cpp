@@ -156,23 +156,24 @@ static bool isOccupied(const char* path)
     return lstat(path, &status) == 0 && !(S_ISREG(status.st_mode) && status.st_size == 0);
 }
 
-// Finds the first name path.1, path.2, ... that nothing has; name holds PATH_MAX bytes.
-static int nameToKeep(const char* path, char* name)
+// A path that the system takes, and a number.
+static constexpr size_t keptCapacity = PATH_MAX + sizeof ".4294967295";
+
+// Finds the first name path.1, path.2, ... that nothing has.
+static int nameToKeep(const char* path, char (&name)[keptCapacity])
 {
-    for (unsigned int number = 1; number < UINT_MAX; number++) {
-        struct stat status;
-        if (snprintf(name, PATH_MAX, "%s.%u", path, number) >= PATH_MAX)
-            return systemFailure(ENAMETOOLONG);
-        if (lstat(name, &status) != 0)
-            return errno == ENOENT ? 0 : systemFailure(errno);
-    }
-    return systemFailure(EEXIST);
+    struct stat status;
+    unsigned int number = 1;
+    do
+        snprintf(name, sizeof name, "%s.%u", path, number++);
+    while (lstat(name, &status) == 0);
+    return errno == ENOENT ? 0 : systemFailure(errno);
 }
 
 // Renames, first giving what occupies the target a name of its own; takes that back on failure.
 static int renameKeepingTarget(const char* source, const char* target)
 {
-    char kept[PATH_MAX];
+    char kept[keptCapacity];
     const bool occupied = isOccupied(target);
     if (occupied) {
         const int rc = nameToKeep(target, kept);

@@ -268,6 +268,17 @@ TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)
     EXPECT_EQ("zq3hist: the lock is held by process " + std::to_string(getpid()) +
                   " and was left alone, h/\n[4]",
               run("unlock h/"));
+    sqloNLCKKeepFile(&lock, historyPath.c_str());
+    sembuf step = {0, 1, 0};
+    pid_t meddler = fork();
+    if (meddler == 0)
+        _exit(semop(lock.id, &step, 1));
+    waitpid(meddler, nullptr, 0);
+    EXPECT_EQ("zq3hist: the lock's holder lives, though process " + std::to_string(meddler) +
+                  " freed the lock; it was left alone, h/\n[4]",
+              run("unlock h/"));
+    EXPECT_NE(std::string::npos, run("status --json h/").find("\"state\":\"freed\""));
+    EXPECT_NE(std::string::npos, run("status h/").find("held, though another process freed it"));
     ASSERT_EQ(0, sqloNLCKUnlock(&lock));
     int foreign = semget(lock.key, 1, IPC_CREAT | 0600);
     EXPECT_TRUE(run("unlock h/")

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <algorithm>
+#include <climits>
 #include <functional>
 #include <map>
 #include <set>
@@ -13,8 +14,10 @@
 #include "support.h"
 
 // Asked before each OS-services call (with 0) and each semaphore call (with its flags, its step or
-// its command): the code that it shall fail with instead, a semaphore call's an errno; or 0.
+// its command): the code that it shall fail with instead, a semaphore call's an errno; or 0. A
+// write that fails has written half; with onlyShort that is all that is wrong.
 inline std::function<int(const std::string& call, int command)> onCall;
+constexpr int onlyShort = INT_MIN;
 
 // The same for each system call under the files: an errno, or 0.
 inline std::function<int(const std::string& call)> onSystemCall;

@@ -160,6 +160,44 @@ TEST_F(FunctionalTest, HistoryDataIsOneBlockInOrder)
               sqluhAllocateHistoryData(&data, nullptr, 0, true, UINT32_MAX));
 }
 
+// A write that comes out short without a code for it, whichever of a batch or a restore.
+TEST_F(FunctionalTest, ShortWritesAreFailures)
+{
+    const int short_ = sqloSystemError | EIO, damaged = HISTORY_FILE_DAMAGED;
+    const std::vector<int> expected[] = {{damaged, short_, damaged, damaged, short_, damaged, 0},
+                                         {short_, short_, short_, damaged, 0}};
+    for (const bool isRestore : {false, true})
+        for (size_t k = 0; k < expected[isRestore].size(); k++) {
+            int writes = 0;
+            store(filesOf(" 10/ 10"));
+            onCall = [&](const std::string& call, int) {
+                return call == "sqlowrite" && writes++ == static_cast<int>(k) ? onlyShort : 0;
+            };
+            const int rc = isRestore ? restoreImage(samples.at(8)) : batch(1);
+            onCall = nullptr;
+            EXPECT_EQ(expected[isRestore][k], rc) << isRestore << " " << k;
+            const unsigned int last = isRestore ? 8 : 11;
+            EXPECT_EQ("", faultOf(rc == 0 ? std::vector{last} : std::vector{10u, last}));
+        }
+}
+
+TEST_F(FunctionalTest, ABackupIsReadPieceByPiece)
+{
+    store(filesOf(" 10/ 10"));
+    SQLUH_HANDLE* handle = nullptr;
+    ASSERT_EQ(0, sqluhOpen(&handle, directory.data(), SQLUH_OPEN_READ));
+    std::string image, piece(1000, '?');
+    unsigned int got = 1;
+    while (got != 0) {
+        auto* buffer = reinterpret_cast<unsigned char*>(piece.data());
+        const unsigned int at = static_cast<unsigned int>(image.size());
+        ASSERT_EQ(0, sqluh_fill_backup_buffer(handle, at, 1000, buffer, &got));
+        image.append(piece, 0, got);
+    }
+    EXPECT_TRUE(image == samples.at(10));
+    EXPECT_EQ(0, sqluhClose(&handle));
+}
+
 TEST_F(FunctionalTest, WarningCarriesTheErrorAsItsToken)
 {
     sqlca ca = {};

@@ -33,7 +33,8 @@ HOOK(sqloclose, (SQLO_FHANDLE fh), (fh), 0, (real(fh), code))
 HOOK(sqloread, (SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* done),
      (fh, buffer, count, done), 0, (*done = 0, code))
 HOOK(sqlowrite, (SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* done),
-     (fh, buffer, count, done), 0, (real(fh, buffer, count / 2, done), code))
+     (fh, buffer, count, done), 0,
+     (real(fh, buffer, count / 2, done), code == onlyShort ? 0 : code))
 HOOK(sqloseek, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* at),
      (fh, offset, origin, at), 0, code)
 HOOK(sqlochgfileptr, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* at),

@@ -4,19 +4,41 @@
 #include <atomic>
 #include <csignal>
 #include <dlfcn.h>
+#include <fcntl.h>
 #include <random>
 #include <sys/mman.h>
 #include <sys/wait.h>
 #include <thread>
 #include <utility>
 
-// Of one path in some thousands of millions the system makes this key, which nobody shares.
-static bool keyIsPrivate;
+// What the system makes of any path: two may have one key, and of one path in some thousands of
+// millions it makes that which nobody shares. -1: what it really makes.
+static key_t onlyKey = -1;
 
 extern "C" key_t ftok(const char* path, int project) noexcept
 {
     static const auto real = reinterpret_cast<decltype(&ftok)>(dlsym(RTLD_NEXT, "ftok"));
-    return keyIsPrivate ? IPC_PRIVATE : real(path, project);
+    return onlyKey != -1 ? onlyKey : real(path, project);
+}
+
+// The clock in seconds before the system's, and sleeps of a millisecond that take no time.
+static time_t ahead = 0;
+static unsigned int shortSleeps = 0;
+
+extern "C" time_t time(time_t* result) noexcept
+{
+    static const auto real = reinterpret_cast<time_t (*)(time_t*)>(dlsym(RTLD_NEXT, "time"));
+    const time_t now = real(nullptr) + ahead;
+    return result != nullptr ? *result = now : now;
+}
+
+extern "C" int usleep(useconds_t duration)
+{
+    static const auto real = reinterpret_cast<decltype(&usleep)>(dlsym(RTLD_NEXT, "usleep"));
+    if (duration != 1000 || shortSleeps == 0)
+        return real(duration);
+    shortSleeps--;
+    return 0;
 }
 
 class ProcessTest : public DirectoryTest
@@ -137,9 +159,9 @@ TEST_F(LockTest, KeysAreMadeOfFileAndProject)
     EXPECT_EQ(0, sqloNLCKInit(historyPath.c_str(), &lock, 0));
     EXPECT_EQ(ftok(historyPath.c_str(), 'n'), lock.key);
     EXPECT_EQ(sqloNLCKKeyFailure, sqloNLCKInit(shadowPath.c_str(), &lock, 0));
-    keyIsPrivate = true;
+    onlyKey = IPC_PRIVATE;
     EXPECT_EQ(sqloNLCKKeyFailure, sqloNLCKInit(historyPath.c_str(), &lock, 0));
-    keyIsPrivate = false;
+    onlyKey = -1;
 }
 
 TEST_F(LockTest, ForeignSetsAreLeftAlone)
@@ -156,6 +178,85 @@ TEST_F(LockTest, ForeignSetsAreLeftAlone)
     }
 }
 
+// What each call of somebody who only looks may say, and what it is taken for.
+TEST_F(LockTest, WhoLooksIsToldWhatTheSystemSays)
+{
+    const struct {
+        const char* call;
+        int command;
+        std::vector<int> errors;
+        int rc, state; // -1: the error
+    } rows[] = {{"semget", 0, {EACCES, EPERM}, 0, sqloNLCKForeign},
+                {"semget", 0, {ENOENT}, 0, sqloNLCKAbsent},
+                {"semget", 0, {EFAULT}, -1, sqloNLCKAbsent},
+                {"semctl", IPC_STAT, {EACCES}, 0, sqloNLCKForeign},
+                {"semctl", GETVAL, {EIDRM}, 0, sqloNLCKAbsent},
+                {"semctl", GETPID, {EINVAL}, 0, sqloNLCKAbsent},
+                {"semctl", IPC_STAT, {EFAULT}, -1, sqloNLCKAbsent}};
+    store(filesOf("empty"));
+    lockState();
+    SQLO_NLCK holder = lock;
+    ASSERT_EQ(0, sqloNLCKLock(&holder, 0, 0));
+    for (const auto& row : rows)
+        for (const int error : row.errors) {
+            SCOPED_TRACE(testing::Message() << row.call << " " << row.command << " " << error);
+            SQLO_NLCKSTATE state = {};
+            onCall = [&](const std::string& call, int command) {
+                return call == row.call && command == row.command ? error : 0;
+            };
+            EXPECT_EQ(row.rc == 0 ? 0 : sqloSystemError | error, sqloNLCKQuery(&lock, &state));
+            onCall = nullptr;
+            EXPECT_EQ(row.state, state.state);
+        }
+    onCall = [](const std::string&, int command) { return command == SEM_INFO ? EPERM : 0; };
+    int index = 0;
+    SQLO_NLCKSTATE state = {};
+    EXPECT_EQ(sqloSystemError | EPERM, sqloNLCKNext(&index, &lock, &state));
+    // The dead holder's set that goes by itself, or that this user may not remove.
+    ahead = 100;
+    state = lockState();
+    for (const int error : {EPERM, EIDRM}) {
+        onCall = [&](const std::string& call, int command) {
+            return call == "semctl" && command == IPC_RMID ? error : 0;
+        };
+        EXPECT_EQ(error == EIDRM ? 0 : sqloSystemError | error, sqloNLCKRemoveDead(&lock, &state));
+    }
+    // Nor does it change anything when the semaphore cannot be given back.
+    ahead = 0;
+    EXPECT_EQ(0, semctl(holder.id, 0, SETVAL, 1));
+    onCall = [](const std::string&, int command) { return command == 1 ? EINVAL : 0; };
+    EXPECT_EQ(sqloNLCKOwnerDied, sqloNLCKLock(&lock, 0, -1));
+    onCall = nullptr;
+    EXPECT_EQ(0, sqloNLCKUnlock(&holder));
+}
+
+// More locks than the table of held ones has places; a file that cannot be kept locked.
+TEST_F(LockTest, ALockIsHeldAlsoWithoutItsPlaceInTheTable)
+{
+    store(filesOf("empty"));
+    lockState();
+    std::vector<SQLO_NLCK> all(300, lock);
+    for (size_t i = 0; i < all.size(); i++) {
+        all[i].key = lock.key ^ static_cast<int32_t>(0x400000 + (i << 8));
+        ASSERT_EQ(0, sqloNLCKLock(&all[i], 0, 0));
+        sqloNLCKKeepFile(&all[i], i % 2 == 0 ? historyPath.c_str() : shadowPath.c_str());
+        EXPECT_EQ(i < 256 ? sqloNLCKDeadlock : 0, sqloNLCKCheckDeadlock(&all[i]));
+    }
+    struct flock whole = {};
+    whole.l_type = F_WRLCK;
+    for (const SQLO_NLCK& held : all)
+        EXPECT_EQ(0, sqloNLCKCheckHeld(&held));
+    for (SQLO_NLCK& held : all)
+        EXPECT_EQ(0, sqloNLCKUnlock(&held));
+    const int file = ::open(historyPath.c_str(), O_RDWR);
+    EXPECT_EQ(0, fcntl(file, F_OFD_SETLK, &whole)); // nobody keeps it
+    SQLO_NLCK holder = lock;
+    EXPECT_EQ(0, sqloNLCKLock(&holder, 0, 0));
+    sqloNLCKKeepFile(&holder, historyPath.c_str());
+    EXPECT_EQ(0, sqloNLCKUnlock(&holder));
+    EXPECT_EQ(0, ::close(file));
+}
+
 // Others wait for the ready bit, and the query tells what has happened.
 TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
 {
@@ -165,16 +266,20 @@ TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
     for (const int step : {SETVAL, -1, IPC_STAT, IPC_SET}) {
         const pid_t creator = creatorThatDiesBefore(step);
         SQLO_NLCKSTATE state = lockState();
-        // Whoever wants the lock meanwhile waits, and gets it when the set is gone.
+        // Whoever wants the lock meanwhile waits, says so once after some seconds of polls, and
+        // gets it when the set is gone.
+        shortSleeps = step == SETVAL ? 20000 : 0;
         const pid_t waiter =
             inChild([&] { return sqloNLCKLock(&lock, 0, 0) != 0 || sqloNLCKUnlock(&lock) != 0; });
+        shortSleeps = 0;
         if (step == SETVAL) {
-            // No operation yet, so no pid: only the set's age tells. The waiter tells, too, once.
+            // No operation yet, so no pid: only the set's age tells.
             EXPECT_EQ(sqloNLCKSettingUp, state.state);
             EXPECT_EQ(sqloNLCKBusy, sqloNLCKRemoveDead(&lock, &state));
-            sleep(5);
+            ahead = 10;
             state = lockState();
-            EXPECT_EQ(1u, takeLog().size());
+            for (int i = 0; i < 100000 && !std::filesystem::exists(logPath); i++)
+                usleep(100);
         }
         EXPECT_EQ(sqloNLCKSetupDied, state.state) << step;
         EXPECT_EQ(step == SETVAL ? 0 : creator, state.pid) << step;
@@ -182,7 +287,29 @@ TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
         EXPECT_EQ(0, waitpid(waiter, nullptr, WNOHANG));
         EXPECT_EQ(0, sqloNLCKRemoveDead(&lock, &state));
         EXPECT_EQ(0, waitFor(waiter));
+        EXPECT_EQ(step == SETVAL ? 1u : 0u, takeLog().size());
+        ahead = 0;
         waitFor(creator);
+    }
+}
+
+// A process that began after the set's last operation only has the number of the one that made it;
+// one that keeps the file locked lives whatever its semaphore says.
+TEST_F(LockTest, AReusedProcessNumberIsNoHolder)
+{
+    store(filesOf("empty"));
+    for (const bool keeps : {false, true}) {
+        lockState();
+        ASSERT_EQ(0, sqloNLCKLock(&lock, 0, 0));
+        if (keeps)
+            sqloNLCKKeepFile(&lock, historyPath.c_str());
+        EXPECT_EQ(sqloNLCKHeld, lockState().state);
+        ahead = 100; // so much later this process seems to have begun
+        const SQLO_NLCKSTATE state = lockState();
+        EXPECT_EQ(keeps ? sqloNLCKFaked : sqloNLCKStale, state.state);
+        EXPECT_EQ(keeps ? sqloNLCKBusy : 0, sqloNLCKRemoveDead(&lock, &state));
+        ahead = 0;
+        EXPECT_EQ(keeps ? 0 : sqloSystemError | EINVAL, sqloNLCKUnlock(&lock));
     }
 }
 
@@ -466,6 +593,12 @@ TEST_F(ProcessTest, AThreadDoesNotWaitForItself)
     SQLUH_HANDLE* handle = nullptr;
     ASSERT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
     EXPECT_EQ(sqloNLCKDeadlock, batch(1));
+    // Nor for another directory whose key is the same.
+    bool isEmpty = false;
+    spill(sourceDirectory + SQLUH_HISTORY_NAME, samples.at(1));
+    onlyKey = handle->namedLock.key;
+    EXPECT_EQ(sqloNLCKDeadlock, sqluhIsHistoryFileEmpty(sourceDirectory.data(), &isEmpty));
+    onlyKey = -1;
     int other = -1;
     std::thread waiter([&] { other = openAndClose(); });
     usleep(20000);

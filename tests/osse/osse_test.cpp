@@ -6,9 +6,11 @@
 
 #include <dlfcn.h>
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
 #include <sys/wait.h>
+#include <syslog.h>
 
 #include "sqo/sqlpd.h"
 #include "sqo/sqlzkrcb.h"
@@ -139,10 +141,10 @@ TEST_F(osse, ResizedBlockKeepsItsBytesAndGainsZeros)
     sqlofmblkEx(block);
 }
 
-// The system calls made, and the one of them to fail.
+// The system calls made, and the one of them to fail; with failure 0 it does nothing.
 static std::string calls;
 static int untilFailure = -1, failure = 0;
-static bool noDescriptor;
+static int openError = 0, closeError = 0;
 
 static bool fails(const std::string& call)
 {
@@ -157,14 +159,14 @@ static bool fails(const std::string& call)
 extern "C" ssize_t pwrite(int descriptor, const void* bytes, size_t count, off_t offset)
 {
     if (fails("write " + std::to_string(count) + " at " + std::to_string(offset)))
-        return -1;
+        return failure == 0 ? 0 : -1;
     return REAL(pwrite)(descriptor, bytes, std::min(count, size_t{2000}), offset);
 }
 
 extern "C" ssize_t pwritev2(int descriptor, const iovec* bytes, int, off_t offset, int)
 {
     if (fails("write and wait for " + std::to_string(bytes->iov_len)))
-        return -1;
+        return failure == 0 ? 0 : -1;
     return REAL(pwrite)(descriptor, bytes->iov_base, bytes->iov_len, offset);
 }
 
@@ -198,8 +200,15 @@ extern "C" int open(const char* path, int flags, ...)
     va_start(rest, flags);
     const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
     va_end(rest);
-    errno = EMFILE;
-    return noDescriptor ? -1 : REAL(open)(path, flags, mode);
+    errno = openError;
+    return openError != 0 ? -1 : REAL(open)(path, flags, mode);
+}
+
+extern "C" int close(int descriptor)
+{
+    const int closed = reinterpret_cast<decltype(&close)>(dlsym(RTLD_NEXT, "close"))(descriptor);
+    errno = closeError;
+    return closeError != 0 ? -1 : closed;
 }
 
 struct copyRow {
@@ -218,7 +227,14 @@ static const std::vector<copyRow> copyRows = {
     {2000, 2000, 2, EOPNOTSUPP, 0, empty + "2000; truncate; write 1992 at 8; " + end},
     {2000, 5000, 3, EIO, failed | EIO, empty + "2000; truncate; "},
     {2000, 2000, 4, EINTR, 0, empty + "2000; truncate; write 1992 at 8; write 1992 at 8; " + end},
+    {2000, 2000, 6, EINTR, 0,
+     empty +
+         "2000; truncate; write 1992 at 8; sync all; write and wait for 8; write and wait for 8; "},
+    {2000, 2000, 2, EINTR, 0, empty + "2000; reserve 2000; truncate; write 1992 at 8; " + end},
     {2000, 0, 4, ENOSPC, DISK_FULL, empty + "2000; truncate; write 1992 at 8; truncate; "},
+    {2000, 0, 4, EDQUOT, DISK_FULL, empty + "2000; truncate; write 1992 at 8; truncate; "},
+    {2000, 0, 4, 0, failed | EIO, empty + "2000; truncate; write 1992 at 8; truncate; "},
+    {2000, 0, 6, 0, failed | EIO, empty + "2000; truncate; write 1992 at 8; " + end + "truncate; "},
     {2000, 0, 5, EIO, failed | EIO,
      empty + "2000; truncate; write 1992 at 8; sync all; truncate; "},
     {2000, 0, 6, EIO, failed | EIO,
@@ -243,6 +259,15 @@ TEST_F(osse, CopyWritesTheFirstBytesLastAndAFailedOneLeavesNone)
         EXPECT_EQ(slurp(file) == pattern(row.size, 1), row.rc == 0);
         EXPECT_TRUE(slurp(link) == slurp(file)) << "the target's inode has changed";
         EXPECT_EQ(sqlocopy(link.c_str(), file.c_str(), 0), failed | EINVAL);
+        EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 1), failed | EINVAL);
+    }
+    for (const int error : {EIO, EINTR, ENOSPC}) {
+        closeError = error;
+        EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), error == EIO     ? failed | EIO
+                                                             : error == EINTR ? 0
+                                                                              : int{DISK_FULL});
+        closeError = 0;
+        EXPECT_TRUE(slurp(file) == slurp(source));
     }
 }
 
@@ -271,6 +296,15 @@ TEST_F(osse, AMarkedFileIsRefusedUntilItIsWhole)
         EXPECT_EQ(sqlomark(fh), failed | EBADF);
         EXPECT_EQ(sqlounmark(fh), failed | EBADF);
     }
+    // Nor is one that is made anew marked any more, or one that was refused while it was.
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x4C, 0640, &fh) + sqlomark(fh) + sqloclose(fh), 0);
+    openError = EACCES;
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh), failed | EACCES);
+    openError = 0;
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh), sqloFileIncomplete);
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x5A, 0640, &fh) + sqloclose(fh), 0);
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh) + sqloclose(fh), 0);
+    EXPECT_EQ(slurp(file), "");
 }
 
 // What cannot be opened may be sound: it is neither moved nor, because of that, emptied.
@@ -278,9 +312,9 @@ TEST_F(osse, AFileThatCannotBeOpenedIsNotMovedNorEmptied)
 {
     spill(file, "sound");
     spill(source, "new");
-    noDescriptor = true;
+    openError = EMFILE;
     EXPECT_EQ(sqlomove(file.c_str(), (file + ".a").c_str()), failed | EMFILE);
-    noDescriptor = false;
+    openError = 0;
     EXPECT_EQ(sqloopenp(file.c_str(), 0x5A, 0640, &fh), failed | EMFILE);
     EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), failed | EMFILE);
     EXPECT_EQ(slurp(file), "sound");
@@ -304,6 +338,75 @@ TEST_F(osse, MoveKeepsAnOccupiedTargetUnderANumber)
     EXPECT_EQ(sqlomove(file.c_str(), file.c_str()), failed | EINVAL);
     EXPECT_EQ(slurp(file) + slurp(file + ".1") + slurp(file + ".2"), "threeonetwo");
     EXPECT_FALSE(ossPathExists((file + ".3").c_str()));
+    // A name too long for a number stays; a directory is moved, and a file into it.
+    const std::string longName = directory + std::string(254, 'n'), folder = directory + "folder";
+    spill(longName, "kept");
+    EXPECT_EQ(sqlomove(file.c_str(), longName.c_str()), failed | ENAMETOOLONG);
+    EXPECT_EQ(slurp(longName) + slurp(file), "keptthree");
+    EXPECT_EQ(sqlomove(file.c_str(), source.c_str()), failed | ENAMETOOLONG);
+    EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh) + sqloclose(fh), 0);
+    std::filesystem::create_directory(source);
+    EXPECT_EQ(sqlomove(source.c_str(), folder.c_str()), 0);
+    EXPECT_EQ(sqlomove(file.c_str(), (folder + "/file").c_str()), 0);
+    EXPECT_EQ(slurp(folder + "/file"), "three");
+    EXPECT_EQ(sqlodelete((folder + "/file").c_str(), 1), failed | EINVAL);
+    EXPECT_EQ(sqlodelete((folder + "/file").c_str(), 0), 0);
+    EXPECT_EQ(sqlodelete((folder + "/file").c_str(), 0), failed | ENOENT);
+}
+
+// In processes of their own, whose limits they reach.
+TEST_F(osse, LimitsOfTheProcessAreTold)
+{
+    spill(file, "sound");
+    const auto inChild = [](auto run) {
+        const pid_t child = fork();
+        int status = 0;
+        if (child == 0)
+            _exit(run() ? 0 : 1);
+        waitpid(child, &status, 0);
+        return status;
+    };
+    // Without the three standard files nothing that is opened takes their numbers.
+    EXPECT_EQ(0, inChild([&] {
+                  close(0);
+                  close(2);
+                  return sqloopenp(file.c_str(), 0x14, 0640, &fh) == 0 && fh.descriptor > 2;
+              }));
+    EXPECT_EQ(0, inChild([&] {
+                  int rc = 0, opened = 0;
+                  while (rc == 0 && opened++ < 5000)
+                      rc = sqloopenp(file.c_str(), 0x14, 0640, &fh);
+                  return rc == (failed | EMFILE);
+              }));
+#ifndef __SANITIZE_ADDRESS__
+    // What may only not have been looked at for want of memory stays where it is.
+    EXPECT_EQ(0, inChild([&] {
+                  const rlimit none = {0, RLIM_INFINITY};
+                  const std::string target = file + ".a";
+                  void* volatile block = &fh;
+                  setrlimit(RLIMIT_AS, &none);
+                  while (block != nullptr)
+                      block = malloc(4096);
+                  return sqlomove(file.c_str(), target.c_str()) == (failed | ENOMEM) &&
+                         sqlocopy(file.c_str(), target.c_str(), 0) == (failed | ENOMEM);
+              }));
+#endif
+    EXPECT_EQ(slurp(file), "sound");
+}
+
+TEST_F(osse, SmallCallsRefuseWhatTheyDoNotKnow)
+{
+    ossFileInfo info = {};
+    spill(file, "12345");
+    for (const uint32_t version : {uint32_t{ossFileVersion}, 0u})
+        for (const uint32_t level : {1u, 2u}) {
+            const ossFileRequest request = {version, file.c_str(), 0, 0, level};
+            EXPECT_EQ(ossFileGetInfoV9(&request, &info),
+                      version != 0 && level == 1 ? 0 : failed | EINVAL);
+        }
+    EXPECT_EQ(info.size, 5u);
+    EXPECT_EQ(sqlzGetZRCInfo(0), failed | EIO);
+    EXPECT_EQ(sqlzGetZRCInfo(DISK_FULL), int{DISK_FULL});
 }
 
 // Takes the time and the process, which change, out of every record.
@@ -352,6 +455,34 @@ TEST_F(osse, RecordsOfSeveralProcessesNeverMix)
     EXPECT_TRUE(stable(directory + "log") == expected);
 }
 
+// Where the file cannot be written the system log takes the record; what does not fit is cut.
+static std::string sysLog;
+
+extern "C" void syslog(int priority, const char* format, ...)
+{
+    va_list rest;
+    va_start(rest, format);
+    sysLog += std::to_string(priority & LOG_PRIMASK) + va_arg(rest, const char*);
+    va_end(rest);
+}
+
+TEST_F(osse, WhatCannotBeLoggedInTheFileGoesToTheSystemLog)
+{
+    const std::string text(70000, 'x');
+    const pdItem item = {pdKindText, text.c_str(), 0, nullptr, 0};
+    for (const std::string& path : {std::string(), directory}) {
+        setenv("ZQ3DIAGLOG", path.c_str(), 1);
+        sysLog.clear();
+        pdLog(nullptr, pdLevelWarning, &item, 1);
+        EXPECT_EQ(sysLog.substr(0, 1), std::to_string(LOG_WARNING));
+        EXPECT_TRUE(sysLog.ends_with("xxx ... (cut)\n"));
+        EXPECT_NE(sysLog.find(" level=Warning function=: xxx"), std::string::npos);
+    }
+    sysLog.clear();
+    sqlt_logadmin("f", 8499);
+    EXPECT_TRUE(sysLog.ends_with("function=f: Administration message 8499\n"));
+}
+
 // Both are read when the library is loaded: the test runs itself once more with them set.
 TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
 {
@@ -361,6 +492,9 @@ TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
         sqltData("f", "checksum", "\xEF\xBE\xAD\x42", 4);
         sqltData("f", "bytes", std::string(200, '\xA9').data(), 200);
         sqltData("f", "removed", nullptr, 0);
+        void* block = nullptr;
+        sqlogmblkEx(nullptr, SIZE_MAX, 0, &block, "here.cpp", 7, 0);
+        pdtExit1(1, "\1", 1, "f");
         pdtExit(-2161, "f");
         std::filesystem::remove_all(directory); // _exit runs no destructor
         _exit(sqltGetCompTraceFlag() != 0 ? sqlz_krcbp->nodeNumber : 99);
@@ -378,5 +512,7 @@ TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
                                                "* f checksum 0x42ADBEEF\n* f bytes " +
                                                digits +
                                                " (128 of 200 bytes shown)\n* f removed\n"
+                                               "* memory refused \"18446744073709551615 bytes for "
+                                               "here.cpp:7\"\n* f exit 1 (0x00000001) 0x01\n"
                                                "* f exit -2161 (0xFFFFF78F)\n");
 }
