@@ -56,12 +56,12 @@ int sqluhClose(SQLUH_HANDLE** handle)
     int rc = 0;
     if (*handle != nullptr) {
         // An image that could not be put in force, or is another process's file by now, is not
-        // copied: no file has the empty name, and the shadow stays what it is.
+        // copied: the shadow stays what it is.
         rc = sqluhCommitRestore(*handle);
-        const char* image = rc == 0 ? (*handle)->historyPath : "";
+        bool isInForce = rc == 0;
         rc = firstOf(rc, closeFile(*handle, __func__));
-        if ((*handle)->restoredFromImage)
-            rc = firstOf(rc, logged(sqlocopy(image, (*handle)->shadowPath, 0)));
+        if ((*handle)->restoredFromImage && isInForce)
+            rc = firstOf(rc, logged(sqlocopy((*handle)->historyPath, (*handle)->shadowPath, 0)));
         (*handle)->restoredFromImage = false;
         rc = firstOf(rc, logged(sqluhUnlock(*handle)));
         sqluhHandleFree(handle);

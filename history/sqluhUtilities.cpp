@@ -165,12 +165,8 @@ int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsign
         rc = replaceHistoryFile(handle, __func__);
     if (rc == 0)
         rc = sqlochgfileptr(handle->fileHandle, offset, sqloFromStart, nullptr);
-    if (rc == 0) {
+    if (rc == 0)
         rc = sqlowrite(handle->fileHandle, buffer, length, &written);
-        if (rc == 0 && written != length)
-            rc = transferCode(rc);
-    }
-
     handle->restoreCode = firstOf(handle->restoreCode, rc);
 
     pdtExit(logged(rc));

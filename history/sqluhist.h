@@ -632,7 +632,7 @@ int sqluh_fill_backup_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned
 // every piece written, puts it in force and copies it over the shadow. Until then, and after any
 // failure, the old history is in force. An image whose own header says 'P' is safe only when the
 // close has returned. Returns 0; the code of the failing close, delete, open, mark, seek or write,
-// unmapped; a short write's transfer code; a lock code, of the new file's lock.
+// unmapped; a lock code, of the new file's lock.
 int sqluh_write_restore_buffer(SQLUH_HANDLE* handle, unsigned int offset, unsigned char* buffer,
                                unsigned int length);
 

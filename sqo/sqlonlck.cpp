@@ -323,8 +323,15 @@ int sqloNLCKUnlock(SQLO_NLCK* lock)
 {
     pdtEntry();
 
-    int rc = semctl(lock->id, 0, IPC_RMID, 0) == -1 ? systemError("semctl") : 0;
-    forgetHeld(lock);
+    int rc = 0;
+    bool isRemoved = true;
+    if (semctl(lock->id, 0, IPC_RMID, 0) == -1) {
+        isRemoved = errno == EINVAL || errno == EIDRM;
+        rc = systemError("semctl");
+    }
+    // What could not be removed is still held, and this thread must not wait for it.
+    if (isRemoved)
+        forgetHeld(lock);
 
     pdtExit(rc);
     return rc;

@@ -27,6 +27,76 @@ static std::string pattern(size_t length, unsigned int seed)
     return bytes;
 }
 
+// The system calls made, and the one of them to fail; with failure 0 it does nothing.
+static std::string calls;
+static int untilFailure = -1, failure = 0;
+static int openError = 0, closeError = 0;
+
+static bool fails(const std::string& call)
+{
+    calls += call + "; ";
+    errno = failure;
+    return untilFailure-- == 0;
+}
+
+#define REAL(name) reinterpret_cast<decltype(&name)>(dlsym(RTLD_NEXT, #name "64"))
+
+// Writes come out short, so that whoever calls must finish them.
+extern "C" ssize_t pwrite(int descriptor, const void* bytes, size_t count, off_t offset)
+{
+    if (fails("write " + std::to_string(count) + " at " + std::to_string(offset)))
+        return failure == 0 ? 0 : -1;
+    return REAL(pwrite)(descriptor, bytes, std::min(count, size_t{2000}), offset);
+}
+
+extern "C" ssize_t pwritev2(int descriptor, const iovec* bytes, int, off_t offset, int)
+{
+    if (fails("write and wait for " + std::to_string(bytes->iov_len)))
+        return failure == 0 ? 0 : -1;
+    return REAL(pwrite)(descriptor, bytes->iov_base, bytes->iov_len, offset);
+}
+
+extern "C" int ftruncate(int descriptor, off_t length) noexcept
+{
+    return fails("truncate") ? -1 : REAL(ftruncate)(descriptor, length);
+}
+
+extern "C" int fallocate(int descriptor, int mode, off_t offset, off_t length)
+{
+    if (fails("reserve " + std::to_string(length)))
+        return -1;
+    return REAL(fallocate)(descriptor, mode, offset, length);
+}
+
+extern "C" int fdatasync(int)
+{
+    return fails("sync") ? -1 : 0;
+}
+
+extern "C" int fsync(int descriptor)
+{
+    struct stat status;
+    fstat(descriptor, &status);
+    return fails(S_ISDIR(status.st_mode) ? "sync directory" : "sync all") ? -1 : 0;
+}
+
+extern "C" int open(const char* path, int flags, ...)
+{
+    va_list rest;
+    va_start(rest, flags);
+    const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
+    va_end(rest);
+    errno = openError;
+    return openError != 0 ? -1 : REAL(open)(path, flags, mode);
+}
+
+extern "C" int close(int descriptor)
+{
+    const int closed = reinterpret_cast<decltype(&close)>(dlsym(RTLD_NEXT, "close"))(descriptor);
+    errno = closeError;
+    return closeError != 0 ? -1 : closed;
+}
+
 struct osse : testing::Test {
     std::string name = std::filesystem::temp_directory_path() / "osseXXXXXX";
     const std::string directory = std::string(mkdtemp(name.data())) + "/";
@@ -61,7 +131,9 @@ TEST_F(osse, OpenWordsCreateTruncateAndRefuse)
     for (const auto& row : rows) {
         SCOPED_TRACE(row.word);
         std::filesystem::remove(file);
+        calls.clear();
         EXPECT_EQ(sqloopenp(file.c_str(), row.word, 0640, &fh), row.onMissing);
+        EXPECT_EQ(calls.ends_with("sync directory; "), row.onMissing == 0);
         EXPECT_EQ(sqloclose(fh), row.onMissing == 0 ? 0 : failed | EBADF);
         spill(file, "old");
         EXPECT_EQ(sqloopenp(file.c_str(), row.word, 0640, &fh), 0);
@@ -139,76 +211,6 @@ TEST_F(osse, ResizedBlockKeepsItsBytesAndGainsZeros)
     EXPECT_EQ(sqloMemBlockReallocate(&block, SIZE_MAX, 0, "test", 1), failed | ENOMEM);
     EXPECT_EQ(memcmp(block, model.data(), model.size()), 0);
     sqlofmblkEx(block);
-}
-
-// The system calls made, and the one of them to fail; with failure 0 it does nothing.
-static std::string calls;
-static int untilFailure = -1, failure = 0;
-static int openError = 0, closeError = 0;
-
-static bool fails(const std::string& call)
-{
-    calls += call + "; ";
-    errno = failure;
-    return untilFailure-- == 0;
-}
-
-#define REAL(name) reinterpret_cast<decltype(&name)>(dlsym(RTLD_NEXT, #name "64"))
-
-// Writes come out short, so that whoever calls must finish them.
-extern "C" ssize_t pwrite(int descriptor, const void* bytes, size_t count, off_t offset)
-{
-    if (fails("write " + std::to_string(count) + " at " + std::to_string(offset)))
-        return failure == 0 ? 0 : -1;
-    return REAL(pwrite)(descriptor, bytes, std::min(count, size_t{2000}), offset);
-}
-
-extern "C" ssize_t pwritev2(int descriptor, const iovec* bytes, int, off_t offset, int)
-{
-    if (fails("write and wait for " + std::to_string(bytes->iov_len)))
-        return failure == 0 ? 0 : -1;
-    return REAL(pwrite)(descriptor, bytes->iov_base, bytes->iov_len, offset);
-}
-
-extern "C" int ftruncate(int descriptor, off_t length) noexcept
-{
-    return fails("truncate") ? -1 : REAL(ftruncate)(descriptor, length);
-}
-
-extern "C" int fallocate(int descriptor, int mode, off_t offset, off_t length)
-{
-    if (fails("reserve " + std::to_string(length)))
-        return -1;
-    return REAL(fallocate)(descriptor, mode, offset, length);
-}
-
-extern "C" int fdatasync(int)
-{
-    return fails("sync") ? -1 : 0;
-}
-
-extern "C" int fsync(int descriptor)
-{
-    struct stat status;
-    fstat(descriptor, &status);
-    return fails(S_ISDIR(status.st_mode) ? "sync directory" : "sync all") ? -1 : 0;
-}
-
-extern "C" int open(const char* path, int flags, ...)
-{
-    va_list rest;
-    va_start(rest, flags);
-    const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
-    va_end(rest);
-    errno = openError;
-    return openError != 0 ? -1 : REAL(open)(path, flags, mode);
-}
-
-extern "C" int close(int descriptor)
-{
-    const int closed = reinterpret_cast<decltype(&close)>(dlsym(RTLD_NEXT, "close"))(descriptor);
-    errno = closeError;
-    return closeError != 0 ? -1 : closed;
 }
 
 struct copyRow {
@@ -332,7 +334,9 @@ TEST_F(osse, MoveKeepsAnOccupiedTargetUnderANumber)
     spill(file, "");
     for (const char* bytes : {"one", "two", "three"}) {
         spill(source, bytes);
+        calls.clear();
         EXPECT_EQ(sqlomove(source.c_str(), file.c_str()), 0);
+        EXPECT_EQ(calls, "sync directory; ");
     }
     EXPECT_EQ(sqlomove(source.c_str(), file.c_str()), failed | ENOENT);
     EXPECT_EQ(sqlomove(file.c_str(), file.c_str()), failed | EINVAL);
@@ -347,10 +351,12 @@ TEST_F(osse, MoveKeepsAnOccupiedTargetUnderANumber)
     EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh) + sqloclose(fh), 0);
     std::filesystem::create_directory(source);
     EXPECT_EQ(sqlomove(source.c_str(), folder.c_str()), 0);
+    calls.clear();
     EXPECT_EQ(sqlomove(file.c_str(), (folder + "/file").c_str()), 0);
     EXPECT_EQ(slurp(folder + "/file"), "three");
     EXPECT_EQ(sqlodelete((folder + "/file").c_str(), 1), failed | EINVAL);
     EXPECT_EQ(sqlodelete((folder + "/file").c_str(), 0), 0);
+    EXPECT_EQ(calls, "sync directory; sync directory; sync directory; ");
     EXPECT_EQ(sqlodelete((folder + "/file").c_str(), 0), failed | ENOENT);
 }
 
