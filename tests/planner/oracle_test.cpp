@@ -294,3 +294,25 @@ TEST(Oracle, StagesAgreeWithTheSlowPlanner)
     EXPECT_LT(lists, differentLists * 101 / 100);  // two lists with one place among the recent ones
     EXPECT_GT(std::min(plans, 3000 - plans), 500); // the histories reach both outcomes
 }
+
+TEST(List, KeepsEachNameOnceAndFindsItByAllItsBytes)
+{
+    char names[][nameSize] = {"A", "TABLESPACE1NAME18X", "A", "TABLESPACE1NAME18Y"};
+    historyEntry entry = {};
+    entry.tablespaceNames = names;
+    entry.numTablespaces = 4;
+    tablespaceInfo* list = nullptr;
+    ASSERT_EQ(0, increaseTablespaceList(0, 4, &list));
+    int count = 0, place = 0;
+    addTablespacesFromHistEntryToList(list, &entry, &count);
+    EXPECT_EQ(3, count);
+    char last[] = "TABLESPACE1NAME18Y", other[] = "a";
+    EXPECT_TRUE(isTablespaceInList(list, last, 3, &place));
+    EXPECT_EQ(2, place);
+    EXPECT_FALSE(isTablespaceInList(list, last, 2, &place));
+    EXPECT_EQ(-1, place);
+    EXPECT_TRUE(isTablespaceInHistoryEntry(&entry, last, &place));
+    EXPECT_EQ(3, place);
+    EXPECT_FALSE(isTablespaceInHistoryEntry(&entry, other, nullptr));
+    free(list);
+}
