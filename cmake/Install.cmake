@@ -1,5 +1,5 @@
-# Installation and packages: programs, the two shared libraries, the history library with its
-# headers, and what a program that links it needs (pkg-config file, CMake package).
+# Installation: programs, the two shared libraries, the history library with its headers, and what a
+# program that links them needs (pkg-config files, CMake package).
 
 include(CMakePackageConfigHelpers)
 
@@ -25,45 +25,32 @@ install(TARGETS sqluhist zq3 zq3osse EXPORT sqluhistTargets)
 # The #include lines of the headers hold in the installed layout, too.
 install(FILES include/zq3.h DESTINATION ${headerDir})
 install(FILES history/sqluhist.h DESTINATION ${headerDir}/history)
-install(FILES sqo/sqlca.h sqo/sqlo.h sqo/sqlonlck.h sqo/sqlpd.h sqo/sqlzkrcb.h DESTINATION ${headerDir}/sqo)
+install(FILES sqo/sqlca.h sqo/sqlo.h sqo/sqlonlck.h sqo/sqlpd.h sqo/sqlzkrcb.h
+        DESTINATION ${headerDir}/sqo)
 
 install(EXPORT sqluhistTargets NAMESPACE zq3:: DESTINATION ${packageDir})
 file(WRITE ${PROJECT_BINARY_DIR}/sqluhistConfig.cmake
   "include(\"\${CMAKE_CURRENT_LIST_DIR}/sqluhistTargets.cmake\")\n")
 write_basic_package_version_file(${PROJECT_BINARY_DIR}/sqluhistConfigVersion.cmake
   COMPATIBILITY SameMajorVersion)
-file(RELATIVE_PATH prefixFromPkgconfig /${pkgconfigDir} /)
-configure_file(cmake/libsqluhist.pc.in libsqluhist.pc @ONLY)
 install(FILES ${PROJECT_BINARY_DIR}/sqluhistConfig.cmake
               ${PROJECT_BINARY_DIR}/sqluhistConfigVersion.cmake DESTINATION ${packageDir})
-install(FILES ${PROJECT_BINARY_DIR}/libsqluhist.pc DESTINATION ${pkgconfigDir})
+
+file(RELATIVE_PATH prefixFromPkgconfig /${pkgconfigDir} /)
+function(zq3_pkgconfig pcName pcLibs pcDescription)
+  configure_file(cmake/library.pc.in ${PROJECT_BINARY_DIR}/${pcName}.pc @ONLY)
+  install(FILES ${PROJECT_BINARY_DIR}/${pcName}.pc DESTINATION ${pkgconfigDir})
+endfunction()
+zq3_pkgconfig(libsqluhist "-lsqluhist -lzq3osse"
+  "Recovery-history files of a database: reading, writing, recovery")
+zq3_pkgconfig(zq3 "-lzq3" "Scans of a database's recovery history")
 
 install(FILES man/zq3ckrst.1 man/zq3hist.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
 install(FILES man/zq3rhist.5 man/zq3hist-json.5 DESTINATION ${CMAKE_INSTALL_MANDIR}/man5)
-install(FILES README.md CONTRIBUTING.md DESTINATION ${CMAKE_INSTALL_DOCDIR})
-install(DIRECTORY docs examples DESTINATION ${CMAKE_INSTALL_DOCDIR})
+install(FILES docs/installed.md DESTINATION ${CMAKE_INSTALL_DOCDIR} RENAME README.md)
+install(FILES docs/troubleshooting.md docs/chart.svg DESTINATION ${CMAKE_INSTALL_DOCDIR})
+install(DIRECTORY examples DESTINATION ${CMAKE_INSTALL_DOCDIR})
 foreach(program zq3ckrst zq3hist)
   install(FILES completion/${program}.bash
           DESTINATION ${CMAKE_INSTALL_DATADIR}/bash-completion/completions RENAME ${program})
 endforeach()
-
-# cpack -G DEB. Configured with -DCMAKE_INSTALL_PREFIX=/usr, the libraries go to Debian's own
-# library directory of the machine.
-set(CPACK_PACKAGE_CONTACT "zq3ckrst maintainers <root@localhost>")
-set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
-set(CPACK_STRIP_FILES ON)
-set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
-set(CPACK_DEBIAN_PACKAGE_SECTION database)
-set(CPACK_DEBIAN_PACKAGE_DESCRIPTION
-  "zq3ckrst plans the restore of a database from its chain of backup images.
-zq3hist makes, shows, checks and repairs recovery histories. The history
-library and what is needed to link it are included.")
-set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
-find_program(ZQ3_SHLIBDEPS dpkg-shlibdeps)
-mark_as_advanced(ZQ3_SHLIBDEPS)
-if(ZQ3_SHLIBDEPS)
-  set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
-else()
-  set(CPACK_DEBIAN_PACKAGE_DEPENDS "libc6, libstdc++6")
-endif()
-include(CPack)

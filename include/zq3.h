@@ -135,10 +135,13 @@ extern "C" {
 
 // Opens a scan of one database's recovery history and fills numRows, maxTablespaces and handle.
 //
-// openStruct: a zq3HistoryOpenStruct. SQLCODEs: 0; 2160 both files of the history were unusable and
-// an empty one was made; or, with no scan open and *openStruct as it was, -2036 the alias is no
-// plain name or has no history, -2043 too many scans are open, -2044 no memory, or another negative
-// code of opening or copying the history.
+// The history is only read: no lock is left, nothing is repaired, a writer is not waited for.
+//
+// openStruct: a zq3HistoryOpenStruct. SQLCODEs: 0; 2162 the history file could not be used and its
+// shadow was read; 2163 one of the two has a damaged entry and the other one was read; or, with no
+// scan open and *openStruct as it was, -2036 the alias is no plain name or has no history, -2161
+// neither file can be used, -2043 too many scans are open, -2044 no memory, or another negative
+// code of reading the history.
 int zq3HistoryOpenScan(unsigned int version, void* openStruct, sqlca* ca);
 
 // Delivers the next entry of an open scan into the record.
@@ -149,8 +152,7 @@ int zq3HistoryOpenScan(unsigned int version, void* openStruct, sqlca* ca);
 // after a failure every further get fails with its code.
 int zq3HistoryGetEntry(unsigned int version, void* fetchStruct, sqlca* ca);
 
-// Ends a scan. handle: points at the 16-bit handle. SQLCODEs: 0, or the negative code of a failed
-// close; the scan has ended all the same.
+// Ends a scan. handle: points at the 16-bit handle. SQLCODE: 0.
 int zq3HistoryCloseScan(unsigned int version, void* handle, sqlca* ca);
 
 #ifdef __cplusplus

@@ -7,7 +7,12 @@ need g++ cmake ninja-build
 
 echo "Building the product in build/demo ..."
 cmake --preset release -B build/demo -DZQ3_TESTS=OFF -DZQ3_BENCH=OFF >/dev/null
-cmake --build build/demo >/dev/null
+# One line that counts on a terminal; elsewhere a line in ten.
+if [ -t 1 ]; then
+  cmake --build build/demo
+else
+  cmake --build build/demo | awk '!/^\[[0-9]+\// || $1 ~ /^.[0-9]*0\// { print; fflush() }'
+fi
 
 scratch=$(mktemp -d)
 trap 'rm -rf "$scratch"' EXIT
