@@ -64,13 +64,12 @@ static int systemError(const char* systemCall)
 
 struct heldLock {
     SQLO_NLCK lock;
-    pid_t thread; // that took it; 0: the slot is free
-    int file;     // descriptor that keeps the file locked; -1: none
+    pthread_t thread; // that took it; 0: the slot is free
+    int file;         // descriptor that keeps the file locked; -1: none
 };
 
 // A lock that finds no slot is held all the same, only without what the table is for.
-static heldLock heldLocks[256];
-static unsigned int numHeld;
+static heldLock heldLocks[64];
 static pthread_mutex_t heldLocksMutex = PTHREAD_MUTEX_INITIALIZER;
 
 static void beforeFork()
@@ -91,7 +90,6 @@ static void afterForkInChild()
             close(held.file);
         held.thread = 0;
     }
-    numHeld = 0;
     pthread_mutex_unlock(&heldLocksMutex);
 }
 
@@ -113,10 +111,8 @@ static void enterHeld(const SQLO_NLCK* lock)
 {
     pthread_mutex_lock(&heldLocksMutex);
     heldLock* held = findHeld(nullptr);
-    if (held != nullptr) {
-        *held = {*lock, gettid(), -1};
-        numHeld++;
-    }
+    if (held != nullptr)
+        *held = {*lock, pthread_self(), -1};
     pthread_mutex_unlock(&heldLocksMutex);
 }
 
@@ -126,10 +122,8 @@ static void forgetHeld(const SQLO_NLCK* lock)
     heldLock* held = findHeld(lock);
     if (held != nullptr && held->file != -1)
         close(held->file);
-    if (held != nullptr) {
+    if (held != nullptr)
         held->thread = 0;
-        numHeld--;
-    }
     pthread_mutex_unlock(&heldLocksMutex);
 }
 
@@ -352,7 +346,7 @@ int sqloNLCKCheckDeadlock(const SQLO_NLCK* lock)
 
     int rc = 0;
     pthread_mutex_lock(&heldLocksMutex);
-    const pid_t me = numHeld == 0 ? -1 : gettid();
+    const pthread_t me = pthread_self();
     for (const heldLock& held : heldLocks)
         if (held.thread == me && held.lock.key == lock->key && sqloNLCKCheckHeld(&held.lock) == 0)
             rc = sqloNLCKDeadlock;

@@ -235,7 +235,7 @@ TEST_F(LockTest, ALockIsHeldAlsoWithoutItsPlaceInTheTable)
 {
     store(filesOf("empty"));
     lockState();
-    std::vector<SQLO_NLCK> all(300, lock);
+    std::vector<SQLO_NLCK> all(100, lock);
     size_t told = 0;
     for (size_t i = 0; i < all.size(); i++) {
         all[i].key = lock.key ^ static_cast<int32_t>(0x400000 + (i << 8));
@@ -243,7 +243,7 @@ TEST_F(LockTest, ALockIsHeldAlsoWithoutItsPlaceInTheTable)
         sqloNLCKKeepFile(&all[i], i % 2 == 0 ? historyPath.c_str() : shadowPath.c_str());
         told += sqloNLCKCheckDeadlock(&all[i]) == sqloNLCKDeadlock;
     }
-    EXPECT_TRUE(told > 200 && told < all.size()) << told;
+    EXPECT_TRUE(told != 0 && told < all.size()) << told;
     struct flock whole = {};
     whole.l_type = F_WRLCK;
     for (const SQLO_NLCK& held : all)

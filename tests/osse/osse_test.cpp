@@ -30,7 +30,7 @@ static std::string pattern(size_t length, unsigned int seed)
 // The system calls made, and the one of them to fail; with failure 0 it does nothing.
 static std::string calls;
 static int untilFailure = -1, failure = 0;
-static int openError = 0, closeError = 0;
+static int openError = 0, closeError = 0, untilReadError = -1;
 
 static bool fails(const std::string& call)
 {
@@ -47,6 +47,12 @@ extern "C" ssize_t pwrite(int descriptor, const void* bytes, size_t count, off_t
     if (fails("write " + std::to_string(count) + " at " + std::to_string(offset)))
         return failure == 0 ? 0 : -1;
     return REAL(pwrite)(descriptor, bytes, std::min(count, size_t{2000}), offset);
+}
+
+extern "C" ssize_t pread(int descriptor, void* bytes, size_t count, off_t offset)
+{
+    errno = EIO;
+    return untilReadError-- == 0 ? -1 : REAL(pread)(descriptor, bytes, count, offset);
 }
 
 extern "C" ssize_t pwritev2(int descriptor, const iovec* bytes, int, off_t offset, int)
@@ -263,6 +269,14 @@ TEST_F(osse, CopyWritesTheFirstBytesLastAndAFailedOneLeavesNone)
         EXPECT_EQ(sqlocopy(link.c_str(), file.c_str(), 0), failed | EINVAL);
         EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 1), failed | EINVAL);
     }
+    // Nor does a source that cannot be read to its end cost the target anything.
+    spill(source, pattern(600000, 3));
+    spill(file, "kept");
+    for (int read = 0; read < 3; read++) {
+        untilReadError = read;
+        EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), failed | EIO);
+        EXPECT_EQ(slurp(file), "kept");
+    }
     for (const int error : {EIO, EINTR, ENOSPC}) {
         closeError = error;
         EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), error == EIO     ? failed | EIO
@@ -304,7 +318,9 @@ TEST_F(osse, AMarkedFileIsRefusedUntilItIsWhole)
     EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh), failed | EACCES);
     openError = 0;
     EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh), sqloFileIncomplete);
+    calls.clear();
     EXPECT_EQ(sqloopenp(file.c_str(), 0x5A, 0640, &fh) + sqloclose(fh), 0);
+    EXPECT_EQ(calls, "truncate; sync all; sync directory; ");
     EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh) + sqloclose(fh), 0);
     EXPECT_EQ(slurp(file), "");
 }
