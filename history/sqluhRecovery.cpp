@@ -241,7 +241,7 @@ int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
         // made the pair; while the old file is in its place its lock keeps everybody out.
         bool made = false;
         int unseen = 0;
-        if (moved == 0 && handle->isLocked) {
+        if (moved == 0) {
             rc = logged(sqluhFollowLock(handle, __func__));
             made = rc == 0 && examineFile(handle, handle->historyPath, &unseen).usable;
         }

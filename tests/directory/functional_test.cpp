@@ -83,6 +83,40 @@ TEST_F(FunctionalTest, CloseGoesOnPastFailuresAndReturnsTheFirst)
     }
 }
 
+TEST_F(FunctionalTest, WhatCannotBeMovedAsideIsNotReplaced)
+{
+    SQLUH_HANDLE* handle = nullptr;
+    store(filesOf(" 10/ 10"));
+    EXPECT_EQ(0, sqluhHandleAllocAndInit(directory.data(), &handle) + sqluhLock(handle));
+    onSystemCall = [](const std::string& call) { return call == "rename" ? EACCES : 0; };
+    EXPECT_EQ(sqloSystemError | EACCES, sqluhRecoverFromFatalError(handle));
+    onSystemCall = nullptr;
+    EXPECT_TRUE(load() == filesOf(" 10/ 10"));
+    EXPECT_EQ(0, sqluhUnlock(handle) + openAndClose());
+    EXPECT_EQ(0, sqluhRecoverFromFatalError(handle)); // also without the lock
+    EXPECT_TRUE(load() == filesOf(" 0/ 0/ 10/ 10"));
+    sqluhHandleFree(&handle);
+}
+
+TEST_F(FunctionalTest, PathsThatDoNotFitAreRefused)
+{
+    std::string longest(maxDirectoryLength - 1, 'd'), tooLong = longest + "d/", none = "d";
+    SQLUH_HANDLE* handle = nullptr;
+    bool isEmpty = true;
+    longest += '/';
+    store(filesOf(" 10/ 10"));
+    EXPECT_EQ(0, sqluhHandleAllocAndInit(longest.data(), &handle));
+    EXPECT_EQ(longest + SQLUH_SHADOW_NAME, handle->shadowPath);
+    EXPECT_EQ(sqluhPathTooLong, sqluhRecoverFromFatalError(handle));
+    sqluhHandleFree(&handle);
+    EXPECT_EQ(sqluhPathTooLong, sqluhHandleAllocAndInit(tooLong.data(), &handle));
+    EXPECT_EQ(nullptr, handle);
+    EXPECT_EQ(sqluhPathTooLong, sqluhCopyHistoryFile(directory.data(), tooLong.data()));
+    EXPECT_EQ(sqluhPathNoSeparator, sqluhCopyHistoryFile(directory.data(), none.data()));
+    EXPECT_EQ(sqluhPathTooLong, sqluhIsHistoryFileEmpty(tooLong.data(), &isEmpty));
+    EXPECT_TRUE(!isEmpty && load() == filesOf(" 10/ 10"));
+}
+
 // The writes are counted: of w of them on e entries, w < (e + w) / 2 are few. However many they
 // are, a batch waits for the disk four times, or six where the whole file is copied and its name is
 // made sure of; one without writes, three times.
@@ -168,6 +202,22 @@ TEST_F(FunctionalTest, HistoryDataIsOneBlockInOrder)
     sqluhFreeHistoryData(&data);
     EXPECT_EQ(sqloSystemError | ENOMEM,
               sqluhAllocateHistoryData(&data, nullptr, 0, true, UINT32_MAX));
+    ASSERT_EQ(0, sqluhAllocateHistoryData(&data, nullptr, 0, false, 100));
+    EXPECT_EQ(nullptr, data->tablespaceBuffers);
+    EXPECT_EQ(nullptr, data->commandText.data);
+    EXPECT_EQ(0u, data->maxTablespaces + data->commandText.capacity);
+    sqluhFreeHistoryData(&data);
+}
+
+TEST_F(FunctionalTest, BackupTypesAreToldByTheirLetters)
+{
+    for (const char letter : std::string("IODEFNSi -")) {
+        const bool isIncr = letter == 'I' || letter == 'O',
+                   isDelta = letter == 'D' || letter == 'E';
+        EXPECT_EQ(isIncr, sqluhIsHistEntryIncr(letter)) << letter;
+        EXPECT_EQ(isDelta, sqluhIsHistEntryDelta(letter)) << letter;
+        EXPECT_EQ(isIncr || isDelta, sqluhIsHistEntryIncrOrDelta(letter)) << letter;
+    }
 }
 
 // A write of a batch that comes out short without a code for it.

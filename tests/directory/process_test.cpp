@@ -399,10 +399,17 @@ TEST_F(ProcessTest, EightProcessesAppendEveryEntryOnce)
 
 TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
 {
+    int ends[2];
+    ASSERT_EQ(0, pipe(ends));
     store(filesOf(" 10/ 10"));
-    const pid_t holder = inChild([this] {
+    const pid_t holder = inChild([&] {
         SQLUH_HANDLE* handle = nullptr;
-        return sqluhBeginBatch(&handle, directory.data()) != 0 || append(handle, 3) != 0 || pause();
+        char byte;
+        close(ends[1]);
+        if (sqluhBeginBatch(&handle, directory.data()) != 0 || append(handle, 3) != 0)
+            return 1;
+        // A child that outlives it does not make it look alive.
+        return fork() == 0 ? static_cast<int>(read(ends[0], &byte, 1)) : pause();
     });
     while (slurp(historyPath).size() < samples.at(13).size())
         usleep(100);
@@ -434,6 +441,7 @@ TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
         ASSERT_LE(0, (rc = sqloNLCKNext(&index, &other, &found)) == END_OF_FILE ? 0 : rc);
     EXPECT_EQ(0, sqloNLCKRemoveDead(&lock, &stale));
     EXPECT_EQ("", faultOf({10}));
+    EXPECT_EQ(0, close(ends[0]) + close(ends[1])); // which ends that child
 }
 
 // Creation, fatal recovery and the first piece of a restore put a new file in the history's place,
@@ -533,6 +541,23 @@ TEST_F(RestoreTest, IsRefusedWhereItCouldNotBeFinished)
     }
 }
 
+// A piece that failed is not made good by another, only by a new beginning.
+TEST_F(RestoreTest, IsRefusedAfterAPieceThatFailed)
+{
+    for (const bool again : {false, true}) {
+        EXPECT_EQ(0, restoreMeeting([] {}));
+        std::string piece = "piece";
+        auto* bytes = reinterpret_cast<unsigned char*>(piece.data());
+        onSystemCall = [](const std::string& call) { return call == "pwrite" ? ENOSPC : 0; };
+        EXPECT_EQ(DISK_FULL, sqluh_write_restore_buffer(handle, 1024, bytes, 5));
+        onSystemCall = nullptr;
+        EXPECT_EQ(0, sqluh_write_restore_buffer(handle, 1024, bytes, 5));
+        EXPECT_EQ(0, again ? restore(handle, samples.at(2)) : 0);
+        EXPECT_EQ(again ? 0 : int{DISK_FULL}, sqluhClose(&handle));
+        EXPECT_EQ("", faultOf({again ? 2u : 10u}));
+    }
+}
+
 // The lock taken away, by its removal or by a step that fakes the holder's death: the holder's
 // batch is refused, and what others did meanwhile stays.
 TEST_F(ProcessTest, ABatchWhoseLockWasTakenAwayIsRefused)
@@ -612,8 +637,9 @@ TEST_F(ProcessTest, AThreadDoesNotWaitForItself)
     onCall = [](const std::string& call, int command) {
         return call == "semctl" && command == IPC_RMID ? EPERM : 0;
     };
-    EXPECT_EQ(sqloSystemError | EPERM, openAndClose());
+    EXPECT_EQ(sqloSystemError | EPERM, sqluhIsHistoryFileEmpty(directory.data(), &isEmpty));
     onCall = nullptr;
+    EXPECT_FALSE(isEmpty);
     EXPECT_EQ(sqloNLCKDeadlock, openAndClose());
     EXPECT_EQ(1, removeSetsLeft());
     EXPECT_EQ(0, openAndClose());

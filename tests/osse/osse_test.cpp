@@ -148,7 +148,17 @@ TEST_F(osse, OpenWordsCreateTruncateAndRefuse)
         EXPECT_EQ(sqloread(fh, &byte, 1, &done), row.read);
         EXPECT_EQ(sqlowrite(fh, "x", 1, &done), row.write);
         EXPECT_EQ(sqloclose(fh), 0);
-        EXPECT_EQ(sqloread(fh, &byte, 1, &done), failed | EBADF);
+        const int closed[] = {sqloread(fh, &byte, 1, &done), sqlowrite(fh, "x", 1, &done),
+                              sqloseek(fh, 0, sqloFromCurrent, nullptr), sqlosync(fh)};
+        for (const int rc : closed)
+            EXPECT_EQ(rc, failed | EBADF);
+    }
+    for (const int error : {EIO, EINTR}) {
+        EXPECT_EQ(sqloopenp(file.c_str(), 0x14, 0640, &fh), 0);
+        EXPECT_EQ(sqloseek(fh, 0, 3, nullptr), failed | EINVAL);
+        closeError = error;
+        EXPECT_EQ(sqloclose(fh), error == EINTR ? 0 : failed | error);
+        closeError = 0;
     }
     ASSERT_EQ(mkfifo(source.c_str(), 0600), 0);
     EXPECT_EQ(sqloopenp(file.c_str(), 0x15, 0640, &fh), failed | EINVAL);
@@ -405,12 +415,26 @@ TEST_F(osse, LimitsOfTheProcessAreTold)
     EXPECT_EQ(0, inChild([&] {
                   const rlimit none = {0, RLIM_INFINITY};
                   const std::string target = file + ".a";
-                  void* volatile block = &fh;
+                  const int noMemory = failed | ENOMEM;
+                  size_t size = 131072;
+                  void *small = nullptr, *large = nullptr, *never = nullptr;
+                  int rc = sqloopenp(file.c_str(), 0x14, 0640, &fh);
+                  rc |= sqlogmblkEx(nullptr, 1000, 0, &small, "", 0, 0);
+                  rc |= sqlogmblkEx(nullptr, 2000000, 0, &large, "", 0, 0);
                   setrlimit(RLIMIT_AS, &none);
-                  while (block != nullptr)
-                      block = malloc(4096);
-                  return sqlomove(file.c_str(), target.c_str()) == (failed | ENOMEM) &&
-                         sqlocopy(file.c_str(), target.c_str(), 0) == (failed | ENOMEM);
+                  while ((size /= 2) != 0) {
+                      void* volatile block = &fh;
+                      while (block != nullptr)
+                          block = malloc(size);
+                  }
+                  return rc == 0 && sqloread(fh, &byte, 1, &done) == 0 && byte == 's' &&
+                         sqloopenp(file.c_str(), 0x14, 0640, &fh) == noMemory &&
+                         sqlogmblkEx(nullptr, 1000, 0, &never, "", 0, 0) == noMemory &&
+                         sqlogmblkEx(nullptr, 2000000, 0, &never, "", 0, 0) == noMemory &&
+                         sqloMemBlockReallocate(&small, 2000000, 0, "", 0) == noMemory &&
+                         sqloMemBlockReallocate(&large, 4000000, 0, "", 0) == noMemory &&
+                         sqlomove(file.c_str(), target.c_str()) == noMemory &&
+                         sqlocopy(file.c_str(), target.c_str(), 0) == noMemory;
               }));
 #endif
     EXPECT_EQ(slurp(file), "sound");
@@ -525,6 +549,12 @@ TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
                                 std::filesystem::read_symlink("/proc/self/exe").string() +
                                 " --gtest_filter=osse.Trace*";
     EXPECT_EQ(WEXITSTATUS(system(command.c_str())), 7);
+    for (const char* noNode : {"ZQ3NODE= ", "ZQ3NODE=x ", "ZQ3NODE=65536 ", "ZQ3NODE=-32769 "})
+        EXPECT_EQ(WEXITSTATUS(system(
+                      (noNode + command.substr(command.find(" /")).insert(0, "ZQ3TRACE=/dev/null"))
+                          .c_str())),
+                  0)
+            << noNode;
     std::string digits;
     for (int i = 0; i < 128; i++)
         digits += "A9";
