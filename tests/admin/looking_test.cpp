@@ -103,7 +103,8 @@ TEST_F(LookTest, PlannersThatAreEndedLeaveNothing)
     for (int i = 0; i < 200; i++) {
         const pid_t child = fork();
         if (child == 0) {
-            freopen("/dev/null", "w", stdout);
+            if (freopen("/dev/null", "w", stdout) == nullptr)
+                _exit(98);
             execl(ZQ3CKRST, ZQ3CKRST, "-d", "h", "-t", "20250101010000", nullptr);
             _exit(99);
         }

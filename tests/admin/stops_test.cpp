@@ -77,7 +77,8 @@ class StopTest : public HistoryTest
         fflush(stdout);
         pid_t child = fork();
         if (child == 0) {
-            freopen((root + "said").c_str(), "w", stdout);
+            if (freopen((root + "said").c_str(), "w", stdout) == nullptr)
+                _exit(98);
             dup2(STDOUT_FILENO, STDERR_FILENO);
             stepsLeft = stopAt;
             kind = stops;
