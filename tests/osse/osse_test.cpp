@@ -504,11 +504,25 @@ TEST_F(osse, RecordsOfSeveralProcessesNeverMix)
 // Where the file cannot be written the system log takes the record; what does not fit is cut.
 static std::string sysLog;
 
+static void takeRecord(int priority, va_list rest)
+{
+    sysLog += std::to_string(priority & LOG_PRIMASK) + va_arg(rest, const char*);
+}
+
 extern "C" void syslog(int priority, const char* format, ...)
 {
     va_list rest;
     va_start(rest, format);
-    sysLog += std::to_string(priority & LOG_PRIMASK) + va_arg(rest, const char*);
+    takeRecord(priority, rest);
+    va_end(rest);
+}
+
+// What becomes of the call in a build with the flags of packages.
+extern "C" void __syslog_chk(int priority, int, const char* format, ...)
+{
+    va_list rest;
+    va_start(rest, format);
+    takeRecord(priority, rest);
     va_end(rest);
 }
 
