@@ -288,6 +288,7 @@ TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
         usleep(5000);
         EXPECT_EQ(0, waitpid(waiter, nullptr, WNOHANG));
         EXPECT_EQ(0, sqloNLCKRemoveDead(&lock, &state));
+        semctl(state.id, 0, IPC_RMID); // not to wait for ever
         EXPECT_EQ(0, waitFor(waiter));
         EXPECT_EQ(step == SETVAL ? 1u : 0u, takeLog().size());
         ahead = 0;
