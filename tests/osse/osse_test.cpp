@@ -413,7 +413,9 @@ TEST_F(osse, LimitsOfTheProcessAreTold)
 #ifndef __SANITIZE_ADDRESS__
     // What may only not have been looked at for want of memory stays where it is.
     EXPECT_EQ(0, inChild([&] {
-                  const rlimit none = {0, RLIM_INFINITY};
+                  rlimit before, none;
+                  getrlimit(RLIMIT_AS, &before);
+                  none = {0, before.rlim_max};
                   const std::string target = file + ".a";
                   const int noMemory = failed | ENOMEM;
                   size_t size = 131072;
@@ -427,14 +429,17 @@ TEST_F(osse, LimitsOfTheProcessAreTold)
                       while (block != nullptr)
                           block = malloc(size);
                   }
-                  return rc == 0 && sqloread(fh, &byte, 1, &done) == 0 && byte == 's' &&
-                         sqloopenp(file.c_str(), 0x14, 0640, &fh) == noMemory &&
-                         sqlogmblkEx(nullptr, 1000, 0, &never, "", 0, 0) == noMemory &&
-                         sqlogmblkEx(nullptr, 2000000, 0, &never, "", 0, 0) == noMemory &&
-                         sqloMemBlockReallocate(&small, 2000000, 0, "", 0) == noMemory &&
-                         sqloMemBlockReallocate(&large, 4000000, 0, "", 0) == noMemory &&
-                         sqlomove(file.c_str(), target.c_str()) == noMemory &&
-                         sqlocopy(file.c_str(), target.c_str(), 0) == noMemory;
+                  const bool told =
+                      rc == 0 && sqloread(fh, &byte, 1, &done) == 0 && byte == 's' &&
+                      sqloopenp(file.c_str(), 0x14, 0640, &fh) == noMemory &&
+                      sqlogmblkEx(nullptr, 1000, 0, &never, "", 0, 0) == noMemory &&
+                      sqlogmblkEx(nullptr, 2000000, 0, &never, "", 0, 0) == noMemory &&
+                      sqloMemBlockReallocate(&small, 2000000, 0, "", 0) == noMemory &&
+                      sqloMemBlockReallocate(&large, 4000000, 0, "", 0) == noMemory &&
+                      sqlomove(file.c_str(), target.c_str()) == noMemory &&
+                      sqlocopy(file.c_str(), target.c_str(), 0) == noMemory;
+                  setrlimit(RLIMIT_AS, &before);
+                  return told;
               }));
 #endif
     EXPECT_EQ(slurp(file), "sound");
