@@ -71,6 +71,9 @@ int keepFile(const char* path, char* kept)
     if (rc == 0)
         return 0;
     unlink(kept);
+    kept[0] = '\0';
+    if (rc == sqloFileIncomplete)
+        return 0; // it never was in force
     return failWithCode(rc, "keep the old file; nothing was changed", path);
 }
 

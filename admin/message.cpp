@@ -126,6 +126,9 @@ static constexpr explanation explanations[] = {
     {sqloNLCKOwnerDied, exitLocked, "a process died while it held the lock",
      "zq3hist unlock DIR && zq3hist repair DIR  # removes the lock and settles what is unfinished"},
     {sqloNLCKBusy, exitLocked, "the lock is held by another process", nullptr},
+    {sqloNLCKLost, exitLocked, "the lock was taken away meanwhile", nullptr},
+    {sqloFileIncomplete, exitDamaged, "the image was not restored to its end",
+     "zq3hist repair DIR  # goes on with the shadow"},
     {END_OF_FILE, exitDamaged, "the file is empty", nullptr},
     {DISK_FULL, exitFailed, "no space is left on the device", nullptr},
 };
@@ -140,7 +143,8 @@ static const explanation* explanationOf(int code)
 
 bool isSystemCode(int code)
 {
-    return (code & static_cast<int>(0xFFFF0000)) == sqloSystemError;
+    return (code & static_cast<int>(0xFFFF0000)) == sqloSystemError &&
+           explanationOf(code) == nullptr;
 }
 
 const char* wordsForCode(int code)

@@ -132,7 +132,8 @@ const char* wordsForCode(int code);
 const char* wordsForStatus(int status);
 int statusForCode(int code);
 
-// Whether a code is that of a system call that failed, its errno included.
+// Whether a code is that of a system call that failed, its errno included, and has no words of
+// ours.
 bool isSystemCode(int code);
 
 // Writes bytes with everything but printable ASCII as escapes of the stanza form.

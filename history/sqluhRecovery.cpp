@@ -245,7 +245,10 @@ int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle)
             rc = logged(sqluhFollowLock(handle, __func__));
             made = rc == 0 && examineFile(handle, handle->historyPath, &unseen).usable;
         }
-        if (rc == 0 && !made)
+        // The shadow that was moved may have been his.
+        if (rc == 0 && made)
+            rc = logged(sqlocopy(handle->historyPath, handle->shadowPath, 0));
+        else if (rc == 0)
             rc = sqluhCreate(handle->directory);
     }
 

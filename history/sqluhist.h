@@ -484,9 +484,10 @@ bool sqluhVerifyHistFilesAreIndentical(SQLUH_HANDLE* handle);
 int sqluhRecoverHistoryFromShadow(SQLUH_HANDLE* handle);
 int sqluhRecoverShadowFromHistory(SQLUH_HANDLE* handle);
 
-// Moves both files aside, as far as they can be moved, and makes an empty pair; a handle that is
-// locked then holds the new file's lock. No file is open through it. Returns 0; sqluhPathTooLong
-// for a directory of more than 243 bytes, and nothing moved; a lock code; a code of sqluhCreate.
+// Moves both files aside, as far as they can be moved, and makes an empty pair, or keeps the one
+// that somebody else made meanwhile; a handle that is locked then holds the new file's lock. No
+// file is open through it. Returns 0; sqluhPathTooLong for a directory of more than 243 bytes, and
+// nothing moved; a lock code; a code of sqluhCreate.
 int sqluhRecoverFromFatalError(SQLUH_HANDLE* handle);
 
 // Rewrites the status letter in the header of the file at path, which nobody has open; does not

@@ -287,6 +287,20 @@ TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)
     EXPECT_EQ(0, semctl(foreign, 0, IPC_RMID)) << "it is still there";
 }
 
+// The image of a restore that was stopped is marked until it is whole; the shadow is the history.
+TEST_F(ProgramTest, ARestoreThatWasStoppedIsRepaired)
+{
+    run("load h/", week);
+    spill(historyPath, slurp(historyPath).substr(0, 2500));
+    std::filesystem::permissions(historyPath, std::filesystem::perms::sticky_bit,
+                                 std::filesystem::perm_options::add);
+    EXPECT_NE(std::string::npos, run("status h/").find("the image was not restored to its end"));
+    EXPECT_NE(std::string::npos, run("verify h/").find("zq3hist repair h/  # takes the entries"));
+    EXPECT_EQ("The history file was made anew from the shadow: 2 entries\n[0]", run("repair h/"));
+    EXPECT_EQ(slurp(historyPath).substr(1024), slurp(shadowPath).substr(1024));
+    EXPECT_TRUE(run("verify h/").ends_with("[0]"));
+}
+
 // The locks of a node that no other test has: of a process that died, and of this one.
 TEST_F(ProgramTest, LocksWithoutAFileAreRemovedWhereTheirOwnersDied)
 {

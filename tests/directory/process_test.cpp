@@ -471,6 +471,26 @@ TEST_F(ProcessTest, NobodyGetsInWhileTheHolderOfANewFileWorks)
     }
 }
 
+// Between the moves, or after them, somebody else may come, make the pair and commit to it.
+TEST_F(ProcessTest, APairThatSomebodyElseMadeMeanwhileStays)
+{
+    for (const char* moment : {"sqlomove", "semget"}) {
+        int times = 0;
+        store(filesOf("junk/junk"));
+        onCall = [&](const std::string& call, int) {
+            if (call == moment && ++times == 2) {
+                EXPECT_EQ(0, waitFor(inChild([&] { return batch(1); })));
+            }
+            return 0;
+        };
+        EXPECT_EQ(0, batch(1, sqluhAbandon));
+        onCall = nullptr;
+        EXPECT_LE(2, times);
+        EXPECT_EQ(0, openAndClose());
+        EXPECT_EQ(1u, writers().size()) << moment;
+    }
+}
+
 // A restore of two entries over ten, with something done by another process between the creation of
 // the new file and its lock.
 class RestoreTest : public ProcessTest
