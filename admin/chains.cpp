@@ -41,7 +41,7 @@ static bool growNames(chainWalker* walker)
 }
 
 // The number of a new tablespace of that name, or -1 for want of memory.
-static int addTablespace(chainWalker* walker, const char* name)
+static int trackTablespace(chainWalker* walker, const char* name)
 {
     chainWalk* walk = walker->walk;
     if (walk->numTablespaces == walker->tablespaceCapacity) {
@@ -70,7 +70,7 @@ static chainName* takeName(chainWalker* walker, const char* name)
         return nullptr;
     chainName* added = &walker->names[walker->numNames];
     copyName(added->name, name);
-    added->number = addTablespace(walker, name);
+    added->number = trackTablespace(walker, name);
     if (added->number < 0)
         return nullptr;
     enterName(walker->names, walker->nameCapacity, walker->numNames++);
@@ -166,7 +166,7 @@ static int takeRename(chainWalker* walker, const historyEntry* entry)
     const char* newName = entry->tablespaceNames[1];
     int renamed = numberOf(walker, oldName);
     int replaced = numberOf(walker, newName);
-    int fresh = addTablespace(walker, oldName);
+    int fresh = trackTablespace(walker, oldName);
     if (renamed < 0 || replaced < 0 || fresh < 0)
         return -1;
     chainTablespace* tablespaces = walker->walk->tablespaces;

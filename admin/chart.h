@@ -38,8 +38,12 @@ struct imageChart {
     int* rowOf; // by the tablespace's number; -1: none
 };
 
-// Whether the cell's image is needed; its letter in upper case, and the words for it.
-bool isNeededCell(char cell);
+// Makes the chart of the history up to the image at the target position; -1: to its end. Returns 0,
+// or exitFailed after a complaint. freeChart accepts a zero-filled record.
+int makeChart(const imageCatalog* catalog, int target, imageChart* chart);
+void freeChart(imageChart* chart);
+
+// A cell's letter in upper case, and the words for it.
 char kindOfCell(char cell);
 const char* wordsForCell(char cell);
 

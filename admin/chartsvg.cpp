@@ -134,14 +134,14 @@ static void putColumn(const svgLayout* layout, int column, int x, int y)
 
 // --- Bands ---------------------------------------------------------------------------------------
 
-static void putText(const svgLayout* layout, const char* name, int x, int y, const char* text)
+static void putSvgText(const svgLayout* layout, const char* name, int x, int y, const char* text)
 {
     fprintf(layout->out, "<text class=\"%s\" x=\"%d\" y=\"%d\">", name, x, y);
     putXml(layout->out, text);
     fputs("</text>\n", layout->out);
 }
 
-static void putLabels(const svgLayout* layout, int first, int last, int y)
+static void putSvgLabels(const svgLayout* layout, int first, int last, int y)
 {
     const char* before = "";
     int end = 0;
@@ -155,7 +155,7 @@ static void putLabels(const svgLayout* layout, int first, int last, int y)
         if (x + length * smallLetterWidth > pictureWidth)
             break;
         fprintf(layout->out, "<path d=\"M%d.5 %dv4\"/>", x, y - 3);
-        putText(layout, "t", x, y - 5, label);
+        putSvgText(layout, "t", x, y - 5, label);
         end = x + (length + 1) * smallLetterWidth;
         before = timestamp;
     }
@@ -164,11 +164,11 @@ static void putLabels(const svgLayout* layout, int first, int last, int y)
 static void putBand(const svgLayout* layout, int first, int last, int y)
 {
     char title[rowTitleCapacity];
-    putLabels(layout, first, last, y + labelHeight);
+    putSvgLabels(layout, first, last, y + labelHeight);
     y += labelHeight + 2;
     for (int row = 0; row < layout->chart->numRows; row++) {
         titleOfRow(layout->chart, &layout->chart->rows[row], title);
-        putText(layout, "n", margin, y + row * rowHeight + cellHeight - 3, title);
+        putSvgText(layout, "n", margin, y + row * rowHeight + cellHeight - 3, title);
     }
     for (int column = first; column < last; column++)
         putColumn(layout, column, margin + layout->titleWidth + (column - first) * layout->pitch,
@@ -177,7 +177,7 @@ static void putBand(const svgLayout* layout, int first, int last, int y)
 
 // --- The picture ---------------------------------------------------------------------------------
 
-static void putHead(const svgLayout* layout, int height)
+static void putSvgHead(const svgLayout* layout, int height)
 {
     static const char style[] =
         "text{font-family:sans-serif;fill:#222}.h{font-size:15px;font-weight:bold}.s{font-size:"
@@ -199,16 +199,16 @@ static void putHead(const svgLayout* layout, int height)
             "style=\"max-width:800px;height:auto\">\n<style>%s</style>\n"
             "<rect width=\"100%%\" height=\"100%%\" fill=\"#fff\"/>\n",
             pictureWidth, height, style);
-    putText(layout, "h", margin, 24, text);
+    putSvgText(layout, "h", margin, 24, text);
     int numImages = 0;
     for (int i = 0; i < chart->numColumns; i++)
         numImages += chart->columns[i].image != nullptr;
     snprintf(text, sizeof text, "%d image%s, the oldest first", numImages,
              numImages == 1 ? "" : "s");
-    putText(layout, "s", margin, 41, text);
+    putSvgText(layout, "s", margin, 41, text);
 }
 
-static void putLegend(const svgLayout* layout, int y)
+static void putSvgLegend(const svgLayout* layout, int y)
 {
     static constexpr struct {
         char cell;
@@ -224,7 +224,7 @@ static void putLegend(const svgLayout* layout, int y)
     for (const auto& item : legend) {
         int x = places[number % 3], top = y + number / 3 * (rowHeight + 2);
         putCell(layout, x, top, letterCell + 2, item.cell);
-        putText(layout, "t", x + letterCell + 6, top + cellHeight - 4, item.words);
+        putSvgText(layout, "t", x + letterCell + 6, top + cellHeight - 4, item.words);
         number++;
     }
 }
@@ -253,8 +253,8 @@ void drawSvg(const imageChart* chart, FILE* out)
     svgLayout layout = {chart, out, 0, 0, 0, 0};
     layOut(&layout);
     int numBands = (chart->numColumns + layout.perBand - 1) / layout.perBand;
-    putHead(&layout, headHeight + legendHeight + numBands * layout.bandHeight);
-    putLegend(&layout, headHeight);
+    putSvgHead(&layout, headHeight + legendHeight + numBands * layout.bandHeight);
+    putSvgLegend(&layout, headHeight);
     for (int band = 0; band < numBands; band++) {
         int first = band * layout.perBand, last = first + layout.perBand;
         putBand(&layout, first, last < chart->numColumns ? last : chart->numColumns,

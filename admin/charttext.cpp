@@ -95,7 +95,7 @@ static int lastMark(const char* marks, int end)
 }
 
 // Two lines: labels where there is room, and marks at their columns.
-static void putLabels(const chartView* view, int width)
+static void drawLabels(const chartView* view, int width)
 {
     char labels[1024], marks[sizeof labels];
     const char* before = "";
@@ -162,7 +162,7 @@ static void putRow(const chartView* view, const chartRow* row)
 }
 
 // Explains the cells that are there.
-static void putLegend(const chartView* view)
+static void drawLegend(const chartView* view)
 {
     static constexpr struct {
         const char *cells, *words;
@@ -203,10 +203,10 @@ bool drawText(imageChart* chart, int width, bool colored)
     if (allocated) {
         groupRows(chart, view.columns, view.numColumns);
         measureTitles(&view);
-        putLabels(&view, width);
+        drawLabels(&view, width);
         for (int row = 0; row < chart->numRows; row++)
             putRow(&view, &chart->rows[row]);
-        putLegend(&view);
+        drawLegend(&view);
     }
     free(view.columns);
     return allocated;

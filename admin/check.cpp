@@ -215,7 +215,7 @@ static const char* wordFor(int status)
                                    : "incomplete";
 }
 
-static void showLine(const checkReport* report)
+static void showCheckLine(const checkReport* report)
 {
     const char* separator = ": ";
     fputs(wordFor(statusOf(report)), stdout);
@@ -253,7 +253,7 @@ static void putJsonProblems(jsonWriter* json, const checkReport* report)
     endJson(json, ']');
 }
 
-static void showJson(const checkReport* report)
+static void showCheckJson(const checkReport* report)
 {
     const chainWalk* walk = &report->walk;
     jsonWriter json;
@@ -297,9 +297,9 @@ int checkMain(commandLine* line)
     checkLock(&report);
     rc = checkImages(&report);
     if (rc == 0 && line->json)
-        showJson(&report);
+        showCheckJson(&report);
     else if (rc == 0)
-        showLine(&report);
+        showCheckLine(&report);
     rc = rc != 0 ? rc : statusOf(&report);
     freeChains(&report.walk);
     freeCatalog(&report.catalog);

@@ -91,7 +91,7 @@ struct imageList {
     long skipped, shown;
 };
 
-static void putHead(void)
+static void putImageHead(void)
 {
     puts("TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE");
 }
@@ -252,7 +252,7 @@ int imagesMain(commandLine* line)
         if (line->json)
             beginJson(&list.json, "images", '[');
         else
-            putHead();
+            putImageHead();
         visitRows(&list, visitRow);
         if (line->json)
             putJsonSummary(&list);

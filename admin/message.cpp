@@ -52,6 +52,11 @@ int failUsage(const char* format, ...)
     return exitUsage;
 }
 
+int failForm(const commandLine* line)
+{
+    return failUsage("usage: zq3hist %s [OPTION...] %s", line->command->name, line->command->form);
+}
+
 // --- Hints ---------------------------------------------------------------------------------------
 
 // Whether every shell takes the character for nothing but itself.

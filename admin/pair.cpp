@@ -26,7 +26,7 @@ static fileVerdict verdictOf(const fileFinding* finding)
     return finding->entries.count < finding->file.header.entryCount ? fileShort : fileSound;
 }
 
-int examineFile(const char* path, const char* progress, fileFinding* finding)
+int findInFile(const char* path, const char* progress, fileFinding* finding)
 {
     SQLO_FHANDLE file = sqloNoFile;
     SQLUH_WORKAREA workArea = {};
@@ -74,7 +74,7 @@ int failUnsound(const fileFinding* finding, const char* name, const char* what)
     return exitDamaged;
 }
 
-static bool isSame(const fileFinding* history, const fileFinding* shadow)
+static bool hasSameEntries(const fileFinding* history, const fileFinding* shadow)
 {
     return history->verdict == fileSound && shadow->verdict == fileSound &&
            history->file.state.usable && history->file.size == shadow->file.size &&
@@ -97,13 +97,13 @@ static sqluhRepair repairFor(const pairFinding* pair)
 int examinePair(const historyPlace* place, bool withProgress, pairFinding* pair)
 {
     *pair = {};
-    int rc = examineFile(place->historyPath, withProgress ? SQLUH_HISTORY_NAME : nullptr,
-                         &pair->history);
+    int rc =
+        findInFile(place->historyPath, withProgress ? SQLUH_HISTORY_NAME : nullptr, &pair->history);
     if (rc == 0)
-        rc = examineFile(place->shadowPath, withProgress ? SQLUH_SHADOW_NAME : nullptr,
-                         &pair->shadow);
+        rc = findInFile(place->shadowPath, withProgress ? SQLUH_SHADOW_NAME : nullptr,
+                        &pair->shadow);
     pair->refused = pair->history.verdict == fileRefused || pair->shadow.verdict == fileRefused;
-    pair->same = isSame(&pair->history, &pair->shadow);
+    pair->same = hasSameEntries(&pair->history, &pair->shadow);
     pair->due = repairFor(pair);
     return rc == 0 ? 0 : failWithCode(rc, "read the history", place->directory);
 }

@@ -23,7 +23,7 @@ struct fileFinding {
 
 // Reads header and entries of the file at path. progress: as for readAllEntries. Returns 0, also
 // for a file that is not sound; or the allocation's code.
-int examineFile(const char* path, const char* progress, fileFinding* finding);
+int findInFile(const char* path, const char* progress, fileFinding* finding);
 
 // Puts what was found as an object (verify.cpp).
 void putJsonFinding(jsonWriter* json, const char* key, const fileFinding* finding);

@@ -138,30 +138,30 @@ static bool isWhole(const imagePlan* plan, int row)
     return countNeeded(plan, row) == static_cast<int>(plan->rows[row]->numTablespaces);
 }
 
-static void putText(const char* before, const char* text)
+static void printEscaped(const char* before, const char* text)
 {
     fputs(before, stdout);
     putEscaped(stdout, text, strlen(text));
 }
 
-static void showLine(const imagePlan* plan, int row, int position, int width)
+static void showPlanLine(const imagePlan* plan, int row, int position, int width)
 {
     const historyEntry* image = plan->rows[row];
     int count = countNeeded(plan, row);
     printf("%*d/%d  %-11s  ", width, position, plan->numImages, kindOfImage(image));
-    putText("", image->timestamp);
+    printEscaped("", image->timestamp);
     const char* separator = "  ";
     if (count > 1 && isWhole(plan, row))
         printf("  all %d", count);
     else
         for (int column = 0; column < plan->stages.numTablespaces; column++)
             if (cellAt(plan, row, column) != cellUnused) {
-                putText(separator, plan->stages.list[column].name);
+                printEscaped(separator, plan->stages.list[column].name);
                 separator = ", ";
             }
     separator = "  for ";
     for (int later = nextNeeder(plan, row, row); later >= 0; later = nextNeeder(plan, row, later)) {
-        putText(separator, plan->rows[later]->timestamp);
+        printEscaped(separator, plan->rows[later]->timestamp);
         separator = ", ";
     }
     puts(row == plan->stages.numBackups - 1 ? "  target" : "");
@@ -220,7 +220,7 @@ static void showPlan(const imagePlan* plan)
     int width = snprintf(nullptr, 0, "%d", plan->numImages);
     for (int row = 0, position = 1; row < plan->stages.numBackups; row++)
         if (isNeeded(plan, row))
-            showLine(plan, row, position++, width);
+            showPlanLine(plan, row, position++, width);
 }
 
 // Tells which chains are open, and where a restore is possible.

@@ -121,7 +121,7 @@ static void putJsonFile(jsonWriter* json, const char* key, const fileReport* fil
     endJson(json, '}');
 }
 
-static void showJson(const historyPlace* place, const directoryReport* report)
+static void showStatusJson(const historyPlace* place, const directoryReport* report)
 {
     static const char* const repairs[] = {"none", "shadow", "history", "anew"};
     static const char* const states[] = {"free",        "being taken", "setup died", "held",
@@ -167,7 +167,7 @@ int statusMain(commandLine* line)
     report.due = repairDue(&report.history, &report.shadow);
     report.lockKnown = queryLock(place, &report.lock, &report.lockState);
     if (json) {
-        showJson(place, &report);
+        showStatusJson(place, &report);
     } else {
         showFile("history", SQLUH_HISTORY_NAME, &report.history);
         showFile("shadow", SQLUH_SHADOW_NAME, &report.shadow);

@@ -88,35 +88,6 @@ static constexpr option options[] = {
      "the locks of all dead processes, also where the directory is gone"},
 };
 
-bool parseTimestamp(const char* text, char* timestamp)
-{
-    static const char readable[] = "dddd-dd-dd dd:dd:dd";
-    size_t length = strlen(text), kept = 0;
-    bool stored = length == timestampWidth;
-    if (!stored && length != sizeof readable - 1)
-        return false;
-    for (size_t i = 0; i < length; i++) {
-        bool isDigit = text[i] >= '0' && text[i] <= '9';
-        if (stored || readable[i] == 'd') {
-            if (!isDigit)
-                return false;
-            timestamp[kept++] = text[i];
-        } else if (text[i] != readable[i] && !(readable[i] == ' ' && text[i] == 'T')) {
-            return false;
-        }
-    }
-    timestamp[kept] = '\0';
-    return true;
-}
-
-int takeInstant(const char* what, const char* text, char* timestamp)
-{
-    if (parseTimestamp(text, timestamp))
-        return 0;
-    return failUsage("%s takes a timestamp such as 20250111010000 or '2025-01-11 01:00:00', not %s",
-                     what, text);
-}
-
 static bool parseNumber(const char* text, long* number)
 {
     size_t length = strlen(text);
@@ -124,7 +95,7 @@ static bool parseNumber(const char* text, long* number)
     return length != 0 && length < 10 && strspn(text, "0123456789") == length;
 }
 
-static int takeValue(const option* taken, const char* value, commandLine* line)
+static int takeOptionValue(const option* taken, const char* value, commandLine* line)
 {
     char* member = reinterpret_cast<char*>(line) + taken->at;
     if (taken->kind == takesNothing)
@@ -154,7 +125,7 @@ static int takeOption(int argc, char** argv, int* at, commandLine* line)
             value = argv[*at];
         if (known.kind != takesNothing && value == nullptr)
             return failUsage("%s needs a value:%s", known.name, known.value);
-        return takeValue(&known, value, line);
+        return takeOptionValue(&known, value, line);
     }
     return failUsage("%s: unknown option %s", line->command->name, argument);
 }
@@ -193,11 +164,6 @@ static int showHelp(void)
     for (int status = exitDone; status <= exitIncomplete; status++)
         printf("  %d  %s\n", status, wordsForStatus(status));
     return exitDone;
-}
-
-int failForm(const commandLine* line)
-{
-    return failUsage("usage: zq3hist %s [OPTION...] %s", line->command->name, line->command->form);
 }
 
 // --- Arguments -----------------------------------------------------------------------------------

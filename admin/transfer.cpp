@@ -9,7 +9,7 @@
 #include <unistd.h>
 
 // Whether two paths lead to one file or directory.
-static bool isSame(const char* a, const char* b)
+static bool isSamePlace(const char* a, const char* b)
 {
     struct stat first, second;
     return stat(a, &first) == 0 && stat(b, &second) == 0 && first.st_dev == second.st_dev &&
@@ -20,7 +20,7 @@ static bool isSame(const char* a, const char* b)
 static int proveImage(const char* path, const char* name, const char* what, uint32_t* count)
 {
     fileFinding finding;
-    int rc = examineFile(path, what, &finding);
+    int rc = findInFile(path, what, &finding);
     *count = finding.entries.count;
     return rc != 0 ? failWithCode(rc, what, name) : failUnsound(&finding, name, what);
 }
@@ -111,7 +111,7 @@ int copyMain(commandLine* line)
     int rc = formTemporary(target->historyPath, temporary);
     if (rc != 0)
         return rc;
-    if (isSame(source->directory, target->directory))
+    if (isSamePlace(source->directory, target->directory))
         return fail(target->directory, "source and target are the same directory");
     if (line->dryRun) {
         rc = countCommitted(source, "copy the history", &count);
@@ -136,7 +136,7 @@ int copyMain(commandLine* line)
 static int checkBackupName(const historyPlace* place, const char* path, bool force)
 {
     struct stat there;
-    if (isSame(path, place->historyPath) || isSame(path, place->shadowPath))
+    if (isSamePlace(path, place->historyPath) || isSamePlace(path, place->shadowPath))
         return fail(path, "the backup would replace the history itself");
     if (lstat(path, &there) != 0)
         return 0;

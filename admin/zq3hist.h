@@ -96,8 +96,7 @@ int unlockMain(commandLine* line);
 // Runs the subcommand that argv[1] names and returns its exit status.
 int runProgram(int argc, char** argv);
 
-// Complains with the subcommand's usage line and returns exitUsage.
-int failForm(const commandLine* line);
+// --- Points in time (instant.cpp) ----------------------------------------------------------------
 
 // Takes a timestamp as histories hold it, 14 digits, or as people write it: 2025-01-11 01:00:00,
 // with a blank or T in the middle. timestamp: room for 15 characters. False: neither.
@@ -124,6 +123,9 @@ int failInPlace(int code, const char* what, const historyPlace* place);
 
 // Complains about the command line and returns exitUsage.
 int failUsage(const char* format, ...) __attribute__((format(printf, 1, 2)));
+
+// Complains with the subcommand's usage line and returns exitUsage.
+int failForm(const commandLine* line);
 
 // The words for a code of the library. They live until the next call.
 const char* wordsForCode(int code);
