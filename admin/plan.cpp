@@ -223,22 +223,52 @@ static void showPlan(const imagePlan* plan)
             showPlanLine(plan, row, position++, width);
 }
 
-// Tells which chains are open, and where a restore is possible.
-static int failIncomplete(const planRequest* request)
+// Whether two columns lack the same image, or both any full one.
+static bool lackSame(const planRequest* request, int a, int b)
+{
+    const char *imageOfA, *imageOfB;
+    planLack lack = lackOfColumn(&request->catalog, &request->plan, a, &imageOfA);
+    if (lack != lackOfColumn(&request->catalog, &request->plan, b, &imageOfB))
+        return false;
+    return imageOfA == imageOfB ||
+           (imageOfA != nullptr && imageOfB != nullptr && strcmp(imageOfA, imageOfB) == 0);
+}
+
+// Says what a column lacks, and how many others with it, unless it was said of one before it.
+static void failColumn(const planRequest* request, int column)
 {
     const imagePlan* plan = &request->plan;
     const char* timestamp = timestampAt(request, request->target);
-    for (int column = 0; column < plan->stages.numTablespaces; column++) {
-        const char* image;
-        const char* name = plan->stages.list[column].name;
-        planLack lack = lackOfColumn(&request->catalog, plan, column, &image);
-        if (lack == planLacksFullImage)
-            fail(timestamp, "tablespace %s lacks a full image", name);
-        else if (lack == planLacksRestored)
-            fail(timestamp, "tablespace %s lacks the image %s that was restored", name, image);
-        else if (lack == planLacksOnHand)
-            fail(timestamp, "tablespace %s lacks the image %s, which is not on hand", name, image);
+    const char* image;
+    planLack lack = lackOfColumn(&request->catalog, plan, column, &image);
+    int count = 1;
+    for (int other = 0; lack != planLacksNothing && other < plan->stages.numTablespaces; other++) {
+        bool isSame = other != column && lackSame(request, column, other);
+        if (isSame && other < column)
+            return;
+        count += isSame;
     }
+    char who[64];
+    if (count == 1)
+        snprintf(who, sizeof who, "tablespace %s lacks", plan->stages.list[column].name);
+    else if (count == plan->stages.numTablespaces)
+        snprintf(who, sizeof who, "all %d tablespaces lack", count);
+    else
+        snprintf(who, sizeof who, "tablespace %s and %d more lack", plan->stages.list[column].name,
+                 count - 1);
+    if (lack == planLacksFullImage)
+        fail(timestamp, "%s a full image", who);
+    else if (lack == planLacksRestored)
+        fail(timestamp, "%s the image %s that was restored", who, image);
+    else if (lack == planLacksOnHand)
+        fail(timestamp, "%s the image %s, which is not on hand", who, image);
+}
+
+// Tells which chains are open, and where a restore is possible.
+static int failIncomplete(const planRequest* request)
+{
+    for (int column = 0; column < request->plan.stages.numTablespaces; column++)
+        failColumn(request, column);
     char advice[128] = "zq3hist images DIR  # no image of this scope can be restored";
     if (request->restorable >= 0)
         snprintf(advice, sizeof advice,

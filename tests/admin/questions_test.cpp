@@ -237,8 +237,8 @@ TEST_F(QuestionTest, AnswersInFull)
         {"plan h/ --before 20241231000000", "zq3hist: no image is there up to 20241231000000, h/\n"
                                             "zq3hist: hint: zq3hist images h/  # lists all\n"
                                             "[5]"},
-        {"plan --have have h/ 20250105010000 a",
-         "zq3hist: tablespace A lacks the image 20250105010000, which is not on hand, "
+        {"plan --have have h/ 20250105010000",
+         "zq3hist: all 2 tablespaces lack the image 20250105010000, which is not on hand, "
          "20250105010000\n"
          "zq3hist: hint: zq3hist plan h/ 20250109010000  # the newest image that can be restored\n"
          "[6]"},
