@@ -103,7 +103,7 @@ void addToReport(entriesReport* report, const SQLUH_ENTRY* entry)
 void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* progress,
                     entriesReport* report)
 {
-    char objectPart[18] = {};
+    char objectPart[zq3ObjectPartCapacity] = {};
     zq3HistoryData data = {};
     data.objectPart = {objectPart, sizeof objectPart, 0};
     SQLUH_ENTRY entry = {};

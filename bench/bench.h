@@ -57,7 +57,7 @@ struct sampleEntry {
 void initSample(sampleEntry* sample, uint32_t tablespaces);
 
 // Makes the sample the index-th entry of a history: a full image each week, an incremental one each
-// day, three deltas behind it; now and then a restore and a rename, once a creation. To be called
+// day, three deltas after it; now and then a restore and a rename, once a creation. To be called
 // with index 0, 1, 2, ...
 void nextSample(sampleEntry* sample, uint32_t index);
 

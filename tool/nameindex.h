@@ -53,7 +53,7 @@ inline void copyName(char* target, const char* source)
     memcpy(target, words, sizeof words);
     target[16] = static_cast<char>(key.tail & 0xFF);
     target[17] = static_cast<char>(key.tail >> 8);
-    target[18] = '\0';
+    target[nameSize - 1] = '\0';
 }
 
 inline bool sameName(const nameKey& first, const nameKey& second)

@@ -177,7 +177,7 @@ TEST_F(ScanTest, DamageFailsTheScanWhereItStands)
         {"lower-case digits", with(23, "0000030b"), 3, whole},
         {"blanks for zeros", with(23, "     30B"), 3, whole},
         {"size below the least", with(23, "00000200"), 2, damaged},
-        {"size behind the end", with(23, "7FFFFFFF"), 2, damaged},
+        {"size past the end", with(23, "7FFFFFFF"), 2, damaged},
         {"more names than fit", with(79, "FFFFFFFF"), 2, damaged},
         {"no number", with(23, "????????"), 2, damaged},
         {"1 byte", entry.substr(0, 1), 2, damaged},
