@@ -46,6 +46,7 @@ zq3_pkgconfig(libsqluhist "-lsqluhist -lzq3osse"
 zq3_pkgconfig(zq3 "-lzq3" "Scans of a database's recovery history")
 
 install(FILES man/zq3ckrst.1 man/zq3hist.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
+install(FILES man/libsqluhist.3 DESTINATION ${CMAKE_INSTALL_MANDIR}/man3)
 install(FILES man/zq3rhist.5 man/zq3hist-json.5 DESTINATION ${CMAKE_INSTALL_MANDIR}/man5)
 install(FILES docs/installed.md DESTINATION ${CMAKE_INSTALL_DOCDIR} RENAME README.md)
 install(FILES docs/troubleshooting.md docs/chart.svg DESTINATION ${CMAKE_INSTALL_DOCDIR})

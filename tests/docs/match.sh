@@ -111,6 +111,8 @@ same "fields of an entry in zq3rhist(5)" \
     grep -oP '\{\K\d+, \d+' | tr -d ,)" \
   "$(sed -n '/^\.Ss Entry/,/^\.El/p' man/zq3rhist.5 | grep -oP '^\.It \K\d+ Ta \d+ Ta \w+' |
     sed 's/ Ta / /;s/ Ta .*//')"
+same "the example of libsqluhist(3)" "$(nl examples/append.cpp)" \
+  "$(sed -n '/^\.Bd -literal/,/^\.Ed/p' man/libsqluhist.3 | sed '1d;$d; s/\\e/\\/g' | nl)"
 mapfile -t texts < <(tr '\n' ' ' <history/sqluhDiagnostics.h |
   grep -oP '#define TEXT_\w+[ \\]+"\K[^"%\\]*' | sed 's/ *$//; s/  / /g')
 holds docs/troubleshooting.md "${texts[@]}"
