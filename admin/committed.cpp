@@ -45,6 +45,11 @@ static void warnOfState(const historyPlace* place, const SQLUH_COMMITTED* commit
                             : "a batch is unfinished; the state before it was read");
     else if (committed->fromShadow)
         warn(place, "the history file cannot be used; the shadow was read");
+    if (committed->failure == 0 && committed->numRows < committed->header.entryCount) {
+        warn(place, "the history ends after %u of %u entries", committed->numRows,
+             committed->header.entryCount);
+        hint(place, "zq3hist verify DIR  # reads both files and tells what mends them");
+    }
 }
 
 int readCommitted(const historyPlace* place, SQLUH_COMMITTED** committed)

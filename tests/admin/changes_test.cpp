@@ -159,6 +159,11 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "
          "--force h/ goes on with what can be read\n[3]",
          "1 1"},
+        {CUT("asc", "1803") CUT("bak", "1803"), "plan h/ latest",
+         "1/1  full         20250105010000  A  target\n"
+         "zq3hist: warning: the history ends after 1 of 3 entries, h/\n"
+         "zq3hist: hint: zq3hist verify h/  # reads both files and tells what mends them\n[0]",
+         "1 1"},
         {CUT("asc", "1803") CUT("bak", "2582"), "repair --force h/",
          "Neither file is whole; a history of what can be read was made: 2 entries\n" KEPT("asc")
              KEPT("bak") "[0]",
