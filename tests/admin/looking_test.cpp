@@ -78,7 +78,8 @@ TEST_F(LookTest, ReadingNeedsNothingButTheRightToRead)
         answers[i] = outputOf("exec \"$@\"", questions[i]);
     for (const auto& row : surroundings) {
         SCOPED_TRACE(row.what);
-        if (outputOf(row.where, "echo here") != "here\n") {
+        // Not all is to be had everywhere: a program that counts its lines writes into files.
+        if (outputOf(row.where, ZQ3HIST " --version >out; echo $?") != "0\n") {
             printf("not to be had here: %s\n", row.what);
             continue;
         }
