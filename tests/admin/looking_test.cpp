@@ -79,7 +79,7 @@ TEST_F(LookTest, ReadingNeedsNothingButTheRightToRead)
     for (const auto& row : surroundings) {
         SCOPED_TRACE(row.what);
         // Not all is to be had everywhere: a program that counts its lines writes into files.
-        if (outputOf(row.where, ZQ3HIST " --version >out; echo $?") != "0\n") {
+        if (outputOf(row.where, ZQ3HIST " --version >/dev/null; echo $?") != "0\n") {
             printf("not to be had here: %s\n", row.what);
             continue;
         }

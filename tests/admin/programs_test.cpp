@@ -164,6 +164,42 @@ TEST_F(ProgramTest, AMistakeNamesItsLineAndChangesNothing)
 }
 
 // Entries with every kind of section and any bytes that an entry can hold.
+TEST_F(ProgramTest, WrongCallsAreToldAndMakeNothing)
+{
+    const struct {
+        const char* arguments;
+        const char* report;
+        int status = 2;
+    } rows[] = {
+        {"", "no subcommand given"},
+        {"help nosuch", "no subcommand nosuch"},
+        {"images", "usage: zq3hist images [OPTION...] DIR"},
+        {"images h/ h/", "usage: zq3hist images [OPTION...] DIR"},
+        {"plan h/", "usage: zq3hist plan [OPTION...] DIR TIMESTAMP [NAME...]"},
+        {"images h/ --last", "--last needs a value: N"},
+        {"images h/ --last=x", "--last takes a number, not x"},
+        {"images h/ --json=1", "--json takes no value"},
+        {"images h/ --nosuch", "images: unknown option --nosuch"},
+        {"copy -d a h/", "-d must stand for each directory or for none"},
+        {"images -d a -d b", "-d takes an alias, once for each directory"},
+        {"images h/ -d", "-d takes an alias, once for each directory"},
+        {"chart h/ --color=blue", "--color takes always, never or auto, not blue"},
+        {"needed-by h/ 1",
+         "needed-by takes a timestamp such as 20250111010000 or '2025-01-11 01:00:00', not 1"},
+        {"load nosuch", "cannot open the directory: No such file or directory, nosuch", 1},
+        {"load in", "not a directory, in", 1},
+        {"images h/ --have nosuch",
+         "cannot read the history: the directory holds no history file, h/", 3},
+    };
+    for (const auto& row : rows) {
+        const std::string said = run(row.arguments);
+        EXPECT_EQ(std::string("zq3hist: ").append(row.report), said.substr(0, said.find('\n')));
+        EXPECT_EQ(row.status, said[said.size() - 2] - '0') << said;
+    }
+    EXPECT_TRUE(fs::is_empty(directory));
+    EXPECT_FALSE(fs::exists(root + "nosuch"));
+}
+
 TEST_F(ProgramTest, LoadingADumpGivesTheSameRecords)
 {
     std::mt19937 random(7);
@@ -268,6 +304,10 @@ TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)
     EXPECT_EQ("zq3hist: the lock is held by process " + std::to_string(getpid()) +
                   " and was left alone, h/\n[4]",
               run("unlock h/"));
+    EXPECT_EQ("zq3hist: waiting for the lock, which process " + std::to_string(getpid()) +
+                  " holds\nzq3hist: the lock is held by process " + std::to_string(getpid()) +
+                  ", h/\n[4]",
+              run("load --wait 1 h/", week));
     sqloNLCKKeepFile(&lock, historyPath.c_str());
     sembuf step = {0, 1, 0};
     pid_t meddler = fork();
