@@ -72,6 +72,13 @@ struct heldLock {
 static heldLock heldLocks[64];
 static pthread_mutex_t heldLocksMutex = PTHREAD_MUTEX_INITIALIZER;
 
+static void leaveSlot(heldLock* held)
+{
+    if (held->file != -1)
+        close(held->file);
+    *held = {{-1, -1}, 0, -1};
+}
+
 static void beforeFork()
 {
     pthread_mutex_lock(&heldLocksMutex);
@@ -85,11 +92,9 @@ static void afterForkInParent()
 // A child holds nothing: the file must not stay locked when the parent dies before it.
 static void afterForkInChild()
 {
-    for (heldLock& held : heldLocks) {
-        if (held.thread != 0 && held.file != -1)
-            close(held.file);
-        held.thread = 0;
-    }
+    for (heldLock& held : heldLocks)
+        if (held.thread != 0)
+            leaveSlot(&held);
     pthread_mutex_unlock(&heldLocksMutex);
 }
 
@@ -98,19 +103,33 @@ __attribute__((constructor)) static void watchForks()
     pthread_atfork(beforeFork, afterForkInParent, afterForkInChild);
 }
 
-// The lock's slot; with a null lock a free one. Null when there is none. The mutex is held.
+// The lock's slot, or null. The mutex is held.
 static heldLock* findHeld(const SQLO_NLCK* lock)
 {
     for (heldLock& held : heldLocks)
-        if (lock == nullptr ? held.thread == 0 : held.thread != 0 && held.lock.id == lock->id)
+        if (held.thread != 0 && held.lock.id == lock->id)
             return &held;
+    return nullptr;
+}
+
+// A slot that is free, or whose lock was taken away; null when there is none. The mutex is held.
+static heldLock* findFree(void)
+{
+    for (heldLock& held : heldLocks)
+        if (held.thread == 0)
+            return &held;
+    for (heldLock& held : heldLocks)
+        if (sqloNLCKCheckHeld(&held.lock) != 0) {
+            leaveSlot(&held);
+            return &held;
+        }
     return nullptr;
 }
 
 static void enterHeld(const SQLO_NLCK* lock)
 {
     pthread_mutex_lock(&heldLocksMutex);
-    heldLock* held = findHeld(nullptr);
+    heldLock* held = findFree();
     if (held != nullptr)
         *held = {*lock, pthread_self(), -1};
     pthread_mutex_unlock(&heldLocksMutex);
@@ -120,10 +139,8 @@ static void forgetHeld(const SQLO_NLCK* lock)
 {
     pthread_mutex_lock(&heldLocksMutex);
     heldLock* held = findHeld(lock);
-    if (held != nullptr && held->file != -1)
-        close(held->file);
     if (held != nullptr)
-        held->thread = 0;
+        leaveSlot(held);
     pthread_mutex_unlock(&heldLocksMutex);
 }
 

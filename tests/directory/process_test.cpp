@@ -248,6 +248,14 @@ TEST_F(LockTest, ALockIsHeldAlsoWithoutItsPlaceInTheTable)
     whole.l_type = F_WRLCK;
     for (const SQLO_NLCK& held : all)
         EXPECT_EQ(0, sqloNLCKCheckHeld(&held));
+    // The places of those that somebody takes away are used again.
+    for (size_t i = 0; i < all.size(); i++)
+        EXPECT_EQ(0, i % 2 == 0 ? sqloNLCKUnlock(&all[i]) : semctl(all[i].id, 0, IPC_RMID));
+    for (SQLO_NLCK& again : all) {
+        ASSERT_EQ(0, sqloNLCKLock(&again, 0, 0));
+        told -= sqloNLCKCheckDeadlock(&again) == sqloNLCKDeadlock;
+    }
+    EXPECT_EQ(0u, told);
     for (SQLO_NLCK& held : all)
         EXPECT_EQ(0, sqloNLCKUnlock(&held));
     const int file = ::open(historyPath.c_str(), O_RDWR);
