@@ -49,8 +49,11 @@ static constexpr size_t markLength = 8;
 int osseWriteDurably(int descriptor, const void* buffer, size_t count, off_t offset);
 
 // Barriers; nothing happens while ZQ3SYNC is "off". osseSyncDirectoryOf takes the path of a file,
-// osseSyncMode makes a changed mode durable, too.
+// osseSyncMode makes a changed mode durable, too, osseSyncUnlessDurable leaves out a file, of this
+// status, that the thread has just made durable, with no write and no open since.
 int osseSync(int descriptor);
+int osseSyncUnlessDurable(int descriptor, const struct stat* status);
+void osseForgetDurable(void);
 int osseSyncMode(int descriptor);
 int osseSyncDirectoryOf(const char* path);
 

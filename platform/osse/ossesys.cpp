@@ -68,9 +68,19 @@ int osseReadAt(int descriptor, void* buffer, size_t count, off_t offset, size_t*
     return 0;
 }
 
+// The file that this thread has made durable last, as it was then; it has written and opened
+// nothing since.
+static thread_local struct stat durable;
+
+void osseForgetDurable(void)
+{
+    durable = {};
+}
+
 int osseWriteAt(int descriptor, const void* buffer, size_t count, off_t offset, size_t* done)
 {
     *done = 0;
+    osseForgetDurable();
     while (*done < count) {
         const size_t left = count - *done < maxTransfer ? count - *done : maxTransfer;
         const ssize_t put = pwrite(descriptor, static_cast<const char*>(buffer) + *done, left,
@@ -108,9 +118,22 @@ int osseWriteDurably(int descriptor, const void* buffer, size_t count, off_t off
 // written data once, and a second sync may succeed without it.
 int osseSync(int descriptor)
 {
-    if (barriersAreOff() || fdatasync(descriptor) == 0)
+    if (barriersAreOff())
         return 0;
-    return storeFailure(errno);
+    if (fdatasync(descriptor) != 0)
+        return storeFailure(errno);
+    if (fstat(descriptor, &durable) != 0)
+        durable = {};
+    return 0;
+}
+
+int osseSyncUnlessDurable(int descriptor, const struct stat* status)
+{
+    const bool isDurable = status->st_ino == durable.st_ino && status->st_dev == durable.st_dev &&
+                           status->st_size == durable.st_size &&
+                           status->st_ctim.tv_sec == durable.st_ctim.tv_sec &&
+                           status->st_ctim.tv_nsec == durable.st_ctim.tv_nsec;
+    return isDurable ? 0 : osseSync(descriptor);
 }
 
 int osseSyncMode(int descriptor)

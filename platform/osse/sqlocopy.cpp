@@ -2,7 +2,7 @@
 //
 // The barriers of a copy, each before what relies on it:
 //
-//   R0  the source                     before the target is emptied
+//   R0  the source, unless B3 has      before the target is emptied
 //   D   the target's name              before there is anything under it
 //   CH  the target's body              before the first bytes that vouch for it
 //   R4  the first bytes, and so all    in one call with their writing
@@ -125,7 +125,8 @@ OSSE_EXPORT int sqlocopy(const char* sourcePath, const char* targetPath, unsigne
     if (buffer == nullptr)
         rc = systemFailure(ENOMEM);
     if (rc == 0)
-        rc = osseIsMarked(&from) ? int{sqloFileIncomplete} : osseSync(source); // R0
+        rc = osseIsMarked(&from) ? int{sqloFileIncomplete}
+                                 : osseSyncUnlessDurable(source, &from); // R0
     if (rc == 0)
         rc = checkReadable(source, buffer);
     if (rc == 0)

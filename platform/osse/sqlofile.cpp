@@ -118,6 +118,7 @@ static void refuseUnopened(const char* path, int code)
 OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int permissions,
                           SQLO_FHANDLE* fh)
 {
+    osseForgetDurable();
     *fh = sqloNoFile;
     const int flags = flagsOfWord(options);
     if (flags < 0)
