@@ -71,10 +71,11 @@ int osseReadAt(int descriptor, void* buffer, size_t count, off_t offset, size_t*
 // The file that this thread has made durable last, as it was then; it has written and opened
 // nothing since.
 static thread_local struct stat durable;
+static thread_local bool isDurableKnown;
 
 void osseForgetDurable(void)
 {
-    durable = {};
+    isDurableKnown = false;
 }
 
 int osseWriteAt(int descriptor, const void* buffer, size_t count, off_t offset, size_t* done)
@@ -122,15 +123,14 @@ int osseSync(int descriptor)
         return 0;
     if (fdatasync(descriptor) != 0)
         return storeFailure(errno);
-    if (fstat(descriptor, &durable) != 0)
-        durable = {};
+    isDurableKnown = fstat(descriptor, &durable) == 0;
     return 0;
 }
 
 int osseSyncUnlessDurable(int descriptor, const struct stat* status)
 {
-    const bool isDurable = status->st_ino == durable.st_ino && status->st_dev == durable.st_dev &&
-                           status->st_size == durable.st_size &&
+    const bool isDurable = isDurableKnown && status->st_ino == durable.st_ino &&
+                           status->st_dev == durable.st_dev && status->st_size == durable.st_size &&
                            status->st_ctim.tv_sec == durable.st_ctim.tv_sec &&
                            status->st_ctim.tv_nsec == durable.st_ctim.tv_nsec;
     return isDurable ? 0 : osseSync(descriptor);
