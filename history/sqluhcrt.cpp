@@ -15,22 +15,6 @@ static void initialHeader(SQLUH_HEADER* header)
     memcpy(header->timestamp, SQLUH_EMPTY_TIMESTAMP, timestampWidth);
 }
 
-// Writes the header, first as that of a file that nobody takes for sound. N: from then on the two
-// differ in the first sector only, so that the device keeps either the one or the other.
-static int writeFirstHeader(SQLO_FHANDLE fh, const char* operation)
-{
-    SQLUH_HEADER header;
-    initialHeader(&header);
-    header.status = statusPending;
-    int rc = logged(sqluhWriteHeader(fh, &header), operation);
-    if (rc == 0)
-        rc = logged(sqlosync(fh), operation);
-    header.status = statusConsistent;
-    if (rc == 0)
-        rc = logged(sqluhWriteHeader(fh, &header), operation);
-    return rc;
-}
-
 int sqluhCreate(char* directory)
 {
     pdtEntry1(directory, strlen(directory));
@@ -38,6 +22,7 @@ int sqluhCreate(char* directory)
     char historyPath[createPathCapacity] = {};
     char shadowPath[createPathCapacity] = {};
     SQLO_FHANDLE fh = sqloNoFile;
+    SQLUH_HEADER header;
     int rc = 0;
 
     if (strlen(directory) > maxCreateDirectoryLength) {
@@ -48,11 +33,13 @@ int sqluhCreate(char* directory)
         rc = logged(createdCode(sqloopenp(historyPath, sqloOpenNew, sqloPermissions, &fh)));
     }
     if (rc == 0) {
-        rc = writeFirstHeader(fh, __func__);
+        initialHeader(&header);
+        rc = logged(sqluhWriteHeader(fh, &header));
         bool written = rc == 0;
         rc = firstOf(rc, logged(sqloclose(fh)));
         // The shadow comes into being as the copy of a complete history file, never before it. The
-        // open and the copy make the two names durable (D).
+        // open and the copy make the two names durable (D), the write keeps a part of a header from
+        // passing for one (N).
         if (written)
             rc = firstOf(rc, logged(sqlocopy(historyPath, shadowPath, 0)));
     }

@@ -79,7 +79,8 @@ int sqloread(SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* bytesRead)
 
 // Writes count bytes at the current position and moves it past them. Returns 0 only when all were
 // written, DISK_FULL when there was no space, or sqloSystemError; *bytesWritten holds the number
-// written in every case.
+// written in every case. What is written first to a new file gets its first 8 bytes last, after the
+// others are durable, or none at all.
 int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* bytesWritten);
 
 // Move the position to offset from origin (start, current, end), also past the end of the file;

@@ -25,6 +25,7 @@ struct openFile {
     off_t bufferStart;   // where in the file the buffer begins
     size_t bufferLength; // bytes in it; 0: nothing is buffered
     size_t readAhead;    // bytes asked for by the last refill
+    bool isNew;          // opened to be made anew, and nothing is written yet
 };
 
 static std::atomic<openFile*> openFiles[4096];
@@ -66,12 +67,13 @@ static int flagsOfWord(unsigned int options)
 }
 
 // Enters a descriptor into the table, whose property it then is.
-static int enterFile(int descriptor, SQLO_FHANDLE* fh)
+static int enterFile(int descriptor, bool isNew, SQLO_FHANDLE* fh)
 {
     openFile* file = static_cast<openFile*>(calloc(1, sizeof *file));
     if (file == nullptr)
         return systemFailure(ENOMEM);
     file->descriptor = descriptor;
+    file->isNew = isNew;
 
     int rc = systemFailure(EMFILE);
     pthread_mutex_lock(&openFilesMutex);
@@ -137,7 +139,7 @@ OSSE_EXPORT int sqloopenp(const char* path, unsigned int options, unsigned int p
     if (rc == 0 && (flags & O_CREAT) != 0)
         rc = osseSyncDirectoryOf(path);
     if (rc == 0)
-        rc = enterFile(descriptor, fh);
+        rc = enterFile(descriptor, options == sqloOpenNew, fh);
     if (rc != 0 && descriptor >= 0)
         close(descriptor);
     return rc;
@@ -237,6 +239,20 @@ OSSE_EXPORT int sqloread(SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t
     return rc;
 }
 
+// Writes what a new file begins with as a copy does, the first bytes last: the device may keep the
+// sectors of a header in any order, and a part of one must not pass for it.
+static int writeNew(int descriptor, const unsigned char* bytes, size_t count, size_t* done)
+{
+    size_t put;
+    int rc = osseWriteAt(descriptor, bytes + markLength, count - markLength, markLength, &put);
+    if (rc == 0)
+        rc = osseSync(descriptor); // N
+    if (rc == 0)
+        rc = osseWriteAt(descriptor, bytes, markLength, 0, &put);
+    *done = rc == 0 ? count : 0;
+    return rc;
+}
+
 OSSE_EXPORT int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count,
                           uint32_t* bytesWritten)
 {
@@ -247,7 +263,11 @@ OSSE_EXPORT int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count,
 
     size_t done;
     file->bufferLength = 0;
-    const int rc = osseWriteAt(file->descriptor, buffer, count, file->position, &done);
+    const bool begins = file->isNew && file->position == 0 && count > markLength;
+    const int rc =
+        begins ? writeNew(file->descriptor, static_cast<const unsigned char*>(buffer), count, &done)
+               : osseWriteAt(file->descriptor, buffer, count, file->position, &done);
+    file->isNew = false;
     file->position += static_cast<off_t>(done);
     *bytesWritten = static_cast<uint32_t>(done);
     return rc;

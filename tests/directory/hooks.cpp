@@ -206,7 +206,7 @@ extern "C" int rename(const char* path, const char* newPath) noexcept
 static std::string barrierName(int fd, bool withMode)
 {
     const auto ofBatch = [](const diskOp& op) { return op.barrier.starts_with('B'); };
-    if (service == "sqlosync" && disk.log.size() > 1 && disk.log.end()[-2].kind == diskNames)
+    if (service == "sqlowrite")
         return "N";
     if (service == "sqlosync" && disk.replacing)
         return "RP";
