@@ -302,33 +302,3 @@ TEST_F(ReaderTest, SomebodyElsesLockIsLeftAsItIs)
     EXPECT_EQ(held.id, stale.id);
     EXPECT_EQ(held.pid, stale.pid);
 }
-
-TEST_F(ReaderTest, ReadersThatAreEndedLeaveNothing)
-{
-    Files files = filesOf(" 10/ 10");
-    for (auto& [name, bytes] : files)
-        for (int i = 0; i < 200; i++)
-            bytes += samples[10].substr(headerLength);
-    store(files);
-    nextTick();
-    const std::string states = statesOf(historyPath) + statesOf(shadowPath);
-    unsigned int seed = 1;
-    for (int i = 0; i < 300; i++) {
-        const pid_t reader = inAProcess([&] {
-            SQLUH_COMMITTED* committed = nullptr;
-            while (sqluhReadCommitted(directory.c_str(), &committed) >= 0)
-                sqluhFreeCommitted(&committed);
-            return false;
-        });
-        const timespec time = {0, rand_r(&seed) % 3000 * 1000};
-        nanosleep(&time, nullptr);
-        const int signals[] = {SIGKILL, SIGINT, SIGPIPE};
-        kill(reader, signals[i % 3]);
-        int status = 0;
-        waitpid(reader, &status, 0);
-        EXPECT_TRUE(WIFSIGNALED(status)) << "it ended by itself";
-        ASSERT_TRUE(lockKeyIsFree(historyPath)) << "after " << i;
-    }
-    EXPECT_EQ(states, statesOf(historyPath) + statesOf(shadowPath));
-    EXPECT_TRUE(files == load());
-}
