@@ -50,6 +50,7 @@ install(FILES man/libsqluhist.3 DESTINATION ${CMAKE_INSTALL_MANDIR}/man3)
 install(FILES man/zq3rhist.5 man/zq3hist-json.5 DESTINATION ${CMAKE_INSTALL_MANDIR}/man5)
 install(FILES docs/installed.md DESTINATION ${CMAKE_INSTALL_DOCDIR} RENAME README.md)
 install(FILES docs/troubleshooting.md docs/chart.svg DESTINATION ${CMAKE_INSTALL_DOCDIR})
+install(FILES CHANGES.md DESTINATION ${CMAKE_INSTALL_DOCDIR} RENAME NEWS.md)
 install(DIRECTORY examples DESTINATION ${CMAKE_INSTALL_DOCDIR})
 foreach(program zq3ckrst zq3hist)
   install(FILES completion/${program}.bash

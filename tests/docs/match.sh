@@ -49,24 +49,24 @@ same "messages of zq3ckrst(1)" \
   "$(sed -nE 's/^\.It Li (\\&)?([^\\]*[^\\ ]).* Pq \\(-[0-9]+)[,;] (.*)/\3 \2, \4/p' man/zq3ckrst.1 |
     sed 's/ Ar [^,]*,/,/; s/ and /, /' |
     while IFS=', ' read -r code rest; do
-      for site in $(grep -oP '\d+' <<<"$rest"); do echo "$code $site ${rest%%,*}"; done
+      grep -oP '\d+' <<<"$rest" | sed "s/.*/$code & ${rest%%,*}/"
     done)"
 mapfile -t texts < <(grep -oP '= \{"\K[^"%\\]*' <<<"$messages" | sed 's/ *$//')
 holds man/zq3ckrst.1 "${texts[@]}"
 holds docs/troubleshooting.md "${texts[@]}"
 same "exit statuses in zq3ckrst(1)" \
   "$(grep -oP '^    \w+ = -\K\d+(?=,)' tool/zq3ckrst.h | while read -r code; do
-    echo $((256 - code)) -$code; done)" \
+    echo "$((256 - code)) -$code"; done)" \
   "$(grep -oP '^\.It \K\d+ Ta \\-\d+' man/zq3ckrst.1 | sed 's/ Ta \\/ /')"
 
 # zq3hist: the commands with their arguments as the help text gives them, and the fields of stanzas.
 help=$("$zq3hist" --help)
 same "commands of zq3hist(1)" \
   "$(grep -oP '^  \K[a-z][a-z-]* +[A-Z. \[\]]+(?= )' <<<"$help" | tr -s ' ' | sed 's/ $//' |
-    tr a-z A-Z)" \
+    tr '[:lower:]' '[:upper:]')" \
   "$(mandoc -Tascii -Owidth=1000 man/zq3hist.1 | sed "s,.\x08,,g" | sed '/^DESCRIPTION/q' |
     grep -oP '^ {5}zq3hist \K[a-z-]+ \[option \.\.\.\].*' | sed 's/ \[option \.\.\.\]//; s/ \.\.\./.../' |
-    tr a-z A-Z)"
+    tr '[:lower:]' '[:upper:]')"
 commands=$(grep -oP '^  \K[a-z][a-z-]*(?= +[A-Z])' <<<"$help")
 mapfile -t words < <(echo "$commands"; echo "$help" | grep -oP '^  \K--[a-z-]+'
   for command in $commands; do "$zq3hist" help "$command" | grep -oP '^  \K--[a-z-]+'; done | sort -u)
@@ -90,7 +90,7 @@ headerFields() {
   local at=0 bits member count width
   while read -r bits member count; do
     image[$member]=${image[at]}
-    image[at]=$((image[at] + ${bits:-8} / 8 * ${count:-1}))
+    image[at]=$((image[at] + ${bits:-8} * ${count:-1} / 8))
   done < <(sed -n '/^struct SQLUH_HEADER {/,/^}/p' history/sqluhist.h |
     sed -nE 's/^    char /    uint8_t /; s/^    uint([0-9]+)_t (\w+)(\[([0-9]+)\])?;.*/\1 \2 \4/p')
   while read -r width member; do

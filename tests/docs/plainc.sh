@@ -6,7 +6,7 @@ failures=0
 for file; do
   needed=$(readelf -d "$file" | grep -oP 'NEEDED.*\[\K[^]]+') # nothing: no such file
   [[ $needed == *libc.so* && ! $needed =~ libstdc|libc\+\+|libgcc ]] && continue
-  echo "$file needs" $needed
+  echo "$file needs ${needed//$'\n'/ }"
   failures=$((failures + 1))
 done
 exit $((failures > 0))
