@@ -10,11 +10,12 @@
 // Quiet. Nobody wrote while they were read: afterwards both files, by descriptor and by path, have
 // the device, inode, size and change time that they had at first, and at first those times were
 // older than the clock that the system takes them from. A later write gets a time that is not older
-// than that clock, and gets it before its bytes can be seen, so it cannot hide. What can hide is a
-// single write that the system had begun before: of the pair's writes only those of a header and of
-// the last bytes of a copy matter then, and a header of which a part is seen does not pass its
-// checksum; so what seems unusable is looked at again. A clock that is set takes the proof away,
-// and the read is made again.
+// than that clock, and gets it before its bytes can be seen, so it cannot hide; nor can it where
+// the clock was set back and has not come to those times again. What can hide is a single write
+// that the system had begun before: of the pair's writes only those of a header and of the last
+// bytes of a copy matter then, and a header of which a part is seen does not pass its checksum; so
+// what seems unusable is looked at again. A clock that is set takes the proof away, and the read is
+// made again.
 //
 // Where that cannot be proven (a writer that commits without pause, a file system whose times are
 // not this system's own), the files are read under the lock.
@@ -55,6 +56,7 @@ struct pairRead {
     lookedFile history, shadow;
     timespec clock;  // when it began: what the system stamps files with
     timespec offset; // of that clock from the one that is never set
+    int refusal;     // why the shadow could not be looked at; 0: it could
     bool foreign;    // the times of a file are not this system's own
     SQLUH_COMMITTED* result;
 };
@@ -113,13 +115,17 @@ static void readClocks(timespec* clock, timespec* offset)
     *offset = difference(*clock, steady);
 }
 
-// A time without nanoseconds may be of a file system that counts whole seconds.
-static bool isOlder(const lookedFile* file, const timespec& clock)
+// Whether a write from the beginning until now would have given the file another time. One without
+// nanoseconds may be of a file system that counts whole seconds.
+static bool isSettled(const lookedFile* file, const timespec& beginning, timespec now)
 {
     timespec changed = file->status.st_ctim;
+    now.tv_sec += 2;
+    if (file->fh.descriptor == sqloNoFile.descriptor || isEarlier(now, changed))
+        return true;
     if (changed.tv_nsec == 0)
         changed.tv_sec += 2;
-    return !file->present || isEarlier(changed, clock);
+    return isEarlier(changed, beginning);
 }
 
 // --- The two files -------------------------------------------------------------------------------
@@ -169,6 +175,8 @@ static bool nobodyWrote(const pairRead* read)
     timespec offset;
     bool unchanged = isAsItWas(&read->history) && isAsItWas(&read->shadow);
     readClocks(&clock, &offset);
+    unchanged = unchanged && isSettled(&read->history, read->clock, clock) &&
+                isSettled(&read->shadow, read->clock, clock);
     return unchanged && isSameTime(offset, read->offset) && !isEarlier(clock, read->clock);
 }
 
@@ -284,6 +292,8 @@ static int readSecond(pairRead* read, SQLUH_WORKAREA* workArea)
 static int readChosen(pairRead* read)
 {
     sqluhRepair due = sqluhDecideRepair(read->history.state, read->shadow.state);
+    if (due == sqluhRepairAnew && read->refusal != 0)
+        return read->refusal;
     if (due == sqluhRepairAnew)
         return read->history.present || read->shadow.present ? HISTORY_FILE_DAMAGED
                                                              : HISTORY_FILE_MISSING;
@@ -313,13 +323,14 @@ static void endRead(pairRead* read)
     sqluhFreeCommitted(&read->result);
 }
 
-// Begins a read: the clocks first, then the files.
+// Begins a read: the clocks first, then the files. A history file that can be read does without a
+// shadow that cannot be looked at.
 static int beginRead(pairRead* read)
 {
     readClocks(&read->clock, &read->offset);
     int rc = openToLook(&read->history);
-    int second = openToLook(&read->shadow);
-    return rc != 0 ? rc : second;
+    read->refusal = openToLook(&read->shadow);
+    return rc;
 }
 
 // Reads the pair and proves that nobody wrote. *proven: what comes back counts.
@@ -328,8 +339,8 @@ static int readQuietly(pairRead* read, bool* proven)
     int rc = beginRead(read);
     *proven = rc != 0;
     read->foreign = !hasOwnTimes(&read->history) || !hasOwnTimes(&read->shadow);
-    if (rc == 0 && !read->foreign && isOlder(&read->history, read->clock) &&
-        isOlder(&read->shadow, read->clock)) {
+    if (rc == 0 && !read->foreign && isSettled(&read->history, read->clock, read->clock) &&
+        isSettled(&read->shadow, read->clock, read->clock)) {
         rc = readChosen(read);
         *proven = nobodyWrote(read);
     }
@@ -471,7 +482,9 @@ static int readEitherWay(pairRead* read)
     int rc = readUnlocked(read, &done);
     clock_gettime(CLOCK_MONOTONIC, &start);
     now = start;
-    while (!done && now.tv_sec - start.tv_sec < lockSeconds) {
+    // Who holds the lock may give it back, and writers may pause; nothing else is waited for.
+    while (!done && now.tv_sec - start.tv_sec < lockSeconds &&
+           !(read->foreign && rc < 0 && rc != sqloNLCKBusy)) {
         endRead(read);
         rc = readLocked(read, &done);
         if (!done) {

@@ -40,6 +40,9 @@ int osseOpenRegular(const char* path, int flags, mode_t permissions, int* descri
 int osseReadAt(int descriptor, void* buffer, size_t count, off_t offset, size_t* done);
 int osseWriteAt(int descriptor, const void* buffer, size_t count, off_t offset, size_t* done);
 
+// Appends to a log in one write. One that may not grow must not end the process by a signal.
+ssize_t osseAppend(int descriptor, const void* bytes, size_t count);
+
 // A file's first bytes are what a reader recognises it by; they are written last. Few, so that what
 // a device writes at once holds all of them, whatever the size of its sectors.
 static constexpr size_t markLength = 8;

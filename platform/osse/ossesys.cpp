@@ -3,6 +3,7 @@
 #include "osse.h"
 
 #include <climits>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -94,6 +95,22 @@ int osseWriteAt(int descriptor, const void* buffer, size_t count, off_t offset, 
             return storeFailure(errno);
     }
     return 0;
+}
+
+ssize_t osseAppend(int descriptor, const void* bytes, size_t count)
+{
+    sigset_t limit, before, pending;
+    sigemptyset(&limit);
+    sigaddset(&limit, SIGXFSZ);
+    sigpending(&pending);
+    pthread_sigmask(SIG_BLOCK, &limit, &before);
+    const ssize_t written = write(descriptor, bytes, count);
+    if (written < 0 && errno == EFBIG && sigismember(&pending, SIGXFSZ) == 0) {
+        const timespec none = {};
+        sigtimedwait(&limit, nullptr, &none);
+    }
+    pthread_sigmask(SIG_SETMASK, &before, nullptr);
+    return written;
 }
 
 static bool barriersAreOff()

@@ -116,7 +116,7 @@ static void deliver(const osseText* record, int level)
     if (path != nullptr && *path != '\0') {
         const int descriptor = osseOpen(path, O_WRONLY | O_APPEND | O_CREAT, 0640);
         if (descriptor >= 0) {
-            const ssize_t written = write(descriptor, record->data, record->length);
+            const ssize_t written = osseAppend(descriptor, record->data, record->length);
             close(descriptor);
             if (written > 0)
                 return;

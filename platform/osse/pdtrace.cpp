@@ -70,7 +70,7 @@ static void writeTrace(const char* function, const char* event, const traceData&
         addDigits(&record, static_cast<const unsigned char*>(with.data), with.size);
     osseTextEnd(&record);
     // A trace that cannot be written is lost; there is nobody to tell.
-    [[maybe_unused]] const ssize_t ignored = write(traceDescriptor, record.data, record.length);
+    osseAppend(traceDescriptor, record.data, record.length);
     errno = number;
 }
 

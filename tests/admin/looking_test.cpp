@@ -66,7 +66,8 @@ static const struct {
      "exec unshare -m sh -ec 'mount --bind SAMPLE SAMPLE; mount -o remount,ro,bind SAMPLE; "
      "exec \"$@\"' sh \"$@\"",
      nullptr},
-    {"no descriptor for a second file", "", "ulimit -n 4; exec \"$@\"", "Too many open files"},
+    {"no descriptor for the shadow", "", "ulimit -n 4; exec \"$@\"", nullptr},
+    {"no right to read the shadow", "chmod 0 h/*.bak", WITHOUT_PRIVILEGE, nullptr},
 };
 
 TEST_F(LookTest, ReadingNeedsNothingButTheRightToRead)

@@ -194,7 +194,8 @@ static const struct {
 } doubts[] = {
     {"nothing", "C12/ 10", 12, 0, 0, 0, false, 0, 1, false},
     {"clock set forward", "C12/ 10", 12, 0, 3600, 0, false, 0, 2, false},
-    {"clock set back", "C12/ 10", 12, 0, -3600, 0, false, 0, 5, true},
+    {"clock set back", "C12/ 10", 12, 0, -3600, 0, false, 0, 2, false},
+    {"clock set back before", "C12/ 10", 12, 0, 0, -3600, false, 0, 1, false},
     {"written in this tick", " 10/C12", 10, -3600, 0, 0, false, 0, 2, false},
     {"whole seconds, just written", "C12/ 10", 12, 0, 0, 1, false, 0, 5, true},
     {"whole seconds", "C12/ 10", 12, 0, 0, 4, false, 0, 1, false},

@@ -410,6 +410,15 @@ TEST_F(osse, LimitsOfTheProcessAreTold)
                       rc = sqloopenp(file.c_str(), 0x14, 0640, &fh);
                   return rc == (failed | EMFILE);
               }));
+    // A log that may not grow ends nobody.
+    EXPECT_EQ(0, inChild([&] {
+                  const rlimit none = {0, RLIM_INFINITY};
+                  const pdItem item = {pdKindText, "text", 0, nullptr, 0};
+                  setenv("ZQ3DIAGLOG", (directory + "log").c_str(), 1);
+                  setrlimit(RLIMIT_FSIZE, &none);
+                  pdLog("f", pdLevelError, &item, 1);
+                  return true;
+              }));
 #ifndef __SANITIZE_ADDRESS__
     // What may only not have been looked at for want of memory stays where it is.
     EXPECT_EQ(0, inChild([&] {
