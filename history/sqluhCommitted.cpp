@@ -39,7 +39,7 @@ enum : int {
     doubtfulLooks = 3, // reads that find damage before it is believed
     lockSeconds = 5,   // for how long the lock is asked for
 };
-enum : long { pauseNanoseconds = 2000000, lockPauseNanoseconds = 200000 };
+enum : long { lockPauseNanoseconds = 200000 };
 
 // One of the two files during a read.
 struct lookedFile {
@@ -74,6 +74,14 @@ static bool isShortage(int rc)
         if (rc == systemCode(number))
             return true;
     return false;
+}
+
+// Lets the clock go on that the system stamps files with.
+static void pauseForATick(void)
+{
+    timespec tick = {};
+    if (clock_getres(CLOCK_REALTIME_COARSE, &tick) == 0)
+        nanosleep(&tick, nullptr);
 }
 
 static void pause(long nanoseconds)
@@ -468,7 +476,7 @@ static int readUnlocked(pairRead* read, bool* done)
             tries = 0;
         }
         if (!*done)
-            pause(pauseNanoseconds);
+            pauseForATick();
     }
     return rc;
 }

@@ -90,14 +90,15 @@ static int readHeaderText(SQLO_FHANDLE fh, char* buffer, const char* operation)
     return partial ? HISTORY_FILE_DAMAGED : loggedPlain(transferCode(rc), operation);
 }
 
-// Where the writer puts fields 1 to 13.
+// Where the writer puts the fields before the status letter.
+enum : unsigned int { fieldsBeforeStatus = 13 };
 struct headerPlaces {
-    formatPlace field[13];
+    formatPlace field[fieldsBeforeStatus];
 };
 static constexpr headerPlaces placesOfHeader(void)
 {
     headerPlaces places = {};
-    for (unsigned int i = 0; i < 13; i++)
+    for (unsigned int i = 0; i < fieldsBeforeStatus; i++)
         places.field[i] = placeInFormat(headerFormat, i);
     return places;
 }

@@ -3,6 +3,7 @@
 
 #include "history/sqluhRows.h"
 
+#include <cerrno>
 #include <new>
 
 #include "history/sqluhDiagnostics.h"
@@ -97,7 +98,7 @@ static int reserveRow(sqluhRows* rows)
     void* block = rows->rows;
     uint32_t capacity = rows->capacity == 0 ? 64 : rows->capacity * 2;
     int rc = capacity < rows->capacity
-                 ? sqloSystemError | 12 // ENOMEM
+                 ? sqloSystemError | ENOMEM
                  : sqloMemBlockReallocate(&block, size_t{capacity} * sizeof(sqluhRow*), 0, __FILE__,
                                           __LINE__);
     if (rc == 0) {
@@ -159,7 +160,7 @@ static int shareNames(sqluhRows* rows, const SQLUH_ENTRY* entry, const SQLUH_WOR
             return rc;
         uint32_t length = proven->tailAt - proven->tablespacesAt;
         uint32_t sum = sqluhChecksum(lines, length);
-        const sqluhNameList** known = &rows->lists[(sum ^ sum >> 16 ^ sum >> 8) % 64];
+        const sqluhNameList** known = &rows->lists[(sum ^ sum >> 16 ^ sum >> 8) % recentLists];
         if (!listsSame(*known, lines, length, count))
             *known = makeNames(rows, lines, length, count, &rc);
         rows->lastNames = *known;

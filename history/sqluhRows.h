@@ -7,6 +7,8 @@ struct sqluhRow;
 struct sqluhNameList;
 struct sqluhChunk;
 
+enum : unsigned int { recentLists = 64 };
+
 struct sqluhRows {
     sqluhRow** rows;
     uint32_t count;
@@ -15,7 +17,7 @@ struct sqluhRows {
     sqluhChunk* chunks;      // what the rows stand in
     // What neighbouring entries share, most often: the list of names and the event.
     const sqluhNameList* lastNames;
-    const sqluhNameList* lists[64]; // those met of late, by the checksum of their lines
+    const sqluhNameList* lists[recentLists]; // those met of late, by the checksum of their lines
     const sqlca* lastEvent;
     char lastEventLine[sqlcaLineLength];
 };

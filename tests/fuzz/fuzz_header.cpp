@@ -6,7 +6,7 @@
 #include "memoryfile.h"
 
 // Puts the checksum that the header asks for over its first characters, so that mutations reach
-// what lies behind the test. Only the image of the plain reading is tried.
+// what comes after the test. Only the image of the plain reading is tried.
 static void stamp(char* text)
 {
     SQLUH_HEADER header;
