@@ -113,59 +113,65 @@ static inline bool takeHeaderColumns(const char* text, unsigned int field, uint3
            hexColumns(text + place.at + place.width - headerNumberWidth, number);
 }
 
-// Fields 1 to 13 of a header as the writer writes it; false for any other.
-static bool takeHeaderFields(const char* text, SQLUH_HEADER* header)
+// Fields 1 to 13 of a header, as either way of reading takes them.
+struct firstFields {
+    unsigned int checksum;
+    unsigned long long offsets[3];
+    unsigned int numbers[7];
+    unsigned short node;
+    char status;
+};
+
+// Takes the fields of a header as the writer writes it; false for any other.
+static bool takeFirstFields(const char* text, firstFields* fields)
 {
-    uint32_t numbers[12];
+    uint32_t low[fieldsBeforeStatus - 1];
     uint32_t high[3];
     bool taken = true;
-    for (unsigned int field = 0; field < 12; field++)
-        taken &= takeHeaderColumns(text, field, &numbers[field]);
+    for (unsigned int field = 0; field < fieldsBeforeStatus - 1; field++)
+        taken &= takeHeaderColumns(text, field, &low[field]);
     for (unsigned int i = 0; i < 3; i++)
         taken &= hexColumns(text + places.field[i + 1].at, &high[i]);
     if (!taken)
         return false;
-    header->checksum = numbers[0];
-    header->offset1 = uint64_t{high[0]} << 32 | numbers[1];
-    header->offset2 = uint64_t{high[1]} << 32 | numbers[2];
-    header->offset3 = uint64_t{high[2]} << 32 | numbers[3];
-    header->entryCount = numbers[4];
-    header->number6 = numbers[5];
-    header->number7 = numbers[6];
-    header->number8 = numbers[7];
-    header->number9 = numbers[8];
-    header->number10 = numbers[9];
-    header->number11 = numbers[10];
-    header->nodeNumber = static_cast<uint16_t>(numbers[11]);
-    header->status = text[places.field[12].at];
+    fields->checksum = low[0];
+    for (unsigned int i = 0; i < 3; i++)
+        fields->offsets[i] = uint64_t{high[i]} << 32 | low[i + 1];
+    for (unsigned int i = 0; i < 7; i++)
+        fields->numbers[i] = low[i + 4];
+    fields->node = static_cast<unsigned short>(low[11]);
+    fields->status = text[places.field[12].at];
     return true;
 }
 
-// The same, however they stand. What a damaged text leaves out stays zero: the checksum tells.
-static void scanHeaderFields(const char* text, SQLUH_HEADER* header)
+// The same, however they stand. What a damaged text leaves out is zero: the checksum tells.
+static void scanFirstFields(const char* text, firstFields* fields)
 {
-    unsigned long long offsets[3] = {};
-    unsigned int checksum = 0;
-    unsigned int numbers[7] = {};
-    unsigned short node = 0;
-    char status = '\0';
+    *fields = {};
+    sscanf(text, headerScanFormat, &fields->checksum, &fields->offsets[0], &fields->offsets[1],
+           &fields->offsets[2], &fields->numbers[0], &fields->numbers[1], &fields->numbers[2],
+           &fields->numbers[3], &fields->numbers[4], &fields->numbers[5], &fields->numbers[6],
+           &fields->node, &fields->status);
+}
 
-    sscanf(text, headerScanFormat, &checksum, &offsets[0], &offsets[1], &offsets[2], &numbers[0],
-           &numbers[1], &numbers[2], &numbers[3], &numbers[4], &numbers[5], &numbers[6], &node,
-           &status);
-    header->checksum = checksum;
-    header->offset1 = offsets[0];
-    header->offset2 = offsets[1];
-    header->offset3 = offsets[2];
-    header->entryCount = numbers[0];
-    header->number6 = numbers[1];
-    header->number7 = numbers[2];
-    header->number8 = numbers[3];
-    header->number9 = numbers[4];
-    header->number10 = numbers[5];
-    header->number11 = numbers[6];
-    header->nodeNumber = node;
-    header->status = status;
+static void takeHeaderFields(const char* text, SQLUH_HEADER* header)
+{
+    firstFields fields;
+    if (!takeFirstFields(text, &fields))
+        scanFirstFields(text, &fields);
+    header->checksum = fields.checksum;
+    header->offset1 = fields.offsets[0];
+    header->offset2 = fields.offsets[1];
+    header->offset3 = fields.offsets[2];
+    header->entryCount = fields.numbers[0];
+    header->number6 = fields.numbers[1];
+    header->number7 = fields.numbers[2];
+    header->number8 = fields.numbers[3];
+    header->number9 = fields.numbers[4];
+    header->number10 = fields.numbers[5];
+    header->number11 = fields.numbers[6];
+    header->nodeNumber = fields.node;
+    header->status = fields.status;
 }
 
 // A number as the writer writes it, or as strtoul takes it.
@@ -201,8 +207,7 @@ static int parseHeader(SQLO_FHANDLE fh, const char* text, SQLUH_HEADER* header,
                        const char* operation)
 {
     memset(header, 0, sizeof *header);
-    if (!takeHeaderFields(text, header))
-        scanHeaderFields(text, header);
+    takeHeaderFields(text, header);
     uint32_t maxCommandAt = takeVersionedFields(text, header);
     if (text[maxCommandAt] != ' ') {
         header->maxCommandLength = headerNumber(text + maxCommandAt, 16);
