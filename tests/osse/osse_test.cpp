@@ -592,7 +592,9 @@ TEST_F(osse, TraceAndNodeNumberComeFromTheEnvironment)
                                                "* f checksum 0x42ADBEEF\n* f bytes " +
                                                digits +
                                                " (128 of 200 bytes shown)\n* f removed\n"
-                                               "* memory refused \"18446744073709551615 bytes for "
+                                               "* memory refused \"" +
+                                               std::to_string(SIZE_MAX) +
+                                               " bytes for "
                                                "here.cpp:7\"\n* f exit 1 (0x00000001) 0x01\n"
                                                "* f exit -2161 (0xFFFFF78F)\n");
 }
