@@ -135,7 +135,8 @@ extern "C" {
 
 // Opens a scan of one database's recovery history and fills numRows, maxTablespaces and handle.
 //
-// The history is only read: no lock is left, nothing is repaired, a writer is not waited for.
+// The history is only read: no lock is left, nothing is repaired. A writer is waited for only where
+// reads cannot be proven (he commits without pause, or the file system is foreign), some seconds.
 //
 // openStruct: a zq3HistoryOpenStruct. SQLCODEs: 0; 2162 the history file could not be used and its
 // shadow was read; 2163 one of the two has a damaged entry and the other one was read; or, with no
