@@ -2,26 +2,6 @@
 
 #include <cstring>
 
-static void putQuoted(FILE* out, const char* text, size_t length)
-{
-    putc('"', out);
-    for (size_t i = 0; i < length; i++) {
-        unsigned char c = static_cast<unsigned char>(text[i]);
-        if (c == '"' || c == '\\')
-            fprintf(out, "\\%c", c);
-        else if (c < 0x20 || c > 0x7E)
-            fprintf(out, "\\u%04X", c);
-        else
-            putc(c, out);
-    }
-    putc('"', out);
-}
-
-void putJsonText(FILE* out, const char* text, size_t length)
-{
-    putQuoted(out, text, length);
-}
-
 static void putPlace(jsonWriter* json, const char* key)
 {
     if (json->comma)
@@ -60,7 +40,17 @@ void endJsonLine(jsonWriter* json)
 void putJsonBytes(jsonWriter* json, const char* key, const char* text, size_t length)
 {
     putPlace(json, key);
-    putQuoted(json->out, text, length);
+    putc('"', json->out);
+    for (size_t i = 0; i < length; i++) {
+        unsigned char c = static_cast<unsigned char>(text[i]);
+        if (c == '"' || c == '\\')
+            fprintf(json->out, "\\%c", c);
+        else if (c < 0x20 || c > 0x7E)
+            fprintf(json->out, "\\u%04X", c);
+        else
+            putc(c, json->out);
+    }
+    putc('"', json->out);
 }
 
 void putJsonText(jsonWriter* json, const char* key, const char* text)

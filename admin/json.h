@@ -27,6 +27,3 @@ void putJsonBytes(jsonWriter* json, const char* key, const char* text, size_t le
 void putJsonText(jsonWriter* json, const char* key, const char* text); // terminated; null: null
 void putJsonNumber(jsonWriter* json, const char* key, long long number);
 void putJsonBool(jsonWriter* json, const char* key, bool value);
-
-// The bare text, for what still minds its commas by itself.
-void putJsonText(FILE* out, const char* text, size_t length);
