@@ -42,6 +42,11 @@ bool queryLock(const historyPlace* place, SQLO_NLCK* lock, SQLO_NLCKSTATE* state
            sqloNLCKQuery(lock, state) == 0;
 }
 
+bool isLeftByDead(const SQLO_NLCKSTATE* state)
+{
+    return state->state == sqloNLCKStale || state->state == sqloNLCKSetupDied;
+}
+
 // Those that would end the process.
 static void fatalSignals(sigset_t* set)
 {
@@ -93,10 +98,21 @@ static long long milliseconds(void)
     return now.tv_sec * 1000LL + now.tv_nsec / 1000000;
 }
 
+void describeHolder(const SQLO_NLCKSTATE* state, char* text)
+{
+    snprintf(text, holderCapacity,
+             state->state == sqloNLCKHeld ? "the lock is held by process %d"
+             : state->state == sqloNLCKFaked
+                 ? "the lock's holder lives, though process %d freed the lock"
+                 : "the lock is just being taken by process %d",
+             state->pid);
+}
+
 int awaitLock(const historyPlace* place, int rights)
 {
     SQLO_NLCK lock = {};
     SQLO_NLCKSTATE state = {};
+    char holder[holderCapacity];
     bool told = false;
     const long long start = milliseconds();
     if (!hasHistoryFile(place) && !ossPathExists(place->shadowPath))
@@ -105,18 +121,19 @@ int awaitLock(const historyPlace* place, int rights)
     if (rc != 0)
         return rc;
     while (queryLock(place, &lock, &state)) {
-        if (state.state == sqloNLCKSetupDied || state.state == sqloNLCKStale)
+        if (isLeftByDead(&state))
             return failInPlace(sqloNLCKOwnerDied, "take the lock", place);
         if (state.state == sqloNLCKForeign)
             return failInPlace(sqloNLCKKeyConflict, "take the lock", place);
         if (state.state == sqloNLCKAbsent)
             break;
+        describeHolder(&state, holder);
         if (place->wait >= 0 && milliseconds() - start >= place->wait * 1000LL) {
-            fail(place->directory, "the lock is held by process %d", state.pid);
+            fail(place->directory, "%s", holder);
             return exitLocked;
         }
         if (!told)
-            fprintf(stderr, "zq3hist: waiting for the lock, which process %d holds\n", state.pid);
+            fprintf(stderr, "zq3hist: waiting: %s\n", holder);
         told = true;
         usleep(50 * 1000);
     }

@@ -113,6 +113,7 @@ static int takeEntries(const historyPlace* place, SQLUH_COMMITTED* history, imag
     int numBackups = 0;
     int rc = 0;
     catalog->numEntries = history->numRows;
+    catalog->isCut = history->numRows < history->header.entryCount;
     if (!allocateFacts(&read) ||
         fetchFromSource(&source, nullptr, &catalog->history, &numBackups) != 0)
         rc = failWithCode(sqloSystemError | ENOMEM, "read the history", place->directory);
@@ -256,6 +257,14 @@ int findImage(const imageCatalog* catalog, const char* timestamp)
             orderOfTimestamps(catalog->history.entries[i].timestamp, timestamp) == 0)
             return i;
     return -1;
+}
+
+int newestImage(const imageCatalog* catalog)
+{
+    int i = catalog->history.numEntries - 1;
+    while (i >= 0 && !isImage(&catalog->history.entries[i]))
+        i--;
+    return i;
 }
 
 int failNoImage(const historyPlace* place, const char* timestamp)

@@ -32,6 +32,7 @@ struct imageCatalog {
     int numUnused;
     uint32_t numEntries;                 // of the history, those that do not matter included
     bool renamesCount;                   // the planner looks at renames
+    bool isCut;                          // it ends before the last entry that its header counts
     char (*onHand)[timestampLength + 1]; // the images that are there, sorted; null: all are
     size_t numOnHand;
 };
@@ -51,8 +52,10 @@ bool isOnHand(const imageCatalog* catalog, const historyEntry* image);
 const char* kindOfImage(const historyEntry* image);  // full, incremental, delta
 const char* scopeOfImage(const historyEntry* image); // database, tablespace
 
-// The position of the newest image with that timestamp; -1: none.
+// The position of the image that the planner takes for the timestamp, or of the newest one; -1:
+// none.
 int findImage(const imageCatalog* catalog, const char* timestamp);
+int newestImage(const imageCatalog* catalog);
 
 // Complains that there is none and returns exitNoImage.
 int failNoImage(const historyPlace* place, const char* timestamp);

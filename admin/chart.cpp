@@ -110,15 +110,18 @@ int chartMain(commandLine* line)
 {
     imageCatalog catalog = {};
     imageChart chart = {};
-    char timestamp[timestampLength + 1];
+    char timestamp[timestampLength + 1] = "latest";
     bool colored = false;
+    bool isLatest = line->numArguments > 0 && strcmp(line->arguments[0], timestamp) == 0;
     int target = -1;
     int rc = takeColor(line->color, &colored);
-    if (rc == 0 && line->numArguments > 0)
+    if (rc == 0 && line->numArguments > 0 && !isLatest)
         rc = takeInstant("chart", line->arguments[0], timestamp);
     if (rc == 0)
         rc = readCatalog(&line->place, nullptr, &catalog);
-    if (rc == 0 && line->numArguments > 0)
+    if (rc == 0 && isLatest)
+        target = newestImage(&catalog);
+    else if (rc == 0 && line->numArguments > 0)
         target = findImage(&catalog, timestamp);
     if (rc == 0 && line->numArguments > 0 && target < 0)
         rc = failNoImage(&line->place, timestamp);

@@ -102,7 +102,7 @@ static void checkLock(checkReport* report)
 {
     if (!report->lockKnown)
         return;
-    if (report->lock.state == sqloNLCKStale || report->lock.state == sqloNLCKSetupDied)
+    if (isLeftByDead(&report->lock))
         addProblem(report, exitLocked, "process %d died while it held the lock", report->lock.pid);
     else if (report->lock.state == sqloNLCKForeign)
         addProblem(report, exitLocked, "another program's semaphore set has the lock's key");
@@ -230,8 +230,9 @@ static void showCheckLine(const checkReport* report)
     }
     if (report->walked) {
         const char* newest = newestRestorable(report);
-        printf("%s%u entries, %d images, %d incomplete", separator, report->catalog.numEntries,
-               report->walk.numImages, report->walk.numIncomplete);
+        printf("%s%u %s, %d image%s, %d incomplete", separator, report->catalog.numEntries,
+               entryWord(report->catalog.numEntries), report->walk.numImages,
+               report->walk.numImages == 1 ? "" : "s", report->walk.numIncomplete);
         if (newest != nullptr)
             printf("; newest that can be restored: %s, %ld hours old", newest, report->ageHours);
     }

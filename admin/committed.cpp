@@ -25,10 +25,9 @@ static bool warnOfLock(const historyPlace* place)
     SQLO_NLCK lock = {};
     SQLO_NLCKSTATE state = {};
     bool held = queryLock(place, &lock, &state);
-    if (held && (state.state == sqloNLCKStale || state.state == sqloNLCKSetupDied)) {
+    if (held && isLeftByDead(&state)) {
         warn(place, "a process died while it held the lock, which stops the next writer");
-        hint(place, "zq3hist unlock DIR && zq3hist repair DIR  # removes the lock, then settles "
-                    "what was left unfinished");
+        hint(place, unlockAdvice);
     }
     return held && state.state == sqloNLCKHeld;
 }

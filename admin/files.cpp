@@ -83,6 +83,13 @@ static void endProgress(const progressBar* bar)
 
 // --- Entries -------------------------------------------------------------------------------------
 
+void prepareRoom(entryRoom* room)
+{
+    *room = {};
+    room->data.objectPart = {room->objectPart, sizeof room->objectPart, 0};
+    room->entry.data = &room->data;
+}
+
 void addToReport(entriesReport* report, const SQLUH_ENTRY* entry)
 {
     const zq3HistoryData* data = entry->data;
@@ -103,22 +110,19 @@ void addToReport(entriesReport* report, const SQLUH_ENTRY* entry)
 void readAllEntries(SQLO_FHANDLE file, SQLUH_WORKAREA* workArea, const char* progress,
                     entriesReport* report)
 {
-    char objectPart[zq3ObjectPartCapacity] = {};
-    zq3HistoryData data = {};
-    data.objectPart = {objectPart, sizeof objectPart, 0};
-    SQLUH_ENTRY entry = {};
-    entry.data = &data;
-    SQLUH_ENTRYWALK walk = {file, &entry, workArea, headerLength, false};
+    entryRoom room;
+    SQLUH_ENTRYWALK walk = {file, &room.entry, workArea, headerLength, false};
     long long end = 0;
     progressBar bar;
     *report = {};
+    prepareRoom(&room);
     int rc = sqloseek(file, 0, sqloFromEnd, &end);
     if (rc == 0)
         rc = sqluhRewind(file, nullptr);
     startProgress(&bar, progress, end);
     while (rc == 0 && (rc = sqluhNextEntry(&walk)) == 0) {
         report->offset = walk.offset;
-        addToReport(report, &entry);
+        addToReport(report, &room.entry);
         moveProgress(&bar, walk.offset);
     }
     endProgress(&bar);

@@ -186,7 +186,7 @@ static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport*
         addToReport(totals, &record->entry);
         header->entryCount = totals->count;
         totals->offset += record->entry.size;
-        if (isSignalHeld())
+        if (rc == 0 && isSignalHeld())
             rc = loadInterrupted;
     }
     setTotals(header, totals);
@@ -225,7 +225,7 @@ static int failBatch(const historyPlace* place, int rc)
         return fail(place->directory, "interrupted; nothing was appended");
     if (rc == loadOutdated)
         return fail(place->directory, "the history changed meanwhile; load the file again");
-    return rc == 0 ? 0 : failInPlace(rc, "append to the history", place);
+    return failInPlace(rc, "append to the history", place);
 }
 
 static int runBatch(historyPlace* place, historyList* list, const uint32_t* known)
@@ -304,7 +304,7 @@ static void tellLoaded(const commandLine* line, size_t appended, size_t given)
         endJsonLine(&json);
         return;
     }
-    printf("%zu entries %sappended", appended, line->dryRun ? "would be " : "");
+    printf("%zu %s %sappended", appended, entryWord(appended), line->dryRun ? "would be " : "");
     if (line->skipExisting)
         printf(", %zu that %s there left out", given - appended, line->dryRun ? "are" : "were");
     puts("");

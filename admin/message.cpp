@@ -110,6 +110,11 @@ void hint(const historyPlace* place, const char* advice)
     fprintf(stderr, "%s\n", advice);
 }
 
+const char* entryWord(unsigned long long count)
+{
+    return count == 1 ? "entry" : "entries";
+}
+
 // --- Codes ---------------------------------------------------------------------------------------
 
 // What a code means, and what an administrator does about it.
@@ -128,8 +133,7 @@ static constexpr explanation explanations[] = {
      "ls -ld DIR DIR/" SQLUH_HISTORY_NAME "  # it may be missing or out of reach"},
     {sqloNLCKKeyConflict, exitLocked, "another program's semaphore set has the lock's key",
      "zq3hist status DIR; ipcs -s  # show the key, and the owner of the set with it"},
-    {sqloNLCKOwnerDied, exitLocked, "a process died while it held the lock",
-     "zq3hist unlock DIR && zq3hist repair DIR  # removes the lock and settles what is unfinished"},
+    {sqloNLCKOwnerDied, exitLocked, "a process died while it held the lock", unlockAdvice},
     {sqloNLCKBusy, exitLocked, "the lock is held by another process", nullptr},
     {sqloNLCKLost, exitLocked, "the lock was taken away meanwhile", nullptr},
     {sqloFileIncomplete, exitDamaged, "the image was not restored to its end",

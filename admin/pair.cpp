@@ -108,15 +108,17 @@ int examinePair(const historyPlace* place, bool withProgress, pairFinding* pair)
     return rc == 0 ? 0 : failWithCode(rc, "read the history", place->directory);
 }
 
-// A file that is changed gets a change time that is not older than the coarse clock.
+// A file that is changed gets a change time that is not older than the coarse clock, nor later: one
+// that is later was written before the clock was set back.
 static bool isQuiet(const char* path, const struct stat* before, const timespec* clock)
 {
     struct stat now = {};
     stat(path, &now);
     const timespec& changed = before->st_ctim;
-    bool isOlder = changed.tv_sec < clock->tv_sec ||
-                   (changed.tv_sec == clock->tv_sec && changed.tv_nsec < clock->tv_nsec);
-    return isOlder && now.st_ino == before->st_ino && now.st_size == before->st_size &&
+    bool isOther = changed.tv_sec != clock->tv_sec ? changed.tv_sec < clock->tv_sec ||
+                                                         changed.tv_sec > clock->tv_sec + 2
+                                                   : changed.tv_nsec < clock->tv_nsec;
+    return isOther && now.st_ino == before->st_ino && now.st_size == before->st_size &&
            now.st_ctim.tv_sec == changed.tv_sec && now.st_ctim.tv_nsec == changed.tv_nsec;
 }
 
@@ -156,8 +158,7 @@ void hintAboutPair(const historyPlace* place, const pairFinding* pair)
 {
     SQLO_NLCK lock = {};
     SQLO_NLCKSTATE state = {};
-    bool locked = queryLock(place, &lock, &state) &&
-                  (state.state == sqloNLCKStale || state.state == sqloNLCKSetupDied);
+    bool locked = queryLock(place, &lock, &state) && isLeftByDead(&state);
     // A file that is not delivered may be sound: whoever replaces it may lose entries.
     if (pair->refused)
         hint(place, "zq3hist verify DIR  # again, once the reason that is given is gone");
@@ -167,8 +168,7 @@ void hintAboutPair(const historyPlace* place, const pairFinding* pair)
         hint(place, "zq3hist restore DIR FILE  # FILE: a backup; without one, zq3hist repair "
                     "--force DIR goes on with what can be read");
     else if (locked)
-        hint(place, "zq3hist unlock DIR && zq3hist repair DIR  # removes the dead process's lock "
-                    "and settles what it left");
+        hint(place, unlockAdvice);
     else if (pair->due == sqluhRepairShadow)
         hint(place, "zq3hist repair DIR  # makes the shadow anew from the history file");
     else if (pair->due == sqluhRepairHistory)

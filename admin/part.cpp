@@ -56,19 +56,16 @@ static int copyEntry(partWriter* writer, const SQLUH_ENTRY* entry, long long fro
 static int copyEntries(partWriter* writer, partFilter filter, const void* context,
                        partReport* report)
 {
-    char objectPart[zq3ObjectPartCapacity] = {};
-    zq3HistoryData data = {};
-    data.objectPart = {objectPart, sizeof objectPart, 0};
-    SQLUH_ENTRY entry = {};
-    entry.data = &data;
-    SQLUH_ENTRYWALK walk = {writer->source, &entry, &writer->workArea, headerLength, false};
+    entryRoom room;
+    SQLUH_ENTRYWALK walk = {writer->source, &room.entry, &writer->workArea, headerLength, false};
     int rc = 0;
+    prepareRoom(&room);
     if (writer->source.descriptor == sqloNoFile.descriptor || writer->header.version == 0)
         return 0;
     while (rc == 0 && (rc = sqluhNextEntry(&walk)) == 0) {
         report->total++;
-        if (filter == nullptr || filter(context, &data))
-            rc = copyEntry(writer, &entry, walk.offset);
+        if (filter == nullptr || filter(context, &room.data))
+            rc = copyEntry(writer, &room.entry, walk.offset);
     }
     report->complete = rc == END_OF_FILE && !walk.cutShort;
     return rc == END_OF_FILE || rc == HISTORY_FILE_DAMAGED ? 0 : rc;

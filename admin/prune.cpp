@@ -94,21 +94,20 @@ static bool stays(const void* context, const zq3HistoryData* entry)
 // What pruning would come to.
 static int rehearsePruning(const historyPlace* place, const prunePlan* plan, partReport* part)
 {
-    char objectPart[zq3ObjectPartCapacity] = {};
-    zq3HistoryData data = {};
-    data.objectPart = {objectPart, sizeof objectPart, 0};
-    SQLUH_ENTRY entry = {};
-    entry.data = &data;
+    entryRoom room;
     SQLUH_COMMITTED* committed = nullptr;
     int rc = readCommitted(place, &committed);
+    prepareRoom(&room);
     if (rc != 0)
         return rc;
     if (committed->failure != 0)
         rc = failDamaged(place, committed, "prune the history");
+    else if (committed->numRows < committed->header.entryCount)
+        rc = failInPlace(HISTORY_FILE_DAMAGED, "prune the history", place);
     for (uint32_t row = 0; rc == 0 && row < committed->numRows; row++) {
-        sqluhGetCommitted(committed, row, &entry, false);
+        sqluhGetCommitted(committed, row, &room.entry, false);
         part->total++;
-        part->kept += stays(plan, &data);
+        part->kept += stays(plan, &room.data);
     }
     sqluhFreeCommitted(&committed);
     return rc;

@@ -81,15 +81,17 @@ static int repairPair(commandLine* line, SQLUH_HANDLE* handle, repairReport* rep
 static void showReport(const repairReport* report, bool dryRun)
 {
     const char* is = dryRun ? "would be" : "was";
+    const char* entries = entryWord(report->count);
     if (report->done == sqluhRepairNone)
-        printf("Nothing to repair: both files hold the same %u entries\n", report->count);
+        printf("Nothing to repair: both files hold the same %u %s\n", report->count, entries);
     else if (report->done == sqluhRepairAnew)
-        printf("Neither file is whole; a history of what can be read %s made: %u entries\n", is,
-               report->count);
+        printf("Neither file is whole; a history of what can be read %s made: %u %s\n", is,
+               report->count, entries);
     else
-        printf("The %s %s made anew from the %s: %u entries\n",
+        printf("The %s %s made anew from the %s: %u %s\n",
                report->done == sqluhRepairShadow ? "shadow" : "history file", is,
-               report->done == sqluhRepairShadow ? "history file" : "shadow", report->count);
+               report->done == sqluhRepairShadow ? "history file" : "shadow", report->count,
+               entries);
     tellKept(&report->kept);
 }
 

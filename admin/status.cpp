@@ -79,8 +79,8 @@ static void showFile(const char* title, const char* name, const fileReport* file
     }
     fputs("status '", stdout);
     putEscaped(stdout, &file->header.status, 1);
-    printf("' (%s), %u entries, newest ", statusWords(file->header.status, isShadow),
-           file->header.entryCount);
+    printf("' (%s), %u %s, newest ", statusWords(file->header.status, isShadow),
+           file->header.entryCount, entryWord(file->header.entryCount));
     putEscaped(stdout, file->header.timestamp, timestampWidth);
     printf(" at offset %llu, node %u\n", static_cast<unsigned long long>(file->header.offset3),
            file->header.nodeNumber);
@@ -147,11 +147,10 @@ static void showStatusJson(const historyPlace* place, const directoryReport* rep
 
 static void hintAfter(const historyPlace* place, const directoryReport* report)
 {
-    int state = report->lockState.state;
-    if (report->lockKnown && (state == sqloNLCKStale || state == sqloNLCKSetupDied))
-        hint(place, "zq3hist unlock DIR && zq3hist repair DIR  # removes the lock and settles what "
-                    "is unfinished");
-    else if (report->due != sqluhRepairNone && !(report->lockKnown && state == sqloNLCKHeld))
+    if (report->lockKnown && isLeftByDead(&report->lockState))
+        hint(place, unlockAdvice);
+    else if (report->due != sqluhRepairNone &&
+             !(report->lockKnown && report->lockState.state == sqloNLCKHeld))
         hint(place, "zq3hist verify DIR  # reads both files and tells what mends them");
 }
 

@@ -69,9 +69,10 @@ static void tellReplaced(const historyPlace* place, uint32_t count, const char* 
 {
     fileReport there;
     lookAtFile(place->historyPath, &there);
-    printf("%u entries %s%s\n", count, dryRun ? "would be " : "", done);
+    printf("%u %s %s%s\n", count, entryWord(count), dryRun ? "would be " : "", done);
     if (dryRun && there.rc == 0 && there.header.entryCount != 0)
-        printf("The %u entries that are there would be kept\n", there.header.entryCount);
+        printf("What is there would be kept: %u %s\n", there.header.entryCount,
+               entryWord(there.header.entryCount));
     tellKept(kept);
 }
 
@@ -162,6 +163,20 @@ static int nameBackup(const char* temporary, const char* path)
     return rc;
 }
 
+// Makes an empty file that only this user may touch, for what goes to standard output: the lock must
+// not be held until somebody has read it.
+static int formPrivate(char* path)
+{
+    const char* folder = getenv("TMPDIR");
+    int length = snprintf(path, pathCapacity, "%s/zq3histXXXXXX",
+                          folder != nullptr && *folder ? folder : "/tmp");
+    int descriptor = length < static_cast<int>(pathCapacity) ? mkstemp(path) : -1;
+    if (descriptor < 0)
+        return failWithCode(sqloSystemError | errno, "make a temporary file", path);
+    close(descriptor);
+    return 0;
+}
+
 static int writeOut(const char* path)
 {
     char buffer[64 * 1024];
@@ -180,14 +195,14 @@ int backupMain(commandLine* line)
 {
     historyPlace* place = &line->place;
     const char* path = line->arguments[0];
-    const char* folder = getenv("TMPDIR");
     bool toOutput = strcmp(path, "-") == 0;
-    char temporary[pathCapacity], where[pathCapacity];
+    char temporary[pathCapacity] = "";
     uint32_t count = 0;
-    snprintf(where, sizeof where, "%s/zq3hist", folder != nullptr && *folder ? folder : "/tmp");
     int rc = toOutput ? 0 : checkBackupName(place, path, line->force);
-    if (rc == 0)
-        rc = formTemporary(toOutput ? where : path, temporary);
+    if (rc == 0 && toOutput && !line->dryRun)
+        rc = formPrivate(temporary);
+    else if (rc == 0)
+        rc = formTemporary(path, temporary);
     if (rc != 0)
         return rc;
     if (line->dryRun) {
@@ -204,7 +219,7 @@ int backupMain(commandLine* line)
             unlink(temporary);
     }
     if (rc == 0)
-        fprintf(toOutput ? stderr : stdout, "%u entries %sbacked up\n", count,
+        fprintf(toOutput ? stderr : stdout, "%u %s %sbacked up\n", count, entryWord(count),
                 line->dryRun ? "would be " : "");
     return rc;
 }

@@ -1,11 +1,6 @@
 // zq3hist unlock: removes the locks that dead processes left, and no other.
 #include "admin/zq3hist.h"
 
-static bool isDead(const SQLO_NLCKSTATE* state)
-{
-    return state->state == sqloNLCKStale || state->state == sqloNLCKSetupDied;
-}
-
 static void tellRemoved(const SQLO_NLCKSTATE* state)
 {
     puts(state->state == sqloNLCKStale
@@ -21,7 +16,7 @@ static int unlockAll(void)
     int index = 0, removed = 0, left = 0;
     int rc = 0;
     while ((rc = sqloNLCKNext(&index, &lock, &state)) == 0) {
-        bool isGone = isDead(&state) && sqloNLCKRemoveDead(&lock, &state) == 0;
+        bool isGone = isLeftByDead(&state) && sqloNLCKRemoveDead(&lock, &state) == 0;
         removed += isGone;
         left += !isGone && state.state != sqloNLCKAbsent;
         if (isGone)
@@ -29,20 +24,6 @@ static int unlockAll(void)
     }
     printf("%d locks removed, %d left alone\n", removed, left);
     return rc == END_OF_FILE ? exitDone : failWithCode(rc, "look at the locks", "unlock");
-}
-
-static int failAlive(const historyPlace* place, const SQLO_NLCKSTATE* state)
-{
-    if (state->state == sqloNLCKHeld)
-        fail(place->directory, "the lock is held by process %d and was left alone", state->pid);
-    else if (state->state == sqloNLCKFaked)
-        fail(place->directory,
-             "the lock's holder lives, though process %d freed the lock; it was "
-             "left alone",
-             state->pid);
-    else
-        fail(place->directory, "the lock is just being taken and was left alone");
-    return exitLocked;
 }
 
 int unlockMain(commandLine* line)
@@ -65,8 +46,12 @@ int unlockMain(commandLine* line)
         puts("The lock is free; nothing to remove.");
         return exitDone;
     }
-    if (!isDead(&state))
-        return failAlive(place, &state);
+    if (!isLeftByDead(&state)) {
+        char holder[holderCapacity];
+        describeHolder(&state, holder);
+        fail(place->directory, "%s; it was left alone", holder);
+        return exitLocked;
+    }
     rc = sqloNLCKRemoveDead(&lock, &state);
     if (rc != 0)
         return failInPlace(rc, "remove the lock", place);

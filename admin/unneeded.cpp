@@ -12,7 +12,6 @@ struct markedImages {
     chainWalk walk;
     bool* links; // by link
     bool* marks; // by position
-    int numMarked;
 };
 
 static int readMarked(commandLine* line, markedImages* marked)
@@ -36,12 +35,6 @@ static void freeMarked(markedImages* marked)
     free(marked->marks);
     freeChains(&marked->walk);
     freeCatalog(&marked->catalog);
-}
-
-static void markImage(markedImages* marked, int position)
-{
-    marked->numMarked += !marked->marks[position];
-    marked->marks[position] = true;
 }
 
 // Prints the images that are marked as said, and how many they are.
@@ -78,11 +71,15 @@ static void showMarked(markedImages* marked, const commandLine* line, bool mark,
     }
 }
 
-// Marks what the restores to images from that time on need, and those images themselves.
-static void markNeeded(markedImages* marked, const char* since)
+// Marks what the restores to images from that time on need, and those images themselves. The next
+// image is one of them: what it will be taken on top of is needed, too. False: no image is there.
+static bool markNeeded(markedImages* marked, const char* since)
 {
     const chainWalk* walk = &marked->walk;
     bool any = false;
+    for (int i = 0; i < walk->numTablespaces; i++)
+        if (isAlive(walk, i))
+            marked->links[walk->tablespaces[i].head] = true;
     for (int i = marked->catalog.history.numEntries - 1; i >= 0; i--) {
         const historyEntry* image = &marked->catalog.history.entries[i];
         const imageChains* chains = &walk->images[i];
@@ -91,17 +88,18 @@ static void markNeeded(markedImages* marked, const char* since)
         bool isTarget = strcmp(image->timestamp, since) >= 0;
         any = any || isTarget;
         if (isTarget || (any && chains->numLinks == 0)) // those are in every plan
-            markImage(marked, i);
+            marked->marks[i] = true;
         for (int link = chains->firstLink; link < chains->firstLink + chains->numLinks; link++) {
             marked->links[link] = marked->links[link] || isTarget;
             int next = nextNeeded(walk, link);
             if (!marked->links[link])
                 continue;
-            markImage(marked, i);
+            marked->marks[i] = true;
             if (next >= 0)
                 marked->links[next] = true;
         }
     }
+    return any;
 }
 
 // The timestamp of the oldest of the newest images that can be restored, so many as are to be kept;
@@ -129,11 +127,13 @@ int unneededMain(commandLine* line)
     markedImages marked = {};
     const char* since = line->since;
     int rc = readMarked(line, &marked);
+    if (rc == 0 && marked.catalog.isCut) {
+        fail(line->place.directory, "what the entries need that are missing cannot be told");
+        rc = exitDamaged;
+    }
     if (rc == 0 && line->keep > 0)
         since = oldestKept(&marked, line->keep);
-    if (rc == 0 && since != nullptr)
-        markNeeded(&marked, since);
-    if (rc == 0 && marked.numMarked == 0) {
+    if (rc == 0 && (since == nullptr || !markNeeded(&marked, since))) {
         // Nothing then needs anything, which says nothing about what may go.
         fail(line->place.directory, "no image %s%s",
              since == nullptr ? "can be restored" : "is there from then on: ",
@@ -161,7 +161,7 @@ static void markNeeders(markedImages* marked, int position)
         }
         if (i != position && needs && isImage(&marked->catalog.history.entries[i]) &&
             chains->numIncomplete == 0)
-            markImage(marked, i);
+            marked->marks[i] = true;
     }
 }
 

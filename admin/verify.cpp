@@ -31,7 +31,7 @@ static void showFinding(const char* name, const fileFinding* finding, bool isSha
                header->entryCount);
         break;
     case fileSound:
-        printf("sound, %u entries", entries->count);
+        printf("sound, %u %s", entries->count, entryWord(entries->count));
         if (header->status == statusPending)
             puts(isShadow ? "; the history was made anew from it" : ", and a batch is unfinished");
         else if (header->entryCount != entries->count)

@@ -118,6 +118,10 @@ int failWithCode(int code, const char* what, const char* where);
 // DIR/NAME for a file in it; each is put in as one word for the shell, ready to be typed.
 void hint(const historyPlace* place, const char* advice);
 
+// What to do about a lock that a dead process left.
+inline constexpr char unlockAdvice[] =
+    "zq3hist unlock DIR && zq3hist repair DIR  # removes the lock and settles what is unfinished";
+
 // failWithCode about a history directory, with a hint what to do about the code.
 int failInPlace(int code, const char* what, const historyPlace* place);
 
@@ -126,6 +130,8 @@ int failUsage(const char* format, ...) __attribute__((format(printf, 1, 2)));
 
 // Complains with the subcommand's usage line and returns exitUsage.
 int failForm(const commandLine* line);
+
+const char* entryWord(unsigned long long count); // "entry" or "entries"
 
 // The words for a code of the library. They live until the next call.
 const char* wordsForCode(int code);
@@ -152,6 +158,11 @@ bool hasHistoryFile(const historyPlace* place);
 // The state of the lock, looked at without touching it. False when the directory has no history
 // file to make a key of, or the system does not tell.
 bool queryLock(const historyPlace* place, SQLO_NLCK* lock, SQLO_NLCKSTATE* state);
+bool isLeftByDead(const SQLO_NLCKSTATE* state); // its process died
+
+// Says in words who has a lock that is neither free nor left by the dead.
+enum : unsigned int { holderCapacity = 80 };
+void describeHolder(const SQLO_NLCKSTATE* state, char* text);
 
 // Waits, as long as the place allows, until no living process holds the lock, and says so when it
 // has to; from then on the signals that would end the process are held back until releaseSignals,
@@ -196,6 +207,14 @@ void lookAtFile(const char* path, fileReport* report);
 // What the next open will do about the two files, their sizes included.
 sqluhRepair repairDue(const fileReport* history, const fileReport* shadow);
 sqluhRepair repairDueIn(const historyPlace* place); // looks at both files
+
+// Room for what is read of an entry where its texts do not matter, the time that it tells aside.
+struct entryRoom {
+    char objectPart[zq3ObjectPartCapacity];
+    zq3HistoryData data;
+    SQLUH_ENTRY entry;
+};
+void prepareRoom(entryRoom* room);
 
 // What reading all entries of a file found.
 struct entriesReport {

@@ -138,10 +138,10 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
         const char* output;
         const char* there; // entries in history file, shadow, and files that are kept
     } rows[] = {
-        {"", "load --dry-run h/ more", "1 entries would be appended\n[0]", "3 3"},
-        {"", "load h/ more", "1 entries appended\n[0]", "4 4"},
+        {"", "load --dry-run h/ more", "1 entry would be appended\n[0]", "3 3"},
+        {"", "load h/ more", "1 entry appended\n[0]", "4 4"},
         {"cat more >>in; ", "load --skip-existing h/ more",
-         "1 entries appended, 0 that were there left out\n[0]", "4 4"},
+         "1 entry appended, 0 that were there left out\n[0]", "4 4"},
         {"zq3hist dump h >all; ", "load --skip-existing h/ all",
          "0 entries appended, 3 that were there left out\n[0]", "3 3"},
         {SPOIL("asc", "2000"), "load h/ more",
@@ -202,7 +202,7 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "entries\nzq3hist: process PID is changing the history; what is committed is "
          "sound\n[0]",
          "3 3"},
-        {BEGUN, "unlock h/", "zq3hist: the lock is held by process PID and was left alone, h/\n[4]",
+        {BEGUN, "unlock h/", "zq3hist: the lock is held by process PID; it was left alone, h/\n[4]",
          "3 3"},
         {KILLED, "status h/",
          "history   zq3rhist.asc: 4129 bytes, status 'P' (a batch is unfinished), 3 entries, "
@@ -248,7 +248,7 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "1 3"},
         {"", "backup h/ - >new; cmp new image", "3 entries backed up\n[0]", "3 3"},
         {"zq3hist load h more >new; ", "restore --dry-run h/ image",
-         "3 entries would be restored\nThe 4 entries that are there would be kept\n[0]", "4 4"},
+         "3 entries would be restored\nWhat is there would be kept: 4 entries\n[0]", "4 4"},
         {"zq3hist load h more >new; ", "restore h/ image",
          "3 entries restored\n" KEPT("asc") KEPT("bak") "[0]", "3 3 4 4"},
         {"rm h/*; ", "restore h/ image", "3 entries restored\n[0]", "3 3"},
@@ -454,8 +454,8 @@ TEST_F(ChangeTest, QuestionsAreAnsweredInEveryState)
         {KILLED, 0,
          "zq3hist: warning: a process died while it held the lock, which stops the next writer, "
          "h/\n"
-         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock, then settles "
-         "what was left unfinished\n"
+         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and "
+         "settles what is unfinished\n"
          "zq3hist: warning: a batch is unfinished; the state before it was read, h/\n"},
         {SPOIL("asc", "10"), 0, SHADOW_READ},
         {"rm h/zq3rhist.asc; ", 0, SHADOW_READ},

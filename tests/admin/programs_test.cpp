@@ -302,10 +302,10 @@ TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)
     }
     ASSERT_EQ(0, sqloNLCKLock(&lock, 0, 0));
     EXPECT_EQ("zq3hist: the lock is held by process " + std::to_string(getpid()) +
-                  " and was left alone, h/\n[4]",
+                  "; it was left alone, h/\n[4]",
               run("unlock h/"));
-    EXPECT_EQ("zq3hist: waiting for the lock, which process " + std::to_string(getpid()) +
-                  " holds\nzq3hist: the lock is held by process " + std::to_string(getpid()) +
+    EXPECT_EQ("zq3hist: waiting: the lock is held by process " + std::to_string(getpid()) +
+                  "\nzq3hist: the lock is held by process " + std::to_string(getpid()) +
                   ", h/\n[4]",
               run("load --wait 1 h/", week));
     sqloNLCKKeepFile(&lock, historyPath.c_str());
