@@ -115,11 +115,12 @@ static bool isQuiet(const char* path, const struct stat* before, const timespec*
     struct stat now = {};
     stat(path, &now);
     const timespec& changed = before->st_ctim;
-    bool isOther = changed.tv_sec != clock->tv_sec ? changed.tv_sec < clock->tv_sec ||
-                                                         changed.tv_sec > clock->tv_sec + 2
-                                                   : changed.tv_nsec < clock->tv_nsec;
-    return isOther && now.st_ino == before->st_ino && now.st_size == before->st_size &&
-           now.st_ctim.tv_sec == changed.tv_sec && now.st_ctim.tv_nsec == changed.tv_nsec;
+    bool isEarlier = changed.tv_sec < clock->tv_sec ||
+                     (changed.tv_sec == clock->tv_sec && changed.tv_nsec < clock->tv_nsec);
+    bool isLater = changed.tv_sec > clock->tv_sec + 2;
+    return (isEarlier || isLater) && now.st_ino == before->st_ino &&
+           now.st_size == before->st_size && now.st_ctim.tv_sec == changed.tv_sec &&
+           now.st_ctim.tv_nsec == changed.tv_nsec;
 }
 
 int examineQuietPair(const historyPlace* place, bool withProgress, pairFinding* pair, bool* atWork)

@@ -163,8 +163,8 @@ static int nameBackup(const char* temporary, const char* path)
     return rc;
 }
 
-// Makes an empty file that only this user may touch, for what goes to standard output: the lock must
-// not be held until somebody has read it.
+// Makes an empty file that only this user may touch, for what goes to standard output: the lock
+// must not be held until somebody has read it.
 static int formPrivate(char* path)
 {
     const char* folder = getenv("TMPDIR");

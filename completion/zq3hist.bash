@@ -52,7 +52,7 @@ _zq3hist_argument() {
       ;;
     plan:1 | chart:1 | needed-by:1)
       _zq3hist_timestamps
-      [[ $command == plan ]] && mapfile -t -O ${#COMPREPLY[@]} COMPREPLY < <(compgen -W latest -- "$word")
+      [[ $command != needed-by ]] && mapfile -t -O ${#COMPREPLY[@]} COMPREPLY < <(compgen -W latest -- "$word")
       ;;
     plan:*)
       mapfile -t COMPREPLY < <(compgen -W "$(zq3hist chart --json "${place[@]}" 2>/dev/null |

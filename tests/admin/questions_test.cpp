@@ -56,8 +56,8 @@ static std::string anyHistory(std::mt19937& random, std::string* onHand)
             break;
         default:
             text += stanza("backup", time,
-                           std::string("Type: ") + types[random() % 4] + "\nObject: " +
-                               (random() % 2 == 0 ? "tablespace\n" : "database\n"),
+                           std::string("Type: ") + types[random() % 4] +
+                               "\nObject: " + (random() % 2 == 0 ? "tablespace\n" : "database\n"),
                            some);
         }
         *onHand += random() % 20 != 0 ? std::to_string(time) + "\n" : "";
