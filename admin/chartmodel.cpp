@@ -141,8 +141,9 @@ static void listColumns(chartBuilder* builder, int last)
         if (awaited[i])
             addMissing(builder, i);
         builder->columnOf[i] = chart->numColumns;
-        if (isImage(&entries[i]))
-            chart->columns[chart->numColumns++] = {&entries[i], nullptr, false};
+        if (isImage(&entries[i])) // every plan has one without tablespaces
+            chart->columns[chart->numColumns++] = {&entries[i], nullptr,
+                                                   chart->walk.images[i].numLinks == 0};
     }
 }
 

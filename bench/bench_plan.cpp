@@ -1,5 +1,6 @@
-// The whole command: start, read, plan, report, on small and large histories and on their doubles.
-// If BENCH_EARLIER names the planner of another build, also against that one.
+// The whole command: start, read, plan, report, on small and large histories and on their doubles;
+// and the questions about images, on a year's history, against a plan. If BENCH_EARLIER names the
+// planner of another build, also against that one.
 
 #include "bench/bench.h"
 
@@ -119,6 +120,34 @@ static void addLarge(const std::string& directory, uint32_t entries, uint32_t ta
     rows->push_back({"plan, twice the names", "plan/" + moreNames.size, plan, "2.2"});
 }
 
+// As many entries as hourly images make in a year. A plan of such a history takes a few
+// milliseconds, so these aims are far below what anybody would notice.
+static void addQuestions(const std::string& directory, std::vector<ratioRow>* rows)
+{
+    enum : uint32_t { entries = 8777, tablespaces = 12 };
+    placedHistory year = placeHistory(directory, entries, tablespaces);
+    std::string where = year.file.substr(0, year.file.rfind('/'));
+    std::string plan = "plan/" + year.size;
+    addRun(plan, commandOf(BENCH_PLANNER, year));
+    const std::vector<std::string> questions[] = {
+        {"images", where},
+        {"plan", where, "latest"},
+        {"chart", where},
+        {"chart", where, "--svg", "-"},
+        {"check", where},
+        {"unneeded", where, "--keep", "30"},
+        {"needed-by", where, sampleTimestamp(0)},
+        {"dump", where},
+        {"verify", where},
+    };
+    for (std::vector<std::string> words : questions) {
+        std::string name = "zq3hist " + words[0] + (words.size() > 3 ? " " + words[2] : "");
+        words.insert(words.begin(), BENCH_ASKER);
+        addRun(name, words);
+        rows->push_back({name + ", " + year.size, name, plan, "5"});
+    }
+}
+
 static void prepare(const std::string& directory, std::vector<ratioRow>* rows)
 {
     setenv("ZQ3DBPATH", directory.c_str(), 1);
@@ -131,6 +160,7 @@ static void prepare(const std::string& directory, std::vector<ratioRow>* rows)
     addPlan(different, "1", rows);
     addPlan(placeHistory(directory, 1000, 50), "0.6", rows);
     addPlan(placeHistory(directory, 20, 50), "0.9", rows);
+    addQuestions(directory, rows);
 }
 
 int main(int argc, char** argv)

@@ -2,7 +2,6 @@
 #include <algorithm>
 
 #include "tests/admin/program.h"
-#include "tests/admin/schema.h"
 
 static const char week[] = "Operation: backup\nTimestamp: 20250105010000\nTablespace: A\n\n"
                            "Operation: backup\nType: delta\nTimestamp: 20250106010000\n"
@@ -344,33 +343,6 @@ TEST_F(ChangeTest, FollowedHintsMendTheHistory)
                 << last;
         }
     printf("%d hints followed\n", followed);
-}
-
-TEST_F(ChangeTest, TheJsonIsAsTheManualSays)
-{
-    const std::string entry = "Operation: B\nTablespace: A\nSQLCODE: 1\n";
-    const struct {
-        const char* command;
-        std::vector<std::array<const char*, 2>> calls; // state and arguments
-    } rows[] = {
-        {"dump", {{"", "h/"}, {"rm h/*; zq3hist load h <sqlca >new; ", "h/"}}},
-        {"status", {{"", "h/"}, {"rm h/zq3rhist.asc; ", "h/"}, {SPOIL("bak", "10"), "h/"}}},
-        {"verify", {{"", "h/"}, {CUT("asc", "1803"), "h/"}, {SPOIL("bak", "2000"), "h/"}}},
-        {"repair", {{SPOIL("bak", "2000"), "h/"}, {"", "--dry-run h/"}}},
-        {"load", {{"", "h/ more"}, {"", "--skip-existing h/ more"}}},
-    };
-    spill(root + "sqlca", entry);
-    for (const auto& row : rows) {
-        SCOPED_TRACE(row.command);
-        manualSection section(row.command);
-        for (const auto& [state, arguments] : row.calls) {
-            prepare(state);
-            run(std::string(row.command).append(" --json ").append(arguments));
-            std::istringstream out(slurp(root + "out"));
-            for (std::string line; std::getline(out, line);)
-                section.check(nlohmann::json::parse(line));
-        }
-    }
 }
 
 // What only looks leaves every file as it is, down to its times, and no lock.

@@ -96,6 +96,8 @@ TEST_F(LookTest, ReadingNeedsNothingButTheRightToRead)
         EXPECT_EQ(before, look());
         EXPECT_EQ(0, system(("cd " + root + "; chmod 700 h/; chmod 600 h/*").c_str()));
     }
+    EXPECT_EQ("[1]", run("images h/ >pipe", "", "mkfifo pipe; head -1 pipe >first & "))
+        << "whoever reads only the beginning is not told of it";
 }
 
 TEST_F(LookTest, PlannersThatAreEndedLeaveNothing)
