@@ -66,7 +66,8 @@ static void checkFile(checkReport* report, const char* name, const fileFinding* 
                    finding->file.header.entryCount);
         break;
     case fileSound:
-        if (finding->file.header.entryCount != entries->count)
+        if (finding->file.header.status != statusPending &&
+            finding->file.header.entryCount != entries->count)
             addProblem(report, exitDamaged, "%s holds %u entries and counts %u", name,
                        entries->count, finding->file.header.entryCount);
     }

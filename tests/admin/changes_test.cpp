@@ -1,5 +1,6 @@
 // The subcommands that change a history, on sound pairs and on broken ones.
 #include <algorithm>
+#include <regex>
 
 #include "tests/admin/program.h"
 
@@ -110,7 +111,8 @@ class ChangeTest : public ProgramTest
 
     std::string runStamped(const std::string& arguments)
     {
-        std::string text = run(arguments);
+        std::string text =
+            std::regex_replace(run(arguments), std::regex("[0-9]+ hours old"), "HOURS old");
         std::string process = "process ";
         for (size_t at = 0; (at = text.find(process, at)) != std::string::npos; at++)
             if (size_t digits =
@@ -127,6 +129,8 @@ class ChangeTest : public ProgramTest
 };
 
 #define KEPT(file) "The old file is kept as h/zq3rhist." file ".STAMP\n"
+#define RESTORABLE                                                                                 \
+    ", 3 images, 0 incomplete; newest that can be restored: 20250107010000, HOURS old\n"
 #define FROM_SHADOW "zq3hist: hint: zq3hist repair h/  # takes the entries of the shadow\n[3]"
 
 TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
@@ -214,6 +218,18 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and settles "
          "what is unfinished\n[4]",
          "4 3"},
+        {BEGUN, "check h/", "ok: a process is changing the history; 3 entries" RESTORABLE "[0]",
+         "3 3"},
+        {KILLED, "check h/",
+         "damaged: a batch is unfinished; process PID died while it held the lock; 3 "
+         "entries" RESTORABLE "[3]",
+         "4 3"},
+        {OTHER, "check h/",
+         "damaged: the two files hold different entries; 3 entries" RESTORABLE "[3]", "3 3"},
+        {COMMITTED, "check h/",
+         "damaged: the shadow is to be made anew; 3 entries" RESTORABLE "[3]", "3 3"},
+        {"rm h/*; zq3hist load h /dev/null >new; ", "check h/",
+         "no image: no image can be restored; 0 entries, 0 images, 0 incomplete\n[5]", "0 0"},
         {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "verify h/",
          "zq3rhist.asc: sound, 3 entries\n"
          "zq3rhist.bak: cannot be read at offset 0: Is a directory\n"

@@ -32,8 +32,9 @@ static std::string stanza(const std::string& operation, long long timestamp,
     return text + "\n";
 }
 
-// A history of anything that can happen to four tablespaces.
-static std::string anyHistory(std::mt19937& random, std::string* onHand)
+// A history of anything that can happen to four tablespaces. twice: no renames, but images that
+// list a name twice.
+static std::string anyHistory(std::mt19937& random, std::string* onHand, bool twice = false)
 {
     static const char* const types[] = {"full", "incremental", "delta", "delta"};
     static const std::vector<std::string> names = {"A", "B", "C", "D"};
@@ -41,26 +42,22 @@ static std::string anyHistory(std::mt19937& random, std::string* onHand)
     for (long long time = 20250101000000; time < 20250101000040; time++) {
         std::vector<std::string> some;
         for (const std::string& name : names)
-            if (random() % 3 != 0)
+            for (unsigned long i = random() % 9; i > 2; i = twice && i == 8 ? 3 : 0)
                 some.push_back(name);
-        long long earlier = 20250101000000 + static_cast<long long>(random() % 40);
-        switch (random() % 12) {
-        case 0:
-            text += stanza("restore", time, "Id: " + std::to_string(earlier) + "\n", some);
-            break;
-        case 1:
+        const std::string earlier = std::to_string(20250101000000 + random() % 40);
+        const unsigned long kind = random() % 12;
+        if (kind == 0)
+            text += stanza("restore", time, "Id: " + earlier + "\n", some);
+        else if (kind == 1)
             text += stanza("create tablespace", time, "", {names[random() % 4]});
-            break;
-        case 2:
+        else if (kind == 2 && !twice)
             text +=
                 stanza("rename tablespace", time, "", {names[random() % 4], names[random() % 4]});
-            break;
-        default:
+        else
             text += stanza("backup", time,
                            std::string("Type: ") + types[random() % 4] +
                                "\nObject: " + (random() % 2 == 0 ? "tablespace\n" : "database\n"),
                            some);
-        }
         *onHand += random() % 20 != 0 ? std::to_string(time) + "\n" : "";
     }
     return text;
@@ -83,7 +80,7 @@ TEST_F(QuestionTest, AllAnswersSayWhatThePlansSay)
     int complete = 0, incomplete = 0;
     for (int round = 0; round < 14; round++) {
         std::string onHand;
-        run("load h/", anyHistory(random, &onHand), "rm -f h/*; ");
+        run("load h/", anyHistory(random, &onHand, round % 4 == 2), "rm -f h/*; ");
         spill(root + "have", onHand);
         std::string have = round % 2 == 0 ? "" : " --have have";
         json list = ask("images --json h/" + have);
@@ -99,9 +96,12 @@ TEST_F(QuestionTest, AllAnswersSayWhatThePlansSay)
             (image["complete"] ? complete : incomplete)++;
             std::set<std::string> needed = timestampsOf(plan["images"]);
             if (have.empty() && target >= one) {
-                EXPECT_EQ(timestampsOf(plan["images"]),
-                          timestampsOf(ask("chart --json h/ " + target)["images"]))
-                    << target;
+                json chart = ask("chart --json h/ " + target);
+                EXPECT_EQ(needed, timestampsOf(chart["images"])) << target;
+                std::set<std::string> shown;
+                for (const json& row : chart["rows"])
+                    for (const std::string name : row["tablespaces"])
+                        EXPECT_TRUE(shown.insert(name).second) << target << name;
             }
             if (target >= one)
                 for (const std::string& timestamp : needed)
@@ -322,23 +322,33 @@ TEST_F(QuestionTest, ChartsAreDrawnForTheirPlace)
     } rows[] = {
         {"", "images -d s",
          "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
-         "20250101000000  delta        database              1       1  incomplete: <A>&\\x07 "
-         "lacks a full image\n"
+         "20250101010000  delta        database              3       1  incomplete: <A>&\\x07 "
+         "lacks the image 20241201000000, B lacks a full image, C lacks a full image\n"
          "20250101120000  full         database              0       1  complete\n"
          "20250102000000  full         database              2       2  complete\n"
-         "3 images, 1 incomplete; newest that can be restored: 20250102000000\n"
+         "20250103000000  full         tablespace            2       2  complete\n"
+         "4 images, 1 incomplete; newest that can be restored: 20250103000000\n"
          "[0]"},
-        {"", "plan -d s latest",
+        {"", "plan -d s 20250101010000",
+         "zq3hist: tablespace <A>&\\x07 lacks the image 20241201000000 that was restored, "
+         "20250101010000\n"
+         "zq3hist: tablespace B and 1 more lack a full image, 20250101010000\n"
+         "zq3hist: hint: zq3hist plan ./S/ 20250102000000  # the newest image that can be "
+         "restored\n"
+         "[6]"},
+        {"", "plan S latest",
          "1/2  full         20250101120000\n"
-         "2/2  full         20250102000000  all 2  target\n"
+         "2/2  full         20250103000000  all 2  target\n"
+         "zq3hist: note: 20250103000000 is an image of single tablespaces; the newest one of the "
+         "whole database before it is 20250102000000\n"
          "[0]"},
         {"", "chart --color S",
          "What the newest state needs\n"
          "\n"
          "          2025-01-01\n"
          "          |\n"
-         "<A>&\\x07  \033[2md\033[0m  \033[2m.\033[0m  \033[2m.\033[0m\n"
-         "2 others  \033[2m.\033[0m  \033[2m.\033[0m  \033[1;34mF\033[0m\n"
+         "<A>&\\x07  \033[2md\033[0m  \033[2m.\033[0m  \033[2m.\033[0m  \033[2m.\033[0m\n"
+         "2 others  \033[2md\033[0m  \033[2m.\033[0m  \033[2mf\033[0m  \033[1;34mF\033[0m\n"
          "\n"
          "F I D  needed: full, incremental, delta\n"
          "f i d  not needed\n"
@@ -374,8 +384,11 @@ TEST_F(QuestionTest, ChartsAreDrawnForTheirPlace)
     };
     setenv("ZQ3DBPATH", ".", 1);
     run("load S/",
-        stanza("backup", 20250101000000, "Type: delta\n", {"<A>&\\x07"}) +
-            stanza("backup", 20250101120000, "") + stanza("backup", 20250102000000, "", {"B", "C"}),
+        stanza("restore", 20250101000000, "Id: 20241201000000\n", {"<A>&\\x07"}) +
+            stanza("backup", 20250101010000, "Type: delta\n", {"<A>&\\x07", "B", "C"}) +
+            stanza("backup", 20250101120000, "") +
+            stanza("backup", 20250102000000, "", {"B", "C"}) +
+            stanza("backup", 20250103000000, "Object: tablespace\n", {"B", "C"}),
         "mkdir S; ");
     std::string thirteen = stanza("backup", 20241231000000, "", {"A"});
     for (int hour = 0; hour < 12; hour++)
@@ -385,20 +398,21 @@ TEST_F(QuestionTest, ChartsAreDrawnForTheirPlace)
     for (const auto& row : rows)
         EXPECT_EQ(row.output, run(row.arguments, "", row.before)) << row.arguments;
 
-    EXPECT_EQ("[0]", run("chart --svg picture S"));
+    EXPECT_EQ("[0]", run("chart --svg picture S 20250101010000"));
     const std::string picture = slurp(root + "picture"), bands = "<path d=\"";
-    EXPECT_EQ("<path d=\"M66.5 127v4\"/><text class=\"t\" x=\"66\" y=\"125\">2025-01-01</text>\n"
-              "<path d=\"M154.5 127v4\"/><text class=\"t\" x=\"154\" y=\"125\">01-02</text>\n"
-              "<text class=\"n\" x=\"10\" y=\"143\">&#60;A&#62;&#38;\\x07</text>\n"
-              "<text class=\"n\" x=\"10\" y=\"160\">2 others</text>\n"
-              "<g><title>2025-01-01 00:00:00: delta, database\n"
-              "&#60;A&#62;&#38;\\x07: not needed</title><rect class=\"d\" x=\"66\" y=\"132\" "
-              "width=\"42\" height=\"14\"/><text class=\"ld\" x=\"87.0\" y=\"143\">d</text></g>\n"
-              "<g><title>2025-01-01 12:00:00: full, database</title></g>\n"
-              "<g><title>2025-01-02 00:00:00: full, database\n"
-              "2 others: full, needed</title><rect class=\"F\" x=\"154\" y=\"149\" width=\"42\" "
-              "height=\"14\"/><text class=\"lF\" x=\"175.0\" y=\"160\">F</text></g>\n"
-              "</svg>\n",
+    EXPECT_EQ(R"(<path d="M66.5 127v4"/><text class="t" x="66" y="125">2024-12-01</text>
+<path d="M154.5 127v4"/><text class="t" x="154" y="125">2025-01-01</text>
+<text class="n" x="10" y="143">&#60;A&#62;&#38;\x07</text>
+<text class="n" x="10" y="160">2 others</text>
+<g><title>2024-12-01 00:00:00: missing
+&#60;A&#62;&#38;\x07: missing</title><rect class="M" x="66" y="132" width="42" height="14"/><text class="lM" x="87.0" y="143">?</text></g>
+<g><title>A full image: missing
+2 others: missing</title><rect class="M" x="110" y="149" width="42" height="14"/><text class="lM" x="131.0" y="160">?</text></g>
+<g><title>2025-01-01 01:00:00: delta, database
+&#60;A&#62;&#38;\x07: delta, needed
+2 others: delta, needed</title><rect class="D" x="154" y="132" width="42" height="14"/><text class="lD" x="175.0" y="143">D</text><rect class="D" x="154" y="149" width="42" height="14"/><text class="lD" x="175.0" y="160">D</text></g>
+</svg>
+)",
               picture.substr(picture.find(bands)));
     const std::regex classes("class=\"([^\"]*)\"");
     for (std::sregex_iterator at(picture.begin(), picture.end(), classes), end; at != end; ++at)
