@@ -106,6 +106,8 @@ TEST_F(FunctionalTest, PathsThatDoNotFitAreRefused)
     longest += '/';
     store(filesOf(" 10/ 10"));
     EXPECT_EQ(0, sqluhHandleAllocAndInit(longest.data(), &handle));
+    EXPECT_EQ(longest, handle->directory);
+    EXPECT_EQ(longest + SQLUH_HISTORY_NAME, handle->historyPath);
     EXPECT_EQ(longest + SQLUH_SHADOW_NAME, handle->shadowPath);
     EXPECT_EQ(sqluhPathTooLong, sqluhRecoverFromFatalError(handle));
     sqluhHandleFree(&handle);

@@ -49,20 +49,6 @@ TEST_F(Formats, NewPairOfFilesByteForByteInDirectoriesUpToTheLimit)
     EXPECT_TRUE(std::filesystem::is_empty(deep));
 }
 
-TEST_F(Formats, PathsOfAHandleAreWhollyKeptOrRefused)
-{
-    SQLUH_HANDLE* other = nullptr;
-    std::string longest = std::string(1010, 'd') + "/";
-    ASSERT_EQ(0, sqluhHandleAllocAndInit(longest.data(), &other));
-    EXPECT_EQ(longest, other->directory);
-    EXPECT_EQ(longest + "zq3rhist.asc", other->historyPath);
-    EXPECT_EQ(longest + "zq3rhist.bak", other->shadowPath);
-    sqluhHandleFree(&other);
-    longest += "/";
-    EXPECT_EQ(sqluhPathTooLong, sqluhHandleAllocAndInit(longest.data(), &other));
-    EXPECT_EQ(nullptr, other);
-}
-
 TEST_F(Formats, EveryFieldIsReadAndWrittenByteForByte)
 {
     entryReader r;
