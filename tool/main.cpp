@@ -1,7 +1,9 @@
 // zq3ckrst: the command line and the sequence of a run.
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <unistd.h>
 
 #include "tool/zq3ckrst.h"
 
@@ -305,6 +307,16 @@ static int planRestore(restorePlan* plan, planOptions* options, char** argv)
     return rc;
 }
 
+// A plan that did not reach its reader must not end like one that did; no code of a stage says so.
+static int checkReport(int rc)
+{
+    bool written = ferror(stdout) == 0 && fflush(stdout) == 0;
+    if (written && (close(STDOUT_FILENO) == 0 || errno == EBADF))
+        return rc;
+    fprintf(stderr, "\n%s Cannot write the report: %s\n\n", errorString, strerror(errno));
+    return rc != 0 ? rc : reportNotWritten;
+}
+
 int main(int argc, char** argv)
 {
     // A plan for a large history is printed in large pieces, to a terminal too.
@@ -322,5 +334,5 @@ int main(int argc, char** argv)
     if (rc != 0)
         reportStage(lastFailure);
     freePlan(&plan);
-    return rc;
+    return checkReport(rc);
 }

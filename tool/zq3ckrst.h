@@ -26,6 +26,8 @@ enum : int {
     tablespaceImageRefused = -13,
 };
 
+enum : int { reportNotWritten = 1 }; // exit status of a run whose stages all succeeded
+
 // One message of a failure. The site number is part of the text that support asks for.
 struct planMessage {
     const char* text; // at most one %s; of a scan call: its short name
@@ -264,10 +266,9 @@ int fillTimelineMatrix(char* matrix, historyData* data, tablespaceInfo* list, in
 int scanAndUpdateTimelineMatrix(char* matrix, tablespaceInfo* list, int numTablespaces,
                                 int numBackups);
 
-// The same two passes by column: each returns the first column that fails, or -1. After the
-// fill, a column that waits in vain has tracking 0, the timestamp of the missing image in
-// restoredImage, and a lastImageType other than
-// chainComplete.
+// The same two passes by column: each returns the first column that fails, or -1. After the fill, a
+// column that waits in vain has tracking 0, the timestamp of the missing image in restoredImage,
+// and a lastImageType other than chainComplete.
 int fillColumns(char* matrix, historyData* data, tablespaceInfo* list, int numTablespaces,
                 int numBackups);
 int scanColumns(char* matrix, int numTablespaces, int numBackups);

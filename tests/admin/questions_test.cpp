@@ -206,6 +206,11 @@ TEST_F(QuestionTest, AnswersInFull)
         {"images e/", "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
                       "0 images, 0 incomplete\n"
                       "[0]"},
+        {"images s/", "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
+                      "20250101000000  delta        database              1       1  incomplete: A "
+                      "lacks a full image\n"
+                      "1 image, 1 incomplete\n"
+                      "[0]"},
         {"images --have have --last 3 h/",
          "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
          "20250105010000  delta        database              2       4  incomplete: all 2 lack the "
@@ -300,7 +305,8 @@ TEST_F(QuestionTest, AnswersInFull)
          "[0]"},
     };
     run("load h/", tenDays());
-    run("load e/", "", "mkdir e; ");
+    run("load e/", "", "mkdir e s; ");
+    run("load s/", stanza("backup", 20250101000000, "Type: delta\n", {"A"}));
     spill(root + "have", "# on hand\n 20250101010000\n\n2025-01-02 01:00:00\r\n20250109010000\n");
     for (const auto& row : rows) {
         const std::string said = row.output, mark = "hint: zq3hist ";
@@ -419,6 +425,19 @@ TEST_F(QuestionTest, ChartsAreDrawnForTheirPlace)
         EXPECT_NE(std::string::npos, std::min(picture.find("." + at->str(1) + "{"),
                                               picture.find("." + at->str(1) + ",")))
             << "nothing says how to draw " << at->str();
+
+    // Where there is no room for letters the kinds differ in height.
+    std::string many = stanza("backup", 20240101000000, "Type: incremental\n", {"A"});
+    for (int i = 0; i < 500; i++)
+        many += stanza("backup", 20240101000100 + i / 60 * 100 + i % 60,
+                       i % 9 == 0 ? "" : "Type: delta\n", {"A"});
+    run("load n/", many, "mkdir n; ");
+    EXPECT_EQ("[0]", run("chart --svg narrow n"));
+    const std::string narrow = slurp(root + "narrow");
+    for (const char* cell : {"F\"[^>]*\"14", "i\"[^>]*\"9", "D\"[^>]*\"4"})
+        EXPECT_TRUE(std::regex_search(narrow, std::regex("class=\"" + std::string(cell) + "\"/>")))
+            << cell;
+    EXPECT_NE(std::string::npos, narrow.find("class=\"lM\""));
 }
 
 TEST_F(QuestionTest, AChecksLineBeginsWithTheGravest)

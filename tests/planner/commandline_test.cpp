@@ -136,6 +136,17 @@ TEST(CommandLine, OptionsTakeEffect)
     });
 }
 
+TEST(CommandLine, AReportThatCannotBeWrittenIsNoSuccess)
+{
+    const std::string err = testing::TempDir() + "zq3ckrst." + std::to_string(getpid());
+    setenv("ZQ3SCRIPT", "BDFA 20240104000000 A\n", 1);
+    int ended = system(("LD_LIBRARY_PATH=" SCRIPTED_DIR " " ZQ3CKRST " " TARGET ">/dev/full 2>" +
+                        err).c_str());
+    EXPECT_EQ(1, WEXITSTATUS(ended));
+    EXPECT_EQ(ERROR "Cannot write the report: No space left on device\n\n", slurp(err));
+    unlink(err.c_str());
+}
+
 TEST(Fetch, ScanFailures)
 {
 #define GOOD "BDFA 20240104000000 A\nBDFA 20240105000000 A\n"
