@@ -1,8 +1,8 @@
 // The chain of every tablespace at every image, found in one walk over the history.
 //
 // What a restore to one image needs is the planner's to say; this walk answers what concerns all
-// images at once, and the two agree: see nextNeeded. (But for an image that lists a name twice, which
-// none should: of the two the planner renames only the first.)
+// images at once, and the two agree: see nextNeeded. (But for an image that lists a name twice,
+// which none should: of the two the planner renames only the first.)
 #pragma once
 
 #include "admin/catalog.h"
