@@ -283,6 +283,14 @@ const numberGap* gapBetween(const imageCatalog* catalog, int oldest, int newest)
     return after > before ? &catalog->gaps[before] : nullptr;
 }
 
+void describeGap(const numberGap* gap, char* text)
+{
+    if (gap->first == gap->last)
+        snprintf(text, gapCapacity, "entry %u", gap->first);
+    else
+        snprintf(text, gapCapacity, "entries %u to %u", gap->first, gap->last);
+}
+
 // --- Planning ------------------------------------------------------------------------------------
 
 static int listRows(imagePlan* plan)

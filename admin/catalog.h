@@ -63,6 +63,10 @@ int failNoImage(const historyPlace* place, const char* timestamp);
 // The first gap in the entry numbers after the oldest and before the newest position; null: none.
 const numberGap* gapBetween(const imageCatalog* catalog, int oldest, int newest);
 
+// Writes "entry 5" or "entries 5 to 6".
+enum : unsigned int { gapCapacity = 40 };
+void describeGap(const numberGap* gap, char* text);
+
 // Put the members of an image's object, one of a list of what tablespaces lack, and the gap
 // (images.cpp).
 void putJsonImage(jsonWriter* json, const historyEntry* image);

@@ -114,7 +114,8 @@ int chartMain(commandLine* line)
     bool colored = false;
     bool isLatest = line->numArguments > 0 && strcmp(line->arguments[0], timestamp) == 0;
     int target = -1;
-    int rc = takeColor(line->color, &colored);
+    int rc = line->json && line->svg != nullptr ? failUsage("chart takes --svg or --json, not both")
+                                                : takeColor(line->color, &colored);
     if (rc == 0 && line->numArguments > 0 && !isLatest)
         rc = takeInstant("chart", line->arguments[0], timestamp);
     if (rc == 0)

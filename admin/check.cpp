@@ -237,9 +237,11 @@ static void showCheckLine(const checkReport* report)
         if (newest != nullptr)
             printf("; newest that can be restored: %s, %ld hours old", newest, report->ageHours);
     }
-    if (report->gap != nullptr)
-        printf("; warning: its chain was found, but the history lacks entries %u to %u",
-               report->gap->first, report->gap->last);
+    if (report->gap != nullptr) {
+        char gap[gapCapacity];
+        describeGap(report->gap, gap);
+        printf("; warning: its chain was found, but the history lacks %s", gap);
+    }
     putchar('\n');
 }
 

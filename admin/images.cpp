@@ -108,6 +108,9 @@ static void putUnused(const unusedImage* unused)
 static void showRow(const imageList* list, const imageRow* row)
 {
     const historyEntry* image = row->image;
+    char gap[gapCapacity] = "";
+    if (row->gap != nullptr)
+        describeGap(row->gap, gap);
     putEscaped(stdout, image->timestamp, strlen(image->timestamp));
     printf("%*s%-11s  %-10s  %11u  ",
            static_cast<int>(timestampLength - strlen(image->timestamp)) + 2, "", kindOfImage(image),
@@ -120,8 +123,7 @@ static void showRow(const imageList* list, const imageRow* row)
         if (row->chains->numIncomplete != 0)
             putMissing(&list->walk, row->chains);
         else if (row->gap != nullptr)
-            printf("chain found; the history lacks entries %u to %u", row->gap->first,
-                   row->gap->last);
+            printf("chain found; the history lacks %s", gap);
         else
             fputs("complete", stdout);
         if (list->line->all && list->catalog.facts[image->index].inactive)

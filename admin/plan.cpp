@@ -280,10 +280,12 @@ static int failIncomplete(const planRequest* request)
 
 static void warnOfGap(const planRequest* request)
 {
+    char gap[gapCapacity];
+    describeGap(request->gap, gap);
     fprintf(stderr,
-            "zq3hist: warning: a chain was found, but the history lacks entries %u to %u, and an "
-            "image may have been among them\n",
-            request->gap->first, request->gap->last);
+            "zq3hist: warning: a chain was found, but the history lacks %s, and an image may have "
+            "been there\n",
+            gap);
 }
 
 // --- The command line ----------------------------------------------------------------------------

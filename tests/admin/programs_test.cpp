@@ -133,6 +133,7 @@ TEST_F(ProgramTest, WrongCallsAreToldAndMakeNothing)
         {"copy -d a h/", "-d must stand for each directory or for none"},
         {"images -d a -d b", "-d takes an alias, once for each directory"},
         {"images h/ -d", "-d takes an alias, once for each directory"},
+        {"chart h/ --json --svg -", "chart takes --svg or --json, not both"},
         {"chart h/ --color=blue", "--color takes always, never or auto, not blue"},
         {"needed-by h/ 1",
          "needed-by takes a timestamp such as 20250111010000 or '2025-01-11 01:00:00', not 1"},

@@ -226,7 +226,7 @@ TEST_F(QuestionTest, AnswersInFull)
          "3/4  full         20250104010000  B  for 20250105010000\n"
          "4/4  delta        20250105010000  all 2  target\n"
          "zq3hist: warning: a chain was found, but the history lacks entries 5 to 6, and an image "
-         "may have been among them\n"
+         "may have been there\n"
          "[0]"},
         {"plan h/ latest b",
          "zq3hist: tablespace B lacks the image 20241201010000 that was restored, 20250108010000\n"
@@ -237,7 +237,7 @@ TEST_F(QuestionTest, AnswersInFull)
          "2/3  incremental  20250103010000  A  for 20250105010000\n"
          "3/3  delta        20250105010000  A  target\n"
          "zq3hist: warning: a chain was found, but the history lacks entries 5 to 6, and an image "
-         "may have been among them\n"
+         "may have been there\n"
          "[0]"},
         {"plan --before 20250104020000 h/",
          "1/1  full         20250104010000  B  target\n"
@@ -450,7 +450,9 @@ TEST_F(QuestionTest, AChecksLineBeginsWithTheGravest)
         return std::stoll(text);
     };
     long long full = hoursAgo(30), delta = hoursAgo(3);
-    std::string three = "newest that can be restored: " + std::to_string(delta) + ", 3 hours old";
+    std::string three =
+        "newest that can be restored: " + std::to_string(delta) +
+        ", 3 hours old; warning: its chain was found, but the history lacks entry 2";
     std::string thirty = "newest that can be restored: " + std::to_string(full) + ", 30 hours old";
     const struct {
         const char* before;
@@ -474,7 +476,7 @@ TEST_F(QuestionTest, AChecksLineBeginsWithTheGravest)
         {"rm h/*; ", "h/", "damaged: the directory holds no history file\n[3]"},
     };
     run("load h/", stanza("backup", full, "", {"A", "B"}) +
-                       stanza("backup", delta, "Type: delta\n", {"A", "B"}));
+                       stanza("backup", delta, "Type: delta\nNumber: 3\n", {"A", "B"}));
     spill(root + "have", std::to_string(full));
     for (const auto& row : rows)
         EXPECT_EQ(row.output, run(std::string("check ") + row.arguments, "",
