@@ -1,6 +1,9 @@
 // zq3hist through its command line, on real directories.
+#include <algorithm>
 #include <random>
 #include <sys/wait.h>
+
+#include <nlohmann/json.hpp>
 
 #include "tests/admin/program.h"
 
@@ -36,14 +39,6 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
         {"", "plan h/ 20250106010000 b",
          "1/2  full         20250105010000  B  for 20250106010000\n"
          "2/2  delta        20250106010000  B  target\n[0]"},
-        {"", "plan --json h/ 20250106010000",
-         "{\"format\":1,\"target\":\"20250106010000\",\"complete\":true,\"images\":["
-         "{\"position\":1,\"timestamp\":\"20250105010000\",\"kind\":\"full\",\"scope\":"
-         "\"database\",\"tablespaceCount\":2,\"tablespaces\":[\"A\",\"B\"],\"whole\":true,"
-         "\"neededBy\":[\"20250106010000\"]},{\"position\":2,\"timestamp\":"
-         "\"20250106010000\",\"kind\":\"delta\",\"scope\":\"database\",\"tablespaceCount\":"
-         "2,\"tablespaces\":[\"A\",\"B\"],\"whole\":true,\"neededBy\":[]}],\"neededCount\":2,"
-         "\"missing\":[],\"gap\":null,\"newestRestorable\":\"20250106010000\"}\n[0]"},
         {"", "backup h/ image", "2 entries backed up\n[0]"},
         {"", "copy h/ copy", "2 entries copied\n[0]"},
         {"", "verify copy/", SOUND},
@@ -213,19 +208,15 @@ TEST_F(ProgramTest, JsonIsValidForAnyBytes)
     run("load h/", "Operation: rename tablespace\nTimestamp: 20250101000000\nNote: "
                    "\"\\\\\\n\nTablespace: \\x7F\\xFF\nTablespace: B\n"
                    "SQLCA warnings: \\x01\n");
-    EXPECT_EQ("{\"format\":1,\"operation\":\"N\",\"object\":\"P\",\"type\":\"-\","
-              "\"status\":\"A\",\"auxCode\":\"-\",\"timestamp\":\"20250101000000\",\"sequence\":"
-              "\"001\",\"secondTimestamp\":\"\",\"firstText\":\"\",\"lastText\":\"\",\"id\":\"\","
-              "\"qualifier\":\"\",\"name\":\"\",\"longText\":\"\",\"note\":\"\\\"\\\\\\u000A\","
-              "\"command\":\"\",\"logPosition\":\"000000000000\",\"node\":0,\"number\":1,"
-              "\"tablespaces\":["
-              "\"\\u007F\\u00FF\",\"B\"],"
-              "\"sqlca\":{\"sqlcode\":0,\"sqlstate\":\"     \",\"id\":\"SQLCA   \",\"length\":136,"
-              "\"tokens\":\"-" +
-                  std::string(69, ' ') +
-                  "\",\"product\":\"-       \",\"diagnostics\":[0,0,0,0,0,0],\"warnings\":"
-                  "\"\\u0001          \",\"tokensLength\":0}}\n[0]",
-              run("dump --json h/"));
+    EXPECT_TRUE(run("dump --json h/").ends_with("}\n[0]"));
+    const std::string text = slurp(root + "out");
+    EXPECT_EQ(1, std::ranges::count(text, '\n'));
+    nlohmann::json entry = nlohmann::json::parse(text);
+    EXPECT_EQ("\"\\\n", entry["note"]);
+    EXPECT_EQ("\u007F\u00FF", entry["tablespaces"][0]);
+    EXPECT_EQ("\u0001          ", entry["sqlca"]["warnings"]);
+    EXPECT_EQ(std::string("-").append(69, ' '), entry["sqlca"]["tokens"]);
+    EXPECT_EQ(0, entry["sqlca"]["diagnostics"][5]);
 }
 
 TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)

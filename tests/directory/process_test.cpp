@@ -386,26 +386,6 @@ TEST_F(KillTest, NothingAcknowledgedIsLostByKills)
     EXPECT_GT(found[sqloNLCKStale], kills / 20);
 }
 
-TEST_F(ProcessTest, EightProcessesAppendEveryEntryOnce)
-{
-    const unsigned int processes = 8, batches = 200 / slowdown;
-    store(filesOf(" 0/ 0"));
-    for (; writer < processes; writer++)
-        inChild([&] {
-            unsigned int done = 0;
-            while (done < batches && batch(1) == 0)
-                done++;
-            return done != batches;
-        });
-    for (int status = 0; wait(&status) > 0;)
-        EXPECT_EQ(0, status);
-    const std::vector<size_t> found = writers();
-    for (size_t by = 0; by < processes; by++)
-        EXPECT_EQ(batches, std::ranges::count(found, by));
-    EXPECT_EQ(processes * batches, found.size());
-    printf("%u processes, %u batches each: %zu entries\n", processes, batches, found.size());
-}
-
 TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
 {
     int ends[2];
