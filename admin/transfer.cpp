@@ -177,6 +177,7 @@ static int formPrivate(char* path)
     return 0;
 }
 
+// Removes the file at path and writes what it held to standard output, whose failures main tells.
 static int writeOut(const char* path)
 {
     char buffer[64 * 1024];
@@ -184,11 +185,15 @@ static int writeOut(const char* path)
     FILE* in = fopen(path, "r");
     if (in == nullptr)
         return sqloSystemError | errno;
-    while ((got = fread(buffer, 1, sizeof buffer, in)) > 0)
-        fwrite(buffer, 1, got, stdout);
-    int rc = ferror(in) ? sqloSystemError | errno : 0;
+    unlink(path); // it is gone, however this ends
+    bool done = true;
+    while (done && (got = fread(buffer, 1, sizeof buffer, in)) > 0)
+        done = fwrite(buffer, 1, got, stdout) == got;
+    int rc = ferror(in) == 0 ? 0 : sqloSystemError | errno;
     fclose(in);
-    return rc != 0 || fflush(stdout) == 0 ? rc : sqloSystemError | errno;
+    if (done)
+        fflush(stdout);
+    return rc;
 }
 
 int backupMain(commandLine* line)
@@ -215,10 +220,10 @@ int backupMain(commandLine* line)
         int code = rc != 0 ? 0 : toOutput ? writeOut(temporary) : nameBackup(temporary, path);
         if (code != 0)
             rc = failWithCode(code, "write the backup", toOutput ? "standard output" : path);
-        if (rc != 0 || toOutput)
+        if (rc != 0)
             unlink(temporary);
     }
-    if (rc == 0)
+    if (rc == 0 && ferror(stdout) == 0)
         fprintf(toOutput ? stderr : stdout, "%u %s %sbacked up\n", count, entryWord(count),
                 line->dryRun ? "would be " : "");
     return rc;

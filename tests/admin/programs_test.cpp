@@ -58,6 +58,8 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
         {"", "--version", "zq3hist 1.0.0\n[0]"},
         {"", "dump h/ >/dev/full",
          "zq3hist: cannot write: No space left on device, standard output\n[1]"},
+        {"", "backup h/ - >/dev/full",
+         "zq3hist: cannot write: No space left on device, standard output\n[1]"},
     };
     for (const auto& step : steps)
         EXPECT_EQ(step.output, run(step.arguments, week, step.before)) << step.arguments;
