@@ -10,6 +10,10 @@
 #include <set>
 #include <sstream>
 
+#include <dlfcn.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+
 #include "sqo/sqlzkrcb.h"
 #include "support.h"
 
@@ -19,11 +23,32 @@
 inline std::function<int(const std::string& call, int command)> onCall;
 constexpr int onlyShort = INT_MIN;
 
-// The same for each system call under the files: an errno, or 0.
+// The same for each system call under the files, asked with its name and sizes: an errno, or 0.
 inline std::function<int(const std::string& call)> onSystemCall;
+inline size_t longestWrite = SIZE_MAX; // of more bytes only so many are written
+
+inline void failCall(const std::string& name, int command, int error)
+{
+    onCall = [=](const std::string& call, int given) {
+        return call == name && given == command ? error : 0;
+    };
+}
+
+inline void failSystemCall(const std::string& name, int error)
+{
+    onSystemCall = [=](const std::string& call) { return call.starts_with(name) ? error : 0; };
+}
+
+// The function that a hook of that name stands in front of.
+template <typename function> static function realOf(function, const char* name)
+{
+    return reinterpret_cast<function>(dlsym(RTLD_NEXT, name));
+}
 
 // What the system is made to tell as every file's change time, in whole seconds; 0: the truth.
 inline time_t changeTime;
+// What the clock that stamps files is made to say beside the truth.
+inline time_t clockAhead;
 
 enum diskKind {
     diskWrite,
@@ -91,6 +116,23 @@ constexpr unsigned int slowdown = 10;
 constexpr unsigned int slowdown = 1;
 #endif
 
+// Runs in a process of its own, which ends with what it returns.
+template <typename use> static pid_t inChild(use run)
+{
+    const pid_t child = fork();
+    if (child == 0)
+        _exit(run());
+    return child;
+}
+
+// The status that the process ended with.
+inline int waitFor(pid_t child)
+{
+    int status = -1;
+    waitpid(child, &status, 0);
+    return status;
+}
+
 // A directory's files by name; "*" after the name of one that is marked as incomplete.
 using Files = std::map<std::string, std::string>;
 
@@ -142,6 +184,7 @@ class DirectoryTest : public HistoryTest
     uint16_t writer = 0;  // node number of the entries that append writes
     bool inBatch = false; // between begin and end of a batch
     SQLO_NLCK lock = {};  // as lockState filled it
+    SQLUH_HANDLE* mine = nullptr;
     std::string sourceDirectory = root + "SOURCE/";
 
     DirectoryTest()
@@ -186,27 +229,25 @@ class DirectoryTest : public HistoryTest
     // Files that exist keep their inodes, so that a directory has few lock keys over its life.
     void store(const Files& files)
     {
-        for (const auto& file : std::filesystem::directory_iterator(directory)) {
+        using namespace std::filesystem;
+        for (const auto& file : directory_iterator(directory)) {
             const std::string name = file.path().filename();
             if (!files.contains(name) && !files.contains(name + "*"))
-                std::filesystem::remove(file.path());
+                remove(file.path());
         }
         for (const auto& [name, bytes] : files) {
             const std::string path = directory + name.substr(0, name.find('*'));
             spill(path, bytes);
             if (isMarked(path) != name.ends_with('*'))
-                std::filesystem::permissions(path, std::filesystem::perms::sticky_bit,
-                                             name.ends_with('*')
-                                                 ? std::filesystem::perm_options::add
-                                                 : std::filesystem::perm_options::remove);
+                permissions(path, perms::sticky_bit,
+                            isMarked(path) ? perm_options::remove : perm_options::add);
         }
     }
 
     static bool isMarked(const std::string& path)
     {
-        const auto status = std::filesystem::status(path);
-        return (status.permissions() & std::filesystem::perms::sticky_bit) !=
-               std::filesystem::perms::none;
+        struct stat status;
+        return stat(path.c_str(), &status) == 0 && (status.st_mode & S_ISVTX) != 0;
     }
 
     // "C12": a history of 12 entries with status C; "C12-876": the same without its last 876 bytes;
@@ -307,11 +348,10 @@ class DirectoryTest : public HistoryTest
     static int restore(SQLUH_HANDLE* handle, std::string image)
     {
         int rc = 0;
+        auto* bytes = reinterpret_cast<unsigned char*>(image.data());
         const unsigned int size = static_cast<unsigned int>(image.size()), length = 2500;
         for (unsigned int at = 0; rc == 0 && at < size; at += length)
-            rc =
-                sqluh_write_restore_buffer(handle, at, reinterpret_cast<unsigned char*>(&image[at]),
-                                           std::min(length, size - at));
+            rc = sqluh_write_restore_buffer(handle, at, bytes + at, std::min(length, size - at));
         return rc;
     }
 
@@ -344,6 +384,27 @@ class DirectoryTest : public HistoryTest
                                       : restoreImage(samples.at(s.outcomes.back()));
         return batch(static_cast<unsigned int>(s.action.back() - '0'),
                      s.action[0] == 'c' ? sqluhCommit : sqluhAbandon);
+    }
+
+    // Which of the samples a read of the committed history gives, or its code.
+    int readCommitted()
+    {
+        SQLUH_COMMITTED* committed = nullptr;
+        const int rc = sqluhReadCommitted(directory.c_str(), &committed);
+        if (rc < 0)
+            return rc;
+        zq3HistoryData data = {};
+        SQLUH_ENTRY entry = {};
+        entry.data = &data;
+        for (uint32_t row = committed->numRows; row > 0; row--) {
+            sqluhGetCommitted(committed, row - 1, &entry, false);
+            EXPECT_EQ(row, data.entryNumber);
+        }
+        const int number = static_cast<int>(committed->numRows) + (data.entryNode == 1 ? 20 : 0);
+        const int result = committed->failure != 0 ? committed->failure : number;
+        sqluhFreeCommitted(&committed);
+        EXPECT_EQ(nullptr, committed);
+        return result;
     }
 
     // Runs with the disk watched and, where told, stopped. What was done is in disk.log.

@@ -63,21 +63,20 @@ TEST_F(FunctionalTest, CloseGoesOnPastFailuresAndReturnsTheFirst)
     const int first[] = {0, close, copy, close, unlock, close, copy, close};
     for (unsigned int fails = 0; fails < 8; fails++) {
         store(filesOf(" 10/ 10"));
-        SQLUH_HANDLE* handle = nullptr;
-        ASSERT_EQ(0, sqluhOpen(&handle, directory.data(), fails));
+        ASSERT_EQ(0, sqluhOpen(&mine, directory.data(), fails));
         EXPECT_EQ(fails == 4 ? sqloSystemError | EBADF : 0,
-                  sqluhWriteHeader(handle->fileHandle, &handle->header));
+                  sqluhWriteHeader(mine->fileHandle, &mine->header));
         store(filesOf(" 10/ 1"));
-        handle->restoredFromImage = true;
+        mine->restoredFromImage = true;
         onCall = [&](const std::string& call, int) {
             return (fails & 1) && call == "sqloclose"  ? close
                    : (fails & 2) && call == "sqlocopy" ? copy
                    : (fails & 4) && call == "semctl"   ? EPERM
                                                        : 0;
         };
-        EXPECT_EQ(first[fails], sqluhClose(&handle));
+        EXPECT_EQ(first[fails], sqluhClose(&mine));
         onCall = nullptr;
-        EXPECT_EQ(nullptr, handle);
+        EXPECT_EQ(nullptr, mine);
         EXPECT_TRUE(load() == filesOf((fails & 2) ? " 10/ 1" : " 10/ 10"));
         EXPECT_EQ((fails & 4) != 0, removeSetsLeft() == 1);
     }
@@ -85,34 +84,32 @@ TEST_F(FunctionalTest, CloseGoesOnPastFailuresAndReturnsTheFirst)
 
 TEST_F(FunctionalTest, WhatCannotBeMovedAsideIsNotReplaced)
 {
-    SQLUH_HANDLE* handle = nullptr;
     store(filesOf(" 10/ 10"));
-    EXPECT_EQ(0, sqluhHandleAllocAndInit(directory.data(), &handle) + sqluhLock(handle));
-    onSystemCall = [](const std::string& call) { return call == "rename" ? EACCES : 0; };
-    EXPECT_EQ(sqloSystemError | EACCES, sqluhRecoverFromFatalError(handle));
+    EXPECT_EQ(0, sqluhHandleAllocAndInit(directory.data(), &mine) + sqluhLock(mine));
+    failSystemCall("rename", EACCES);
+    EXPECT_EQ(sqloSystemError | EACCES, sqluhRecoverFromFatalError(mine));
     onSystemCall = nullptr;
     EXPECT_TRUE(load() == filesOf(" 10/ 10"));
-    EXPECT_EQ(0, sqluhUnlock(handle) + openAndClose());
-    EXPECT_EQ(0, sqluhRecoverFromFatalError(handle)); // also without the lock
+    EXPECT_EQ(0, sqluhUnlock(mine) + openAndClose());
+    EXPECT_EQ(0, sqluhRecoverFromFatalError(mine)); // also without the lock
     EXPECT_TRUE(load() == filesOf(" 0/ 0/ 10/ 10"));
-    sqluhHandleFree(&handle);
+    sqluhHandleFree(&mine);
 }
 
 TEST_F(FunctionalTest, PathsThatDoNotFitAreRefused)
 {
     std::string longest(maxDirectoryLength - 1, 'd'), tooLong = longest + "d/", none = "d";
-    SQLUH_HANDLE* handle = nullptr;
     bool isEmpty = true;
     longest += '/';
     store(filesOf(" 10/ 10"));
-    EXPECT_EQ(0, sqluhHandleAllocAndInit(longest.data(), &handle));
-    EXPECT_EQ(longest, handle->directory);
-    EXPECT_EQ(longest + SQLUH_HISTORY_NAME, handle->historyPath);
-    EXPECT_EQ(longest + SQLUH_SHADOW_NAME, handle->shadowPath);
-    EXPECT_EQ(sqluhPathTooLong, sqluhRecoverFromFatalError(handle));
-    sqluhHandleFree(&handle);
-    EXPECT_EQ(sqluhPathTooLong, sqluhHandleAllocAndInit(tooLong.data(), &handle));
-    EXPECT_EQ(nullptr, handle);
+    EXPECT_EQ(0, sqluhHandleAllocAndInit(longest.data(), &mine));
+    EXPECT_EQ(longest, mine->directory);
+    EXPECT_EQ(longest + SQLUH_HISTORY_NAME, mine->historyPath);
+    EXPECT_EQ(longest + SQLUH_SHADOW_NAME, mine->shadowPath);
+    EXPECT_EQ(sqluhPathTooLong, sqluhRecoverFromFatalError(mine));
+    sqluhHandleFree(&mine);
+    EXPECT_EQ(sqluhPathTooLong, sqluhHandleAllocAndInit(tooLong.data(), &mine));
+    EXPECT_EQ(nullptr, mine);
     EXPECT_EQ(sqluhPathTooLong, sqluhCopyHistoryFile(directory.data(), tooLong.data()));
     EXPECT_EQ(sqluhPathNoSeparator, sqluhCopyHistoryFile(directory.data(), none.data()));
     EXPECT_EQ(sqluhPathTooLong, sqluhIsHistoryFileEmpty(tooLong.data(), &isEmpty));
@@ -135,19 +132,17 @@ TEST_F(FunctionalTest, FewWritesAreReplayedManyAreCopied)
     for (const auto& row : rows) {
         SCOPED_TRACE(testing::Message() << row.entries << " " << row.writes);
         const std::string word = std::string(" ").append(std::to_string(row.entries));
+        bool copied = false, disabled = false;
         store(filesOf(word + "/" + word));
-        bool copied = false;
         onCall = [&](const std::string& call, int) {
             copied |= call == "sqlocopy";
             return row.writes == 12 && call == "sqloMemBlockReallocate" ? -1 : 0;
         };
-        bool disabled = false;
         EXPECT_EQ(0, watch([&] {
-                      SQLUH_HANDLE* handle = nullptr;
-                      EXPECT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
-                      EXPECT_EQ(0, append(handle, row.writes));
-                      disabled = handle->replayArea.replayDisabled != 0;
-                      return sqluhEndBatch(&handle, sqluhCommit);
+                      EXPECT_EQ(0, sqluhBeginBatch(&mine, directory.data()));
+                      EXPECT_EQ(0, append(mine, row.writes));
+                      disabled = mine->replayArea.replayDisabled != 0;
+                      return sqluhEndBatch(&mine, sqluhCommit);
                   }));
         onCall = nullptr;
         EXPECT_EQ(row.disabled, disabled);
@@ -166,17 +161,16 @@ TEST_F(FunctionalTest, FewWritesAreReplayedManyAreCopied)
 TEST_F(FunctionalTest, ReplayRepeatsTheWritesInOrder)
 {
     store(filesOf(" 10/ 10"));
-    SQLUH_HANDLE* handle = nullptr;
-    ASSERT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
+    ASSERT_EQ(0, sqluhBeginBatch(&mine, directory.data()));
     const size_t end = slurp(historyPath).size();
-    ASSERT_EQ(0, append(handle, 1));
+    ASSERT_EQ(0, append(mine, 1));
     std::filesystem::resize_file(historyPath, end + 100); // the next one overlaps it
-    ASSERT_EQ(0, append(handle, 1));
+    ASSERT_EQ(0, append(mine, 1));
     std::string tampered = slurp(historyPath), expected = tampered;
     tampered[end + 50] = '#';
     expected[end + 700] = tampered[end + 700] = '#';
     spill(historyPath, tampered);
-    ASSERT_EQ(0, sqluhEndBatch(&handle, sqluhCommit));
+    ASSERT_EQ(0, sqluhEndBatch(&mine, sqluhCommit));
     EXPECT_TRUE(slurp(shadowPath).substr(1024) == expected.substr(1024));
 }
 
@@ -242,18 +236,15 @@ TEST_F(FunctionalTest, ShortWritesAreFailures)
 TEST_F(FunctionalTest, ABackupIsReadPieceByPiece)
 {
     store(filesOf(" 10/ 10"));
-    SQLUH_HANDLE* handle = nullptr;
-    ASSERT_EQ(0, sqluhOpen(&handle, directory.data(), SQLUH_OPEN_READ));
+    ASSERT_EQ(0, sqluhOpen(&mine, directory.data(), SQLUH_OPEN_READ));
     std::string image, piece(1000, '?');
-    unsigned int got = 1;
-    while (got != 0) {
-        auto* buffer = reinterpret_cast<unsigned char*>(piece.data());
-        const unsigned int at = static_cast<unsigned int>(image.size());
-        ASSERT_EQ(0, sqluh_fill_backup_buffer(handle, at, 1000, buffer, &got));
+    auto* buffer = reinterpret_cast<unsigned char*>(piece.data());
+    for (unsigned int at = 0, got = 1; got != 0; at += got) {
+        ASSERT_EQ(0, sqluh_fill_backup_buffer(mine, at, 1000, buffer, &got));
         image.append(piece, 0, got);
     }
     EXPECT_TRUE(image == samples.at(10));
-    EXPECT_EQ(0, sqluhClose(&handle));
+    EXPECT_EQ(0, sqluhClose(&mine));
 }
 
 TEST_F(FunctionalTest, WarningCarriesTheErrorAsItsToken)

@@ -7,12 +7,7 @@
 #include <sys/stat.h>
 #include <sys/uio.h>
 
-static std::string service; // the OS-services call that is under way
-
-template <typename function> static function next(function, const char* name)
-{
-    return reinterpret_cast<function>(dlsym(RTLD_NEXT, name));
-}
+static std::string_view service; // the OS-services call that is under way
 
 static int enter(const char* name, int command)
 {
@@ -23,7 +18,7 @@ static int enter(const char* name, int command)
 #define HOOK(name, parameters, arguments, command, failed)                                         \
     extern "C" int name parameters                                                                 \
     {                                                                                              \
-        static const auto real = next(&name, #name);                                               \
+        static const auto real = realOf(&name, #name);                                             \
         const int code = enter(#name, command);                                                    \
         return code == 0 ? real arguments : failed;                                                \
     }
@@ -60,7 +55,7 @@ HOOK(semop, (int id, sembuf* steps, size_t count) noexcept, (id, steps, count), 
 
 extern "C" int semctl(int id, int number, int command, ...) noexcept
 {
-    static const auto real = next(&semctl, "semctl");
+    static const auto real = realOf(&semctl, "semctl");
     va_list rest;
     va_start(rest, command);
     void* argument = va_arg(rest, void*);
@@ -72,29 +67,39 @@ extern "C" int semctl(int id, int number, int command, ...) noexcept
 // --- System calls under the files ----------------------------------------------------------------
 
 // Whether the test wants the system call to fail. Logs are none of its business.
-static bool fails(const char* call, const char* path = "")
+static bool fails(const std::string& call, std::string_view path = "")
 {
-    const int number = onSystemCall && path != std::string("/dev/null") ? onSystemCall(call) : 0;
+    const int number = onSystemCall && path != "/dev/null" ? onSystemCall(call) : 0;
     errno = number != 0 ? number : errno;
     return number != 0;
 }
 
 // What a call on an open file is to be logged as.
-static diskOp opOn(int fd, diskKind kind)
+static diskOp opOn(int fd, diskKind kind, size_t at = 0)
 {
     struct stat status;
     std::error_code ignored;
-    static const auto real = next(&fstat, "fstat64");
+    static const auto real = realOf(&fstat, "fstat64");
     const auto path = std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd), ignored);
-    return {kind, real(fd, &status) == 0 ? status.st_ino : 0, 0, "", path.string()};
+    return {kind, real(fd, &status) == 0 ? status.st_ino : 0, at, "", path.string()};
+}
+
+static diskOp writeTo(int fd, const void* bytes, size_t count, off_t offset)
+{
+    diskOp op = opOn(fd, diskWrite, static_cast<size_t>(offset));
+    op.bytes.assign(static_cast<const char*>(bytes), count);
+    return op;
 }
 
 // Lets a call happen as far as it may, logs it, and stops after it where it shall.
-template <typename call> static auto perform(diskOp op, call happen) -> decltype(happen(0))
+template <typename use>
+static auto perform(const std::string& call, diskOp op, use happen) -> decltype(happen(0))
 {
+    if (fails(call))
+        return errno == onlyShort ? 0 : -1;
     const size_t size = op.kind == diskWrite ? op.bytes.size() : 1;
     if (!disk.watching)
-        return happen(size);
+        return happen(std::min(size, longestWrite));
     size_t part = disk.stopped ? 0 : size;
     if (!disk.stopped && static_cast<int>(disk.log.size()) == disk.stop.call) {
         disk.stopped = true;
@@ -114,14 +119,14 @@ template <typename call> static auto perform(diskOp op, call happen) -> decltype
 
 extern "C" ssize_t pread(int fd, void* buffer, size_t count, off_t offset)
 {
-    static const auto real = next(&pread, "pread64");
-    return fails("pread") ? -1 : real(fd, buffer, count, offset);
+    static const auto real = realOf(&pread, "pread64");
+    return fails("read") ? -1 : real(fd, buffer, count, offset);
 }
 
 extern "C" int fstat(int fd, struct stat* status) noexcept
 {
-    static const auto real = next(&fstat, "fstat64");
-    const int rc = fails("fstat") ? -1 : real(fd, status);
+    static const auto real = realOf(&fstat, "fstat64");
+    const int rc = fails("status") ? -1 : real(fd, status);
     if (changeTime != 0)
         status->st_ctim = {changeTime, 0};
     return rc;
@@ -129,55 +134,56 @@ extern "C" int fstat(int fd, struct stat* status) noexcept
 
 extern "C" int stat(const char* path, struct stat* status) noexcept
 {
-    static const auto real = next(&stat, "stat64");
+    static const auto real = realOf(&stat, "stat64");
     const int rc = real(path, status);
     if (changeTime != 0)
         status->st_ctim = {changeTime, 0};
     return rc;
 }
 
-extern "C" int fallocate(int fd, int mode, off_t offset, off_t length)
+extern "C" int close(int fd)
 {
-    static const auto real = next(&fallocate, "fallocate64");
-    return fails("fallocate") ? -1 : real(fd, mode, offset, length);
+    static const auto real = realOf(&close, "close");
+    const int rc = real(fd);
+    return fails("close") ? -1 : rc;
 }
 
-extern "C" ssize_t pwrite(int fd, const void* buffer, size_t count, off_t offset)
+extern "C" int fallocate(int fd, int mode, off_t offset, off_t length)
 {
-    if (fails("pwrite"))
-        return -1;
-    static const auto real = next(&pwrite, "pwrite64");
-    diskOp op = opOn(fd, diskWrite);
-    op.at = static_cast<size_t>(offset);
-    op.bytes.assign(static_cast<const char*>(buffer), count);
-    return perform(op, [&](size_t part) { return real(fd, buffer, part, offset); });
+    static const auto real = realOf(&fallocate, "fallocate64");
+    return fails("reserve " + std::to_string(length)) ? -1 : real(fd, mode, offset, length);
+}
+
+extern "C" ssize_t pwrite(int fd, const void* bytes, size_t count, off_t offset)
+{
+    static const auto real = realOf(&pwrite, "pwrite64");
+    return perform("write " + std::to_string(count) + " at " + std::to_string(offset),
+                   writeTo(fd, bytes, count, offset),
+                   [&](size_t part) { return real(fd, bytes, part, offset); });
 }
 
 extern "C" int ftruncate(int fd, off_t length) noexcept
 {
-    static const auto real = next(&ftruncate, "ftruncate64");
-    if (fails("ftruncate"))
-        return -1;
-    diskOp op = opOn(fd, diskTruncate);
-    op.at = static_cast<size_t>(length);
-    return perform(op, [&](size_t) { return real(fd, length); });
+    static const auto real = realOf(&ftruncate, "ftruncate64");
+    return perform("truncate", opOn(fd, diskTruncate, static_cast<size_t>(length)),
+                   [&](size_t) { return real(fd, length); });
 }
 
 // Of all opens only one that creates or empties a file changes anything.
 extern "C" int open(const char* path, int flags, ...)
 {
-    static const auto real = next(&open, "open64");
+    static const auto real = realOf(&open, "open64");
     va_list rest;
     va_start(rest, flags);
     const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
     va_end(rest);
+    const bool exists = access(path, F_OK) == 0;
     if (fails("open", path))
         return -1;
-    const bool exists = access(path, F_OK) == 0;
     if (!disk.watching || (flags & (exists ? O_TRUNC : O_CREAT)) == 0)
         return real(path, flags, mode);
     int fd = -1;
-    const int result = perform({exists ? diskTruncate : diskCreate, 0, 0, "", path},
+    const int result = perform("create", {exists ? diskTruncate : diskCreate, 0, 0, "", path},
                                [&](size_t) { return fd = real(path, flags, mode); });
     if (fd >= 0)
         disk.log.back().inode = opOn(fd, diskCreate).inode;
@@ -188,18 +194,15 @@ extern "C" int open(const char* path, int flags, ...)
 
 extern "C" int unlink(const char* path) noexcept
 {
-    static const auto real = next(&unlink, "unlink");
-    return fails("unlink")
-               ? -1
-               : perform({diskUnlink, 0, 0, "", path}, [&](size_t) { return real(path); });
+    static const auto real = realOf(&unlink, "unlink");
+    return perform("unlink", {diskUnlink, 0, 0, "", path}, [&](size_t) { return real(path); });
 }
 
 extern "C" int rename(const char* path, const char* newPath) noexcept
 {
-    static const auto real = next(&rename, "rename");
-    return fails("rename") ? -1 : perform({diskRename, 0, 0, "", path, newPath}, [&](size_t) {
-        return real(path, newPath);
-    });
+    static const auto real = realOf(&rename, "rename");
+    return perform("rename", {diskRename, 0, 0, "", path, newPath},
+                   [&](size_t) { return real(path, newPath); });
 }
 
 // Of a batch B1 to B4; of a copy that of the source or of the body; those of a mark.
@@ -222,12 +225,9 @@ static std::string barrierName(int fd, bool withMode)
 // Nothing waits for a real disk here: what a sync does is in the log.
 static int syncFile(int fd, bool withMode)
 {
-    if (fails("sync"))
-        return -1;
-    diskOp op = opOn(fd, diskSync);
-    op.at = withMode;
+    diskOp op = opOn(fd, diskSync, withMode);
     op.barrier = barrierName(fd, withMode);
-    return perform(op, [](size_t) { return 0; });
+    return perform(withMode ? "sync all" : "sync", op, [](size_t) { return 0; });
 }
 
 extern "C" int fdatasync(int fd)
@@ -237,11 +237,9 @@ extern "C" int fdatasync(int fd)
 
 extern "C" int fsync(int fd)
 {
-    const diskOp op = opOn(fd, diskNames);
-    if (std::filesystem::is_regular_file(op.name))
+    if (std::filesystem::is_regular_file(opOn(fd, diskNames).name))
         return syncFile(fd, true);
-    return fails("sync") ? -1
-                         : perform({diskNames, 0, 0, "", "", "", "D"}, [](size_t) { return 0; });
+    return perform("sync directory", {diskNames, 0, 0, "", "", "", "D"}, [](size_t) { return 0; });
 }
 
 // The write that waits, too: one call, in which no process can stop.
@@ -251,22 +249,17 @@ extern "C" ssize_t pwritev2(int fd, const iovec* bytes, int, off_t offset, int)
         const ssize_t put = pwrite(fd, bytes->iov_base, bytes->iov_len, offset);
         return put < 0 || syncFile(fd, false) != 0 ? -1 : put;
     }
-    static const auto real = next(&pwrite, "pwrite64");
-    if (fails("pwritev2"))
-        return -1;
-    diskOp op = opOn(fd, diskWrite);
-    op.at = static_cast<size_t>(offset);
-    op.bytes.assign(static_cast<const char*>(bytes->iov_base), bytes->iov_len);
+    static const auto real = realOf(&pwrite, "pwrite64");
+    diskOp op = writeTo(fd, bytes->iov_base, bytes->iov_len, offset);
     op.barrier = "R4";
-    return perform(op, [&](size_t part) { return real(fd, bytes->iov_base, part, offset); });
+    return perform("write and wait for " + std::to_string(bytes->iov_len), op,
+                   [&](size_t part) { return real(fd, bytes->iov_base, part, offset); });
 }
 
 extern "C" int fchmod(int fd, mode_t mode) noexcept
 {
-    static const auto real = next(&fchmod, "fchmod");
-    if (without == "mark" || fails("fchmod"))
-        return without == "mark" ? 0 : -1;
-    diskOp op = opOn(fd, diskMode);
-    op.at = (mode & S_ISVTX) != 0;
-    return perform(op, [&](size_t) { return real(fd, mode); });
+    static const auto real = realOf(&fchmod, "fchmod");
+    return without == "mark" ? 0
+                             : perform("mark", opOn(fd, diskMode, (mode & S_ISVTX) != 0),
+                                       [&](size_t) { return real(fd, mode); });
 }

@@ -3,11 +3,9 @@
 
 #include <atomic>
 #include <csignal>
-#include <dlfcn.h>
 #include <fcntl.h>
 #include <random>
 #include <sys/mman.h>
-#include <sys/wait.h>
 #include <thread>
 #include <utility>
 
@@ -17,7 +15,7 @@ static key_t onlyKey = -1;
 
 extern "C" key_t ftok(const char* path, int project) noexcept
 {
-    static const auto real = reinterpret_cast<decltype(&ftok)>(dlsym(RTLD_NEXT, "ftok"));
+    static const auto real = realOf(&ftok, "ftok");
     return onlyKey != -1 ? onlyKey : real(path, project);
 }
 
@@ -27,14 +25,14 @@ static unsigned int shortSleeps = 0;
 
 extern "C" time_t time(time_t* result) noexcept
 {
-    static const auto real = reinterpret_cast<time_t (*)(time_t*)>(dlsym(RTLD_NEXT, "time"));
+    static const auto real = realOf(&time, "time");
     const time_t now = real(nullptr) + ahead;
     return result != nullptr ? *result = now : now;
 }
 
 extern "C" int usleep(useconds_t duration)
 {
-    static const auto real = reinterpret_cast<decltype(&usleep)>(dlsym(RTLD_NEXT, "usleep"));
+    static const auto real = realOf(&usleep, "usleep");
     if (duration != 1000 || shortSleeps == 0)
         return real(duration);
     shortSleeps--;
@@ -44,21 +42,6 @@ extern "C" int usleep(useconds_t duration)
 class ProcessTest : public DirectoryTest
 {
   protected:
-    template <typename use> static pid_t inChild(use run)
-    {
-        const pid_t child = fork();
-        if (child == 0)
-            _exit(run());
-        return child;
-    }
-
-    static int waitFor(pid_t child)
-    {
-        int status = -1;
-        waitpid(child, &status, 0);
-        return status;
-    }
-
     // Of each entry of the history the node number that its writer gave it. Both files are sound
     // and agree, the entries are numbered from 1 on, and as many as the header says.
     std::vector<size_t> writers()
@@ -116,7 +99,7 @@ class LockTest : public ProcessTest
             return call == row.call && command == row.command && times++ == 0 ? error : 0;
         };
         EXPECT_EQ(row.code != 0 ? row.code : sqloSystemError | error, sqloNLCKLock(&lock, 0, 0));
-        onCall = [](const std::string&, int command) { return command == -1 ? EINTR : 0; };
+        failCall("semop", -1, EINTR);
         EXPECT_EQ(row.held ? sqloNLCKInterrupted : sqloSystemError | EINTR,
                   sqloNLCKLock(&lock, sqloNLCKReportInterrupts, -1));
         onCall = nullptr;
@@ -201,14 +184,12 @@ TEST_F(LockTest, WhoLooksIsToldWhatTheSystemSays)
         for (const int error : row.errors) {
             SCOPED_TRACE(testing::Message() << row.call << " " << row.command << " " << error);
             SQLO_NLCKSTATE state = {};
-            onCall = [&](const std::string& call, int command) {
-                return call == row.call && command == row.command ? error : 0;
-            };
+            failCall(row.call, row.command, error);
             EXPECT_EQ(row.rc == 0 ? 0 : sqloSystemError | error, sqloNLCKQuery(&lock, &state));
             onCall = nullptr;
             EXPECT_EQ(row.state, state.state);
         }
-    onCall = [](const std::string&, int command) { return command == SEM_INFO ? EPERM : 0; };
+    failCall("semctl", SEM_INFO, EPERM);
     int index = 0;
     SQLO_NLCKSTATE state = {};
     EXPECT_EQ(sqloSystemError | EPERM, sqloNLCKNext(&index, &lock, &state));
@@ -216,15 +197,13 @@ TEST_F(LockTest, WhoLooksIsToldWhatTheSystemSays)
     ahead = 100;
     state = lockState();
     for (const int error : {EPERM, EIDRM}) {
-        onCall = [&](const std::string& call, int command) {
-            return call == "semctl" && command == IPC_RMID ? error : 0;
-        };
+        failCall("semctl", IPC_RMID, error);
         EXPECT_EQ(error == EIDRM ? 0 : sqloSystemError | error, sqloNLCKRemoveDead(&lock, &state));
     }
     // Nor does it change anything when the semaphore cannot be given back.
     ahead = 0;
     EXPECT_EQ(0, semctl(holder.id, 0, SETVAL, 1));
-    onCall = [](const std::string&, int command) { return command == 1 ? EINVAL : 0; };
+    failCall("semop", 1, EINVAL);
     EXPECT_EQ(sqloNLCKOwnerDied, sqloNLCKLock(&lock, 0, -1));
     onCall = nullptr;
     EXPECT_EQ(0, sqloNLCKUnlock(&holder));
@@ -392,10 +371,9 @@ TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
     ASSERT_EQ(0, pipe(ends));
     store(filesOf(" 10/ 10"));
     const pid_t holder = inChild([&] {
-        SQLUH_HANDLE* handle = nullptr;
         char byte;
         close(ends[1]);
-        if (sqluhBeginBatch(&handle, directory.data()) != 0 || append(handle, 3) != 0)
+        if (sqluhBeginBatch(&mine, directory.data()) != 0 || append(mine, 3) != 0)
             return 1;
         // A child that outlives it does not make it look alive.
         return fork() == 0 ? static_cast<int>(read(ends[0], &byte, 1)) : pause();
@@ -443,16 +421,15 @@ TEST_F(ProcessTest, NobodyGetsInWhileTheHolderOfANewFileWorks)
 {
     for (const char* before : {"-", "junk", " 10/ 10"}) {
         store(filesOf(before));
-        SQLUH_HANDLE* handle = nullptr;
-        ASSERT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
+        ASSERT_EQ(0, sqluhBeginBatch(&mine, directory.data()));
         const pid_t earlier = inChild([this] { return batch(1) != 0; });
-        for (int i = 0; i < 20000 && semctl(handle->namedLock.id, 0, GETNCNT) != 1; i++)
+        for (int i = 0; i < 20000 && semctl(mine->namedLock.id, 0, GETNCNT) != 1; i++)
             usleep(100);
-        EXPECT_EQ(0, restore(handle, samples.at(2)));
+        EXPECT_EQ(0, restore(mine, samples.at(2)));
         const pid_t later = inChild([this] { return batch(1) != 0; });
         usleep(20000);
         EXPECT_EQ(0, waitpid(earlier, nullptr, WNOHANG) + waitpid(later, nullptr, WNOHANG));
-        EXPECT_EQ(0, sqluhClose(&handle));
+        EXPECT_EQ(0, sqluhClose(&mine));
         EXPECT_EQ(0, waitFor(earlier) + waitFor(later));
         EXPECT_EQ(4u, writers().size());
         EXPECT_EQ(0, removeSetsLeft());
@@ -487,20 +464,18 @@ class RestoreTest : public ProcessTest
     template <typename use> int restoreMeeting(use other)
     {
         store(filesOf(" 10/ 10"));
-        EXPECT_EQ(0, sqluhOpen(&handle, directory.data(), SQLUH_OPEN_UPDATE));
+        EXPECT_EQ(0, sqluhOpen(&mine, directory.data(), SQLUH_OPEN_UPDATE));
         bool entered = false;
         onCall = [&](const std::string& call, int) {
             if (call == "semget" && !std::exchange(entered, true))
                 other();
             return 0;
         };
-        const int rc = restore(handle, samples.at(2));
+        const int rc = restore(mine, samples.at(2));
         onCall = nullptr;
         EXPECT_TRUE(entered);
         return rc;
     }
-
-    SQLUH_HANDLE* handle = nullptr;
 };
 
 // It may find nothing but damage, and move the new file aside; and then fail to make its own.
@@ -510,13 +485,11 @@ TEST_F(RestoreTest, DoesNotFollowAFileThatWasMovedAside)
         EXPECT_EQ(0, restoreMeeting([&] {
                       spill(shadowPath, "junk");
                       EXPECT_EQ(0, waitFor(inChild([&] {
-                                    onSystemCall = [&](const std::string& call) {
-                                        return isFull && call == "pwrite" ? ENOSPC : 0;
-                                    };
+                                    failSystemCall("write", isFull ? ENOSPC : 0);
                                     return openAndClose() != (isFull ? int{DISK_FULL} : 2160);
                                 })));
                   }));
-        EXPECT_EQ(0, sqluhClose(&handle));
+        EXPECT_EQ(0, sqluhClose(&mine));
         EXPECT_TRUE(samples.at(2) == slurp(historyPath) && samples.at(2) == slurp(shadowPath));
         EXPECT_EQ(0, removeSetsLeft());
     }
@@ -531,7 +504,7 @@ TEST_F(RestoreTest, LeavesTheShadowToADeadProcessBatch)
                       return sqluhBeginBatch(&batch, directory.data()) + append(batch, 1);
                   }));
               }));
-    EXPECT_EQ(sqloNLCKOwnerDied, sqluhClose(&handle));
+    EXPECT_EQ(sqloNLCKOwnerDied, sqluhClose(&mine));
     const SQLO_NLCKSTATE state = lockState();
     EXPECT_EQ(0, sqloNLCKRemoveDead(&lock, &state));
     EXPECT_EQ("", faultOf({10}));
@@ -544,10 +517,10 @@ TEST_F(RestoreTest, IsRefusedWhereItCouldNotBeFinished)
         EXPECT_EQ(0, restoreMeeting([] {}));
         const std::string shadow = slurp(shadowPath);
         if (isFull)
-            onSystemCall = [](const std::string& call) { return call == "fallocate" ? ENOSPC : 0; };
+            failSystemCall("reserve", ENOSPC);
         else
-            EXPECT_EQ(0, semctl(handle->namedLock.id, 0, IPC_RMID));
-        EXPECT_EQ(isFull ? int{DISK_FULL} : int{sqloNLCKLost}, sqluhClose(&handle));
+            EXPECT_EQ(0, semctl(mine->namedLock.id, 0, IPC_RMID));
+        EXPECT_EQ(isFull ? int{DISK_FULL} : int{sqloNLCKLost}, sqluhClose(&mine));
         onSystemCall = nullptr;
         EXPECT_TRUE(shadow == slurp(shadowPath));
         EXPECT_EQ("", faultOf({10}));
@@ -561,12 +534,12 @@ TEST_F(RestoreTest, IsRefusedAfterAPieceThatFailed)
         EXPECT_EQ(0, restoreMeeting([] {}));
         std::string piece = "piece";
         auto* bytes = reinterpret_cast<unsigned char*>(piece.data());
-        onSystemCall = [](const std::string& call) { return call == "pwrite" ? ENOSPC : 0; };
-        EXPECT_EQ(DISK_FULL, sqluh_write_restore_buffer(handle, 1024, bytes, 5));
+        failSystemCall("write", ENOSPC);
+        EXPECT_EQ(DISK_FULL, sqluh_write_restore_buffer(mine, 1024, bytes, 5));
         onSystemCall = nullptr;
-        EXPECT_EQ(0, sqluh_write_restore_buffer(handle, 1024, bytes, 5));
-        EXPECT_EQ(0, again ? restore(handle, samples.at(2)) : 0);
-        EXPECT_EQ(again ? 0 : int{DISK_FULL}, sqluhClose(&handle));
+        EXPECT_EQ(0, sqluh_write_restore_buffer(mine, 1024, bytes, 5));
+        EXPECT_EQ(0, again ? restore(mine, samples.at(2)) : 0);
+        EXPECT_EQ(again ? 0 : int{DISK_FULL}, sqluhClose(&mine));
         EXPECT_EQ("", faultOf({again ? 2u : 10u}));
     }
 }
@@ -576,19 +549,18 @@ TEST_F(RestoreTest, IsRefusedAfterAPieceThatFailed)
 TEST_F(ProcessTest, ABatchWhoseLockWasTakenAwayIsRefused)
 {
     for (const bool isRemoved : {true, false}) {
-        SQLUH_HANDLE* handle = nullptr;
         store(filesOf(" 10/ 10"));
-        ASSERT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
-        EXPECT_EQ(0, append(handle, 2));
+        ASSERT_EQ(0, sqluhBeginBatch(&mine, directory.data()));
+        EXPECT_EQ(0, append(mine, 2));
         EXPECT_EQ(0, waitFor(inChild([&] {
                       sembuf step = {0, 1, 0};
                       if (!isRemoved)
-                          return semop(handle->namedLock.id, &step, 1) != 0 ||
+                          return semop(mine->namedLock.id, &step, 1) != 0 ||
                                  batch(1) != sqloNLCKOwnerDied ||
                                  lockState().state != sqloNLCKFaked;
-                      return semctl(handle->namedLock.id, 0, IPC_RMID) != 0 || batch(1) != 0;
+                      return semctl(mine->namedLock.id, 0, IPC_RMID) != 0 || batch(1) != 0;
                   })));
-        EXPECT_EQ(sqloNLCKLost, sqluhEndBatch(&handle, sqluhCommit));
+        EXPECT_EQ(sqloNLCKLost, sqluhEndBatch(&mine, sqluhCommit));
         EXPECT_EQ("", faultOf({isRemoved ? 11u : 10u}));
     }
 }
@@ -630,26 +602,23 @@ TEST_F(ProcessTest, AFileThatCannotBeOpenedStays)
 TEST_F(ProcessTest, AThreadDoesNotWaitForItself)
 {
     store(filesOf(" 10/ 10"));
-    SQLUH_HANDLE* handle = nullptr;
-    ASSERT_EQ(0, sqluhBeginBatch(&handle, directory.data()));
+    ASSERT_EQ(0, sqluhBeginBatch(&mine, directory.data()));
     EXPECT_EQ(sqloNLCKDeadlock, batch(1));
     // Nor for another directory whose key is the same.
     bool isEmpty = false;
     spill(sourceDirectory + SQLUH_HISTORY_NAME, samples.at(1));
-    onlyKey = handle->namedLock.key;
+    onlyKey = mine->namedLock.key;
     EXPECT_EQ(sqloNLCKDeadlock, sqluhIsHistoryFileEmpty(sourceDirectory.data(), &isEmpty));
     onlyKey = -1;
     int other = -1;
     std::thread waiter([&] { other = openAndClose(); });
     usleep(20000);
     EXPECT_EQ(-1, other);
-    EXPECT_EQ(0, sqluhEndBatch(&handle, sqluhCommit));
+    EXPECT_EQ(0, sqluhEndBatch(&mine, sqluhCommit));
     waiter.join();
     EXPECT_EQ(0, other);
     // Nor for a lock that it could not release.
-    onCall = [](const std::string& call, int command) {
-        return call == "semctl" && command == IPC_RMID ? EPERM : 0;
-    };
+    failCall("semctl", IPC_RMID, EPERM);
     EXPECT_EQ(sqloSystemError | EPERM, sqluhIsHistoryFileEmpty(directory.data(), &isEmpty));
     onCall = nullptr;
     EXPECT_FALSE(isEmpty);
