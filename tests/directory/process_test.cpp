@@ -7,7 +7,6 @@
 #include <random>
 #include <sys/mman.h>
 #include <thread>
-#include <utility>
 
 // What the system makes of any path: two may have one key, and of one path in some thousands of
 // millions it makes that which nobody shares. -1: what it really makes.
@@ -42,6 +41,12 @@ extern "C" int usleep(useconds_t duration)
 class ProcessTest : public DirectoryTest
 {
   protected:
+    void useLockOnly()
+    {
+        store(filesOf("empty"));
+        lockState();
+    }
+
     // Of each entry of the history the node number that its writer gave it. Both files are sound
     // and agree, the entries are numbered from 1 on, and as many as the header says.
     std::vector<size_t> writers()
@@ -59,85 +64,61 @@ class ProcessTest : public DirectoryTest
         return found;
     }
 };
+
+using LockTest = ProcessTest;
+
 // A call of the protocol that fails once: for the creator of the set or, held meaning that the lock
-// is taken, for one that comes later.
-struct failingLockCall {
-    bool held;
-    const char* call;
-    int command;
-    std::vector<int> errors;
-    int code = 0; // 0: the error itself
-};
-static const std::vector<failingLockCall> failingLockCalls = {
-    {false, "semget", IPC_CREAT | IPC_EXCL | 0747, {ENOSPC}},
-    {false, "semctl", SETVAL, {EINVAL}},
-    {false, "semop", -1, {ENOSPC}},
-    {false, "semctl", IPC_STAT, {EINVAL}},
-    {false, "semctl", IPC_SET, {EPERM}},
-    {true, "semget", 0, {EINVAL}},
-    {true, "semctl", IPC_STAT, {EFAULT}},
-    {true, "semop", -1, {EFBIG}},
-    {true, "semget", 0, {EACCES}, sqloNLCKKeyConflict},
-    {true, "semctl", IPC_STAT, {EACCES}, sqloNLCKKeyConflict},
-    // Vanished or interrupted: once more.
-    {true, "semget", 0, {ENOENT}, sqloNLCKBusy},
-    {true, "semctl", IPC_STAT, {EINVAL, EIDRM}, sqloNLCKBusy},
-    {true, "semop", -1, {EINVAL, EIDRM, EINTR}, sqloNLCKBusy},
-};
-
-class LockTest : public ProcessTest
-{
-  protected:
-    // Locks with the row's call failing so, then with every take interrupted.
-    void lockWith(const failingLockCall& row, int error)
-    {
-        EXPECT_EQ(sqloNLCKAbsent, lockState().state);
-        SQLO_NLCK holder = lock;
-        EXPECT_EQ(0, row.held ? sqloNLCKLock(&holder, 0, 0) : 0);
-        int times = 0;
-        onCall = [&](const std::string& call, int command) {
-            return call == row.call && command == row.command && times++ == 0 ? error : 0;
-        };
-        EXPECT_EQ(row.code != 0 ? row.code : sqloSystemError | error, sqloNLCKLock(&lock, 0, 0));
-        failCall("semop", -1, EINTR);
-        EXPECT_EQ(row.held ? sqloNLCKInterrupted : sqloSystemError | EINTR,
-                  sqloNLCKLock(&lock, sqloNLCKReportInterrupts, -1));
-        onCall = nullptr;
-        // A set that could not be set up is removed; one of somebody else's stays.
-        EXPECT_EQ(row.held ? sqloNLCKHeld : sqloNLCKAbsent, lockState().state);
-        EXPECT_EQ(row.held ? 0 : sqloSystemError | EINVAL, sqloNLCKUnlock(&holder));
-    }
-
-    // The pid of a creator, a zombie now, that ended just before the given call of its setup.
-    pid_t creatorThatDiesBefore(int step)
-    {
-        const pid_t creator = inChild([&] {
-            onCall = [&](const std::string& call, int command) {
-                return command == step && call != "semget" ? _exit(77), 0 : 0;
-            };
-            return sqloNLCKLock(&lock, 0, -1);
-        });
-        siginfo_t info;
-        EXPECT_EQ(0, waitid(P_PID, static_cast<id_t>(creator), &info, WEXITED | WNOWAIT));
-        EXPECT_EQ(77, info.si_status);
-        return creator;
-    }
-};
-
+// is taken, for one that comes later; then every take is interrupted.
 TEST_F(LockTest, EveryErrorOfEveryCallEndsAsItShould)
 {
-    store(filesOf("empty"));
-    for (const failingLockCall& row : failingLockCalls)
+    const struct {
+        bool held;
+        const char* call;
+        int command;
+        std::vector<int> errors;
+        int code = 0; // 0: the error itself
+    } rows[] = {
+        {false, "semget", IPC_CREAT | IPC_EXCL | 0747, {ENOSPC}},
+        {false, "semctl", SETVAL, {EINVAL}},
+        {false, "semop", -1, {ENOSPC}},
+        {false, "semctl", IPC_STAT, {EINVAL}},
+        {false, "semctl", IPC_SET, {EPERM}},
+        {true, "semget", 0, {EINVAL}},
+        {true, "semctl", IPC_STAT, {EFAULT}},
+        {true, "semop", -1, {EFBIG}},
+        {true, "semget", 0, {EACCES}, sqloNLCKKeyConflict},
+        {true, "semctl", IPC_STAT, {EACCES}, sqloNLCKKeyConflict},
+        // Vanished or interrupted: once more.
+        {true, "semget", 0, {ENOENT}, sqloNLCKBusy},
+        {true, "semctl", IPC_STAT, {EINVAL, EIDRM}, sqloNLCKBusy},
+        {true, "semop", -1, {EINVAL, EIDRM, EINTR}, sqloNLCKBusy},
+    };
+    useLockOnly();
+    for (const auto& row : rows)
         for (const int error : row.errors) {
             SCOPED_TRACE(testing::Message() << row.call << " " << row.command << " " << error);
-            lockWith(row, error);
+            EXPECT_EQ(sqloNLCKAbsent, lockState().state);
+            SQLO_NLCK holder = lock;
+            EXPECT_EQ(0, row.held ? sqloNLCKLock(&holder, 0, 0) : 0);
+            int times = 0;
+            onCall = [&](const std::string& call, int command) {
+                return call == row.call && command == row.command && times++ == 0 ? error : 0;
+            };
+            EXPECT_EQ(row.code != 0 ? row.code : sqloSystemError | error,
+                      sqloNLCKLock(&lock, 0, 0));
+            failCall("semop", -1, EINTR);
+            EXPECT_EQ(row.held ? sqloNLCKInterrupted : sqloSystemError | EINTR,
+                      sqloNLCKLock(&lock, sqloNLCKReportInterrupts, -1));
+            onCall = nullptr;
+            // A set that could not be set up is removed; one of somebody else's stays.
+            EXPECT_EQ(row.held ? sqloNLCKHeld : sqloNLCKAbsent, lockState().state);
+            EXPECT_EQ(row.held ? 0 : sqloSystemError | EINVAL, sqloNLCKUnlock(&holder));
         }
 }
 
 TEST_F(LockTest, KeysAreMadeOfFileAndProject)
 {
-    store(filesOf("empty"));
-    lockState();
+    useLockOnly();
     EXPECT_EQ(ftok(historyPath.c_str(), sqlz_krcbp->nodeNumber + 1), lock.key);
     EXPECT_EQ(0, sqloNLCKInit(historyPath.c_str(), &lock, 0));
     EXPECT_EQ(ftok(historyPath.c_str(), 'n'), lock.key);
@@ -149,8 +130,7 @@ TEST_F(LockTest, KeysAreMadeOfFileAndProject)
 
 TEST_F(LockTest, ForeignSetsAreLeftAlone)
 {
-    store(filesOf("empty"));
-    lockState();
+    useLockOnly();
     for (const int mode : {0600, 0757, 0777, 0740}) {
         const int id = semget(lock.key, 1, IPC_CREAT | IPC_EXCL | mode);
         const SQLO_NLCKSTATE state = lockState();
@@ -176,8 +156,7 @@ TEST_F(LockTest, WhoLooksIsToldWhatTheSystemSays)
                 {"semctl", GETVAL, {EIDRM}, 0, sqloNLCKAbsent},
                 {"semctl", GETPID, {EINVAL}, 0, sqloNLCKAbsent},
                 {"semctl", IPC_STAT, {EFAULT}, -1, sqloNLCKAbsent}};
-    store(filesOf("empty"));
-    lockState();
+    useLockOnly();
     SQLO_NLCK holder = lock;
     ASSERT_EQ(0, sqloNLCKLock(&holder, 0, 0));
     for (const auto& row : rows)
@@ -212,8 +191,7 @@ TEST_F(LockTest, WhoLooksIsToldWhatTheSystemSays)
 // More locks than the table of held ones has places; a file that cannot be kept locked.
 TEST_F(LockTest, ALockIsHeldAlsoWithoutItsPlaceInTheTable)
 {
-    store(filesOf("empty"));
-    lockState();
+    useLockOnly();
     std::vector<SQLO_NLCK> all(100, lock);
     size_t told = 0;
     for (size_t i = 0; i < all.size(); i++) {
@@ -253,7 +231,15 @@ TEST_F(LockTest, ACreatorThatDiesInTheSetupIsRecognised)
     setenv("ZQ3DIAGLOG", logPath.c_str(), 1);
     lockState();
     for (const int step : {SETVAL, -1, IPC_STAT, IPC_SET}) {
-        const pid_t creator = creatorThatDiesBefore(step);
+        const pid_t creator = inChild([&] {
+            onCall = [&](const std::string& call, int command) {
+                return command == step && call != "semget" ? _exit(77), 0 : 0;
+            };
+            return sqloNLCKLock(&lock, 0, -1);
+        });
+        siginfo_t info; // it stays as a zombie
+        EXPECT_EQ(0, waitid(P_PID, static_cast<id_t>(creator), &info, WEXITED | WNOWAIT));
+        EXPECT_EQ(77, info.si_status);
         SQLO_NLCKSTATE state = lockState();
         // Whoever wants the lock meanwhile waits, says so once after some seconds of polls, and
         // gets it when the set is gone.
@@ -304,42 +290,13 @@ TEST_F(LockTest, AReusedProcessNumberIsNoHolder)
 }
 
 // A child that commits without end is killed; what it has been told is committed stays.
-class KillTest : public ProcessTest
-{
-  protected:
-    std::mt19937 random{20261122};
-    std::map<int, unsigned int> found; // states of the lock
-    std::atomic<size_t>* acknowledged = static_cast<std::atomic<size_t>*>(
-        mmap(nullptr, 4096, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
-
-    ~KillTest() override
-    {
-        munmap(acknowledged, 4096);
-    }
-
-    void commitUntilKilled()
-    {
-        const pid_t child = fork();
-        if (child == 0)
-            for (unsigned int entries = 1;; entries = entries % 3 + 1)
-                *acknowledged += batch(entries) == 0 ? entries : 0;
-        usleep(static_cast<useconds_t>(200 + random() % (2500 * slowdown)));
-        kill(child, SIGKILL);
-        waitFor(child);
-    }
-
-    // While a set is set up only time would tell, but here it is known that nobody lives.
-    void removeSet()
-    {
-        const SQLO_NLCKSTATE state = lockState();
-        EXPECT_EQ(state.state != sqloNLCKAbsent, semctl(state.id, 0, IPC_RMID) == 0);
-        found[state.state]++;
-    }
-};
-
-TEST_F(KillTest, NothingAcknowledgedIsLostByKills)
+TEST_F(ProcessTest, NothingAcknowledgedIsLostByKills)
 {
     const unsigned int kills = 1000 / slowdown, killsPerHistory = 25;
+    auto* acknowledged = static_cast<std::atomic<size_t>*>(
+        mmap(nullptr, 4096, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
+    std::mt19937 random{20261122};
+    std::map<int, unsigned int> found; // states of the lock
     size_t committed = 0, unacknowledged = 0;
     for (unsigned int i = 0; i < kills; i++) {
         if (i % killsPerHistory == 0) {
@@ -347,8 +304,18 @@ TEST_F(KillTest, NothingAcknowledgedIsLostByKills)
             *acknowledged = 10;
         }
         committed -= *acknowledged;
-        commitUntilKilled();
-        removeSet();
+        const pid_t child = inChild([&] {
+            for (unsigned int entries = 1; true; entries = entries % 3 + 1)
+                *acknowledged += batch(entries) == 0 ? entries : 0;
+            return 0;
+        });
+        usleep(static_cast<useconds_t>(200 + random() % (2500 * slowdown)));
+        kill(child, SIGKILL);
+        waitFor(child);
+        // While a set is set up only time would tell, but here it is known that nobody lives.
+        const SQLO_NLCKSTATE state = lockState();
+        EXPECT_EQ(state.state != sqloNLCKAbsent, semctl(state.id, 0, IPC_RMID) == 0);
+        found[state.state]++;
         ASSERT_EQ(0, openAndClose());
         ASSERT_EQ(0, openAndClose());
         const size_t entries = writers().size();
@@ -358,6 +325,7 @@ TEST_F(KillTest, NothingAcknowledgedIsLostByKills)
         unacknowledged += entries != *acknowledged;
         *acknowledged = entries;
     }
+    munmap(acknowledged, 4096);
     printf("%u kills: lock found stale %u times, half set up %u, absent %u; %zu entries "
            "acknowledged, none lost; %zu batches survived unacknowledged\n",
            kills, found[sqloNLCKStale], found[sqloNLCKSetupDied] + found[sqloNLCKSettingUp],
@@ -510,37 +478,32 @@ TEST_F(RestoreTest, LeavesTheShadowToADeadProcessBatch)
     EXPECT_EQ("", faultOf({10}));
 }
 
-// No room for the shadow, or an administrator's hand at the lock: the old history stays.
+// No room for the shadow, an administrator's hand at the lock, or a piece that failed, which
+// another does not make good: the old history stays. A new beginning makes it good.
 TEST_F(RestoreTest, IsRefusedWhereItCouldNotBeFinished)
 {
-    for (const bool isFull : {true, false}) {
+    const auto failPiece = [this] {
+        unsigned char piece[] = "piece";
+        failSystemCall("write", ENOSPC);
+        EXPECT_EQ(DISK_FULL, sqluh_write_restore_buffer(mine, 1024, piece, 5));
+        onSystemCall = nullptr;
+        return sqluh_write_restore_buffer(mine, 1024, piece, 5);
+    };
+    const struct {
+        std::function<int()> happens;
+        int rc;
+    } rows[] = {{[] { return failSystemCall("reserve", ENOSPC), 0; }, DISK_FULL},
+                {[this] { return semctl(mine->namedLock.id, 0, IPC_RMID); }, sqloNLCKLost},
+                {failPiece, DISK_FULL},
+                {[&] { return failPiece() + restore(mine, samples.at(2)); }, 0}};
+    for (const auto& row : rows) {
         EXPECT_EQ(0, restoreMeeting([] {}));
         const std::string shadow = slurp(shadowPath);
-        if (isFull)
-            failSystemCall("reserve", ENOSPC);
-        else
-            EXPECT_EQ(0, semctl(mine->namedLock.id, 0, IPC_RMID));
-        EXPECT_EQ(isFull ? int{DISK_FULL} : int{sqloNLCKLost}, sqluhClose(&mine));
+        EXPECT_EQ(0, row.happens());
+        EXPECT_EQ(row.rc, sqluhClose(&mine));
         onSystemCall = nullptr;
-        EXPECT_TRUE(shadow == slurp(shadowPath));
-        EXPECT_EQ("", faultOf({10}));
-    }
-}
-
-// A piece that failed is not made good by another, only by a new beginning.
-TEST_F(RestoreTest, IsRefusedAfterAPieceThatFailed)
-{
-    for (const bool again : {false, true}) {
-        EXPECT_EQ(0, restoreMeeting([] {}));
-        std::string piece = "piece";
-        auto* bytes = reinterpret_cast<unsigned char*>(piece.data());
-        failSystemCall("write", ENOSPC);
-        EXPECT_EQ(DISK_FULL, sqluh_write_restore_buffer(mine, 1024, bytes, 5));
-        onSystemCall = nullptr;
-        EXPECT_EQ(0, sqluh_write_restore_buffer(mine, 1024, bytes, 5));
-        EXPECT_EQ(0, again ? restore(mine, samples.at(2)) : 0);
-        EXPECT_EQ(again ? 0 : int{DISK_FULL}, sqluhClose(&mine));
-        EXPECT_EQ("", faultOf({again ? 2u : 10u}));
+        EXPECT_EQ(row.rc != 0, shadow == slurp(shadowPath));
+        EXPECT_EQ("", faultOf({row.rc == 0 ? 2u : 10u}));
     }
 }
 
