@@ -9,21 +9,19 @@
 
 #include <array>
 #include <random>
-#include <sys/stat.h>
-#include <utility>
 
 static constexpr size_t sector = 512;
 // Of the states opened, one in so many loses the power once more.
 static const size_t share = takesAll ? 1 : 16 * slowdown;
 
 struct diskFile {
-    std::string bytes;
-    bool marked;
+    std::string bytes; // what is surely on the disk, and the mark
+    bool marked = false;
+    std::vector<diskOp> pending = {};
 };
 
 struct diskModel {
-    std::map<ino_t, diskFile> durable; // what is surely on the disk of each file
-    std::map<ino_t, std::vector<diskOp>> pending;
+    std::map<ino_t, diskFile> files;
     std::map<std::string, ino_t> names;
     std::vector<diskOp> pendingNames;
 };
@@ -70,12 +68,12 @@ static void keepSectors(const std::string& name, const std::string& cache, size_
 
 // The file with its first `lengths` pending length changes and the sectors that are kept. A mode is
 // kept or lost like a sector.
-static diskFile contentOf(const diskModel& model, const std::string& name, ino_t inode,
-                          size_t lengths, choice* kept)
+static diskFile contentOf(const diskFile& onDisk, const std::string& name, size_t lengths,
+                          choice* kept)
 {
-    diskFile file = model.durable.at(inode);
+    diskFile file = {onDisk.bytes, onDisk.marked};
     std::string cache = file.bytes, &content = file.bytes;
-    for (const diskOp& op : model.pending.at(inode)) {
+    for (const diskOp& op : onDisk.pending) {
         if (op.kind == diskMode) {
             file.marked = kept->keeps(name + "'s mode", 0) ? op.at != 0 : file.marked;
             continue;
@@ -118,75 +116,62 @@ class PowerLossTest : public DirectoryTest
             const std::string plain = name.substr(0, name.find('*'));
             EXPECT_EQ(0, stat((directory + plain).c_str(), &status));
             model.names[plain] = status.st_ino;
-            model.durable[status.st_ino] = {bytes, (status.st_mode & S_ISVTX) != 0};
-            model.pending[status.st_ino] = {};
+            model.files[status.st_ino] = {bytes, name.ends_with('*')};
         }
         return model;
     }
 
     // What the sync covers is durable; the mode is only where it says so.
-    static void sync(diskModel* model, const diskOp& op)
+    static void sync(diskFile* file, const diskOp& op)
     {
         choice all;
-        std::vector<diskOp>& pending = model->pending[op.inode];
-        diskFile file = contentOf(*model, "", op.inode, SIZE_MAX, &all);
-        file.marked = op.at != 0 ? file.marked : model->durable[op.inode].marked;
-        model->durable[op.inode] = file;
-        std::erase_if(pending,
+        const diskFile synced = contentOf(*file, "", SIZE_MAX, &all);
+        file->bytes = synced.bytes;
+        file->marked = op.at != 0 ? synced.marked : file->marked;
+        std::erase_if(file->pending,
                       [&](const diskOp& kept) { return op.at != 0 || kept.kind != diskMode; });
     }
 
     void advance(diskModel* model, const diskOp& op)
     {
-        if (op.kind < diskCreate || op.kind == diskSync) {
-            if (!model->durable.contains(op.inode))
-                return; // a file in another directory
-            if (op.kind != diskSync)
-                model->pending[op.inode].push_back(op);
-            else if (op.barrier != ignored)
-                sync(model, op);
-        } else if (op.kind == diskNames && op.barrier != ignored) {
+        const auto file = model->files.find(op.inode);
+        if (op.kind == diskNames && op.barrier != ignored) {
             for (const diskOp& change : model->pendingNames)
                 applyName(&model->names, change);
             model->pendingNames.clear();
-        } else if (op.kind != diskNames) {
+        } else if (op.kind == diskCreate || op.kind == diskUnlink || op.kind == diskRename) {
             model->pendingNames.push_back(op);
             if (op.kind == diskCreate)
-                model->durable[op.inode] = {"", false}, model->pending[op.inode] = {};
-        }
+                model->files[op.inode] = {};
+        } else if (file != model->files.end() && op.kind != diskSync) {
+            file->second.pending.push_back(op);
+        } else if (file != model->files.end() && op.barrier != ignored) {
+            sync(&file->second, op);
+        } // or a file in another directory
     }
 
     // The log for the power: a write that waits may still be lost while it does.
     static std::vector<diskOp> parted(const std::vector<diskOp>& log)
     {
         std::vector<diskOp> all;
-        for (diskOp op : log) {
-            const std::string barrier = std::exchange(op.barrier, "");
-            if (op.kind == diskWrite) {
-                all.push_back(op);
-                op.kind = diskSync;
-                op.at = 0;
-            }
-            op.barrier = barrier;
-            if (op.kind != diskSync || !barrier.empty())
-                all.push_back(op);
+        for (const diskOp& op : log) {
+            all.push_back(op);
+            if (op.kind != diskWrite || op.barrier.empty())
+                continue;
+            all.back().barrier.clear();
+            all.push_back({diskSync, op.inode, 0, "", op.name, "", op.barrier});
         }
         return all;
     }
 
-    bool isNew(const Files& state, const std::vector<unsigned int>& allowed)
+    void tryState(const Files& state, const choice& kept, const std::vector<unsigned int>& allowed)
     {
         std::string all = std::to_string(100 * allowed.front() + allowed.back());
         for (const auto& [name, bytes] : state)
             all.append(name).append(bytes);
-        return opened.insert(std::hash<std::string>()(all)).second;
-    }
-
-    void tryState(const Files& state, const choice& kept, const std::vector<unsigned int>& allowed)
-    {
         tried++;
         secondTried += isSecond;
-        if (!isNew(state, allowed))
+        if (!opened.insert(std::hash<std::string>()(all)).second)
             return;
         store(state);
         const std::string fault = faultOf(allowed);
@@ -238,7 +223,7 @@ class PowerLossTest : public DirectoryTest
             Files state;
             for (const auto& [name, inode] : names) {
                 const size_t lengths = kept.most ? SIZE_MAX : way == 1 ? 0 : random() % 8;
-                const diskFile file = contentOf(model, name, inode, lengths, &kept);
+                const diskFile file = contentOf(model.files.at(inode), name, lengths, &kept);
                 state[name + (file.marked ? "*" : "")] = file.bytes;
             }
             sectors = way == 0 ? kept.asked : sectors;
@@ -304,19 +289,18 @@ TEST_F(PowerLossTest, EveryStateAfterAPowerLossOpensAsTheOldOrTheNewHistory)
 // Each barrier and each safeguard on its own is necessary: without it some state is bad.
 TEST_F(PowerLossTest, EverySafeguardTakenOutLosesAHistory)
 {
-    const struct {
-        const char *safeguard, *action;
-    } rows[] = {{"B1", "commit"}, {"B2", "commit"},     {"B3", "commit"},   {"B4", "commit"},
-                {"R0", "commit"}, {"R4", "commit"},     {"CH", "commit"},   {"D", "create"},
-                {"RP", "copy"},   {"MB", "restore"},    {"MZ", "restore"},  {"MM", "restore"},
-                {"N", "create"},  {"one call", "open"}, {"mark", "restore"}};
-    for (const auto& row : rows) {
-        ignored = without = row.safeguard;
+    const std::pair<const char*, const char*> rows[] = {
+        {"B1", "commit"}, {"B2", "commit"},     {"B3", "commit"},   {"B4", "commit"},
+        {"R0", "commit"}, {"R4", "commit"},     {"CH", "commit"},   {"D", "create"},
+        {"RP", "copy"},   {"MB", "restore"},    {"MZ", "restore"},  {"MM", "restore"},
+        {"N", "create"},  {"one call", "open"}, {"mark", "restore"}};
+    for (const auto& [safeguard, action] : rows) {
+        ignored = without = safeguard;
         tried = 0;
         bad.clear();
         opened.clear();
-        cutAll(8, row.action);
-        printf("without %s: bad state after %zu states, %s\n", row.safeguard, tried, bad.c_str());
-        EXPECT_NE("", bad) << row.safeguard;
+        cutAll(8, action);
+        printf("without %s: bad state after %zu states, %s\n", safeguard, tried, bad.c_str());
+        EXPECT_NE("", bad) << safeguard;
     }
 }
