@@ -49,6 +49,9 @@ template <typename function> static function realOf(function, const char* name)
 inline time_t changeTime;
 // What the clock that stamps files is made to say beside the truth.
 inline time_t clockAhead;
+// Whether time runs for who waits, and the file system that there seems to be.
+inline time_t impatience;
+inline long fileSystem;
 
 enum diskKind {
     diskWrite,
@@ -198,14 +201,7 @@ class DirectoryTest : public HistoryTest
         disk = {};
         without.clear();
         std::filesystem::create_directory(sourceDirectory);
-        if (samples.empty())
-            makeSamples();
-        store({});
-    }
-
-    void makeSamples()
-    {
-        for (unsigned int i = 0; i <= 32; i++) {
+        for (unsigned int i = static_cast<unsigned int>(samples.size()); i <= 32; i++) {
             writer = i > 17 && i <= 30;
             EXPECT_EQ(0, i == 0 || i == 20 ? sqluhCreate(directory.data()) : batch(1));
             samples[i] = slurp(historyPath);
@@ -213,6 +209,8 @@ class DirectoryTest : public HistoryTest
             for (const char status : {' ', 'C', 'P'})
                 known.try_emplace(fileOf(status + std::to_string(i)), i);
         }
+        writer = 0;
+        store({});
     }
 
     // --- Files as values -------------------------------------------------------------------------
@@ -296,12 +294,6 @@ class DirectoryTest : public HistoryTest
         return found == known.end() ? 999 : found->second;
     }
 
-    // The number of entries that the header tells.
-    static unsigned int countOf(const std::string& image)
-    {
-        return static_cast<unsigned int>(std::stoul(image.substr(60, 8), nullptr, 16));
-    }
-
     // --- Uses of a directory ---------------------------------------------------------------------
 
     // Appends entries numbered on from the header's count, and keeps that count.
@@ -355,23 +347,6 @@ class DirectoryTest : public HistoryTest
         return rc;
     }
 
-    int restoreImage(const std::string& image)
-    {
-        SQLUH_HANDLE* handle = nullptr;
-        int rc = sqluhOpen(&handle, directory.data(), SQLUH_OPEN_UPDATE);
-        if (rc >= 0)
-            rc = restore(handle, image);
-        const int closed = sqluhClose(&handle);
-        return rc != 0 ? rc : closed;
-    }
-
-    int copyFrom(const std::string& image)
-    {
-        spill(sourceDirectory + SQLUH_HISTORY_NAME, image);
-        spill(sourceDirectory + SQLUH_SHADOW_NAME, image);
-        return sqluhCopyHistoryFile(sourceDirectory.data(), directory.data());
-    }
-
     int run(const scenario& s)
     {
         disk.replacing = s.action == "restore" || s.action == "copy";
@@ -379,11 +354,21 @@ class DirectoryTest : public HistoryTest
             return openAndClose();
         if (s.action == "create")
             return sqluhCreate(directory.data());
-        if (disk.replacing)
-            return s.action == "copy" ? copyFrom(samples.at(s.outcomes.back()))
-                                      : restoreImage(samples.at(s.outcomes.back()));
-        return batch(static_cast<unsigned int>(s.action.back() - '0'),
-                     s.action[0] == 'c' ? sqluhCommit : sqluhAbandon);
+        const std::string& image = samples.at(s.outcomes.back());
+        if (s.action == "copy") {
+            spill(sourceDirectory + SQLUH_HISTORY_NAME, image);
+            spill(sourceDirectory + SQLUH_SHADOW_NAME, image);
+            return sqluhCopyHistoryFile(sourceDirectory.data(), directory.data());
+        }
+        if (!disk.replacing)
+            return batch(static_cast<unsigned int>(s.action.back() - '0'),
+                         s.action[0] == 'c' ? sqluhCommit : sqluhAbandon);
+        SQLUH_HANDLE* handle = nullptr;
+        int rc = sqluhOpen(&handle, directory.data(), SQLUH_OPEN_UPDATE);
+        if (rc >= 0)
+            rc = restore(handle, image);
+        const int closed = sqluhClose(&handle);
+        return rc != 0 ? rc : closed;
     }
 
     // Which of the samples a read of the committed history gives, or its code.

@@ -4,6 +4,7 @@
 #include <atomic>
 #include <csignal>
 #include <fcntl.h>
+#include <linux/magic.h>
 #include <random>
 #include <sys/mman.h>
 #include <thread>
@@ -60,7 +61,7 @@ class ProcessTest : public DirectoryTest
             found.push_back(std::stoul(image.substr(at + 9, 4), nullptr, 16));
             EXPECT_EQ(found.size(), std::stoul(image.substr(at + 14, 8), nullptr, 16));
         }
-        EXPECT_EQ(found.size(), countOf(image));
+        EXPECT_EQ(found.size(), std::stoul(image.substr(60, 8), nullptr, 16));
         return found;
     }
 };
@@ -333,6 +334,33 @@ TEST_F(ProcessTest, NothingAcknowledgedIsLostByKills)
     EXPECT_GT(found[sqloNLCKStale], kills / 20);
 }
 
+TEST_F(ProcessTest, EveryBatchOfEightProcessesIsAppendedOnceAndReadWhole)
+{
+    const int processes = 8, batches = 600 / static_cast<int>(slowdown);
+    store(filesOf(" 9/ 9"));
+    for (; writer < processes; writer++)
+        inChild([&] {
+            int done = 0;
+            while (done < batches && batch(3) == 0)
+                done++;
+            return done != batches;
+        });
+    int rows = 9, reads = 0;
+    for (int ended = 0; ended < processes; reads++) {
+        const int before = std::exchange(rows, readCommitted());
+        EXPECT_EQ(0, rows % 3);
+        EXPECT_GE(rows, before);
+        for (int status = 0; waitpid(-1, &status, WNOHANG) > 0; ended++)
+            EXPECT_EQ(0, status);
+    }
+    const std::vector<size_t> found = writers();
+    for (int by = 0; by < processes; by++)
+        EXPECT_EQ(3 * batches + (by == 0 ? 9 : 0),
+                  std::ranges::count(found, static_cast<size_t>(by)));
+    EXPECT_EQ(found.size(), static_cast<size_t>(readCommitted()));
+    printf("%d reads beside %d processes of %d batches\n", reads, processes, batches);
+}
+
 TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
 {
     int ends[2];
@@ -348,6 +376,12 @@ TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
     });
     while (slurp(historyPath).size() < samples.at(13).size())
         usleep(100);
+    // Where only the lock helps, a reader waits for that of the living for some seconds, and leaves
+    // that of the dead.
+    fileSystem = NFS_SUPER_MAGIC;
+    impatience = 1;
+    EXPECT_EQ(sqloNLCKBusy, readCommitted());
+    impatience = 0;
     const SQLO_NLCKSTATE held = lockState();
     EXPECT_EQ(sqloNLCKHeld, held.state);
     EXPECT_EQ(holder, held.pid);
@@ -362,8 +396,12 @@ TEST_F(ProcessTest, EverybodyIsToldThatTheHolderDiedUntilItsSetIsRemoved)
     for (const pid_t pid : waiting)
         EXPECT_EQ(0, waitFor(pid));
     EXPECT_EQ(sqloNLCKOwnerDied, openAndClose());
+    const SQLO_NLCKSTATE dead = lockState();
+    EXPECT_EQ(10, readCommitted());
+    fileSystem = 0;
     const SQLO_NLCKSTATE stale = lockState();
     EXPECT_EQ(sqloNLCKStale, stale.state);
+    EXPECT_TRUE(dead.id == stale.id && dead.pid == stale.pid);
     EXPECT_EQ(sqloNLCKBusy, sqloNLCKRemoveDead(&lock, &held)); // no longer what was seen
     // Whoever does not know the directory finds the set as well, and none of another node.
     SQLO_NLCK other, elsewhere = {lock.key ^ 1 << 24, -1};

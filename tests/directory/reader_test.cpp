@@ -1,21 +1,16 @@
-// The reader of the committed history beside writers that run through, work or die.
+// The reader of the committed history beside writers.
 #include "directory/fixture.h"
 
-#include <csignal>
 #include <ctime>
 #include <linux/magic.h>
 #include <sys/vfs.h>
-
-// Whether time runs for who waits, and the file system that there seems to be.
-static time_t impatience;
-static decltype(statfs::f_type) fileSystem;
 
 extern "C" int fstatfs(int fd, struct statfs* system) noexcept
 {
     static const auto real = realOf(&fstatfs, "fstatfs64");
     const int rc = real(fd, system);
     if (fileSystem != 0)
-        system->f_type = fileSystem;
+        system->f_type = static_cast<decltype(system->f_type)>(fileSystem);
     return rc;
 }
 
@@ -31,15 +26,7 @@ extern "C" int clock_gettime(clockid_t id, timespec* time) noexcept
     return rc;
 }
 
-class ReaderTest : public DirectoryTest
-{
-  protected:
-    // A tick of the clock that stamps files, so that what was written before it looks old.
-    static void nextTick()
-    {
-        usleep(10000);
-    }
-};
+using ReaderTest = DirectoryTest;
 
 // A writer runs through while the reader stands before one of its calls.
 TEST_F(ReaderTest, AWriterThatRunsThroughAReadCostsAtMostARetry)
@@ -55,7 +42,7 @@ TEST_F(ReaderTest, AWriterThatRunsThroughAReadCostsAtMostARetry)
     for (const scenario& s : writers)
         for (int stop = 0, calls = 1; stop < calls; stop += static_cast<int>(slowdown)) {
             store(filesOf(s.before));
-            nextTick();
+            usleep(10000); // a tick of the clock that stamps files: they look old
             calls = 0;
             onCall = [&](const std::string&, int) {
                 if (calls++ == stop) {
@@ -84,7 +71,7 @@ static const struct {
     time_t ahead, aheadLater; // the clock, before and from the first entry on
     time_t age;               // of the files in whole seconds
     bool torn;                // the first read meets half a header
-    decltype(statfs::f_type) fileSystem;
+    long fileSystem;
     unsigned int reads;
     bool locked;
 } doubts[] = {
@@ -105,7 +92,7 @@ TEST_F(ReaderTest, WhatCannotBeProvenIsReadAgainOrUnderTheLock)
     for (const auto& row : doubts) {
         const Files files = filesOf(row.files);
         store(files);
-        nextTick();
+        usleep(10000);
         clockAhead = row.ahead;
         changeTime = row.age != 0 ? time(nullptr) - row.age : 0;
         fileSystem = row.fileSystem;
@@ -126,52 +113,4 @@ TEST_F(ReaderTest, WhatCannotBeProvenIsReadAgainOrUnderTheLock)
         EXPECT_EQ(row.locked, sets == 1) << row.what;
         EXPECT_EQ(0, removeSetsLeft()) << row.what;
     }
-}
-
-TEST_F(ReaderTest, BesideBusyWritersEveryReadGivesWholeBatches)
-{
-    const int writers = 3, batches = 1500 / static_cast<int>(slowdown);
-    store(filesOf(" 9/ 9"));
-    for (int i = 0; i < writers; i++)
-        inChild([&] {
-            int done = 0;
-            while (done < batches && batch(3) == 0)
-                done++;
-            return done != batches;
-        });
-    int rows = 9, reads = 0;
-    for (int ended = 0; ended < writers; reads++) {
-        const int before = std::exchange(rows, readCommitted());
-        EXPECT_EQ(0, rows % 3);
-        EXPECT_GE(rows, before);
-        for (int status = 0; waitpid(-1, &status, WNOHANG) > 0; ended++)
-            EXPECT_EQ(0, status);
-    }
-    printf("%d reads beside %d writers of %d batches\n", reads, writers, batches);
-    EXPECT_EQ(9 + writers * batches * 3, readCommitted());
-}
-
-// Where only the lock helps: that of the living is waited for, for some seconds; that of the dead
-// keeps writers out.
-TEST_F(ReaderTest, SomebodyElsesLockIsLeftAsItIs)
-{
-    store(filesOf(" 10/ 10"));
-    const pid_t holder =
-        inChild([&] { return sqluhBeginBatch(&mine, directory.data()) != 0 || ::pause(); });
-    while (lockState().state != sqloNLCKHeld)
-        nextTick();
-    fileSystem = NFS_SUPER_MAGIC;
-    impatience = 1;
-    EXPECT_EQ(sqloNLCKBusy, readCommitted());
-    impatience = 0;
-    const SQLO_NLCKSTATE held = lockState();
-    EXPECT_EQ(sqloNLCKHeld, held.state);
-    kill(holder, SIGKILL);
-    waitFor(holder);
-    EXPECT_EQ(10, readCommitted());
-    fileSystem = 0;
-    const SQLO_NLCKSTATE stale = lockState();
-    EXPECT_EQ(sqloNLCKStale, stale.state);
-    EXPECT_EQ(held.id, stale.id);
-    EXPECT_EQ(held.pid, stale.pid);
 }

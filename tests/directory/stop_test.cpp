@@ -24,8 +24,13 @@ class StopTest : public DirectoryTest
     std::map<Files, std::string> statesAfterStops(const scenario& s)
     {
         std::map<Files, std::string> states;
-        const std::set<int> readable = readsBeside(s);
+        // A read may give what it gave before, too; of what nobody could use, a refusal, whichever.
+        std::set<int> readable(s.outcomes.begin(), s.outcomes.end());
         store(filesOf(s.before));
+        const int before = readCommitted();
+        readable.insert(before);
+        if (before < 0)
+            readable.insert({HISTORY_FILE_DAMAGED, HISTORY_FILE_MISSING});
         watch([&] { return run(s); });
         const std::vector<diskOp> whole = disk.log;
         for (const stopPoint& stop : stops()) {
@@ -38,19 +43,6 @@ class StopTest : public DirectoryTest
             first++;
         }
         return states;
-    }
-
-    // What a read may give while the scenario is under way: its outcomes, or what it gave before;
-    // of files that nobody could use, a refusal, whichever.
-    std::set<int> readsBeside(const scenario& s)
-    {
-        std::set<int> results(s.outcomes.begin(), s.outcomes.end());
-        store(filesOf(s.before));
-        const int before = readCommitted();
-        results.insert(before);
-        if (before < 0)
-            results.insert({HISTORY_FILE_DAMAGED, HISTORY_FILE_MISSING});
-        return results;
     }
 
     // Reads, which changes nothing. Nothing happens beside, so the clock need not be waited for.
@@ -183,8 +175,7 @@ class FailureTest : public DirectoryTest
 
     static long openDescriptors()
     {
-        const std::filesystem::directory_iterator list("/proc/self/fd");
-        return std::distance(begin(list), end(list));
+        return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {});
     }
 
     // The histories that the files hold whole and committed, under their own names.
