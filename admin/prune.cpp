@@ -69,6 +69,8 @@ static int findBeginning(historyPlace* place, const char* before, prunePlan* pla
     imageCatalog catalog = {};
     chainWalk walk = {};
     int rc = readCatalog(place, nullptr, &catalog);
+    if (rc == 0 && catalog.isCut) // whatever stays may need what is missing
+        rc = failInPlace(HISTORY_FILE_DAMAGED, "prune the history", place);
     if (rc == 0)
         rc = walkChains(&catalog, catalog.history.numEntries - 1, &walk);
     snprintf(plan->from, sizeof plan->from, "%s", before);
@@ -91,26 +93,22 @@ static bool stays(const void* context, const zq3HistoryData* entry)
            (plan->keepRenames && entry->operation == zq3OperationRename);
 }
 
-// What pruning would come to.
+// What pruning would come to. The history was read before, and what is to be told of it was told.
 static int rehearsePruning(const historyPlace* place, const prunePlan* plan, partReport* part)
 {
     entryRoom room;
     SQLUH_COMMITTED* committed = nullptr;
-    int rc = readCommitted(place, &committed);
+    int code = sqluhReadCommitted(place->directory, &committed);
     prepareRoom(&room);
-    if (rc != 0)
-        return rc;
-    if (committed->failure != 0)
-        rc = failDamaged(place, committed, "prune the history");
-    else if (committed->numRows < committed->header.entryCount)
-        rc = failInPlace(HISTORY_FILE_DAMAGED, "prune the history", place);
-    for (uint32_t row = 0; rc == 0 && row < committed->numRows; row++) {
+    if (code >= 0 && committed->failure != 0)
+        code = committed->failure;
+    for (uint32_t row = 0; code >= 0 && row < committed->numRows; row++) {
         sqluhGetCommitted(committed, row, &room.entry, false);
         part->total++;
         part->kept += stays(plan, &room.data);
     }
     sqluhFreeCommitted(&committed);
-    return rc;
+    return code >= 0 ? 0 : failInPlace(code, "prune the history", place);
 }
 
 static void tellPart(const prunePlan* plan, const partReport* part, bool dryRun)

@@ -131,6 +131,15 @@ class ChangeTest : public ProgramTest
 #define KEPT(file) "The old file is kept as h/zq3rhist." file ".STAMP\n"
 #define RESTORABLE                                                                                 \
     ", 3 images, 0 incomplete; newest that can be restored: 20250107010000, HOURS old\n"
+#define NEITHER                                                                                    \
+    "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "       \
+    "--force h/ goes on with what can be read\n[3]"
+#define UNLOCK                                                                                     \
+    "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and settles what "  \
+    "is unfinished\n"
+#define ENDS_EARLY                                                                                 \
+    "zq3hist: warning: the history ends after 1 of 3 entries, h/\n"                                \
+    "zq3hist: hint: zq3hist verify h/  # reads both files and tells what mends them\n"
 #define FROM_SHADOW "zq3hist: hint: zq3hist repair h/  # takes the entries of the shadow\n[3]"
 
 TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
@@ -158,28 +167,26 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
         {CUT("asc", "1803") CUT("bak", "1803"), "verify h/",
          "zq3rhist.asc: ends at offset 1803, after 1 of 3 entries\n"
          "zq3rhist.bak: ends at offset 1803, after 1 of 3 entries\n"
-         "zq3hist: the history is not sound, h/\n"
-         "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "
-         "--force h/ goes on with what can be read\n[3]",
+         "zq3hist: the history is not sound, h/\n" NEITHER,
          "1 1"},
         {CUT("asc", "1803") CUT("bak", "1803"), "plan h/ latest",
-         "1/1  full         20250105010000  A  target\n"
-         "zq3hist: warning: the history ends after 1 of 3 entries, h/\n"
-         "zq3hist: hint: zq3hist verify h/  # reads both files and tells what mends them\n[0]",
+         "1/1  full         20250105010000  A  target\n" ENDS_EARLY "[0]", "1 1"},
+        {CUT("asc", "1803") CUT("bak", "1803"), "unneeded --keep 1 h/",
+         ENDS_EARLY "zq3hist: what the entries need that are missing cannot be told, h/\n[3]",
+         "1 1"},
+        {CUT("asc", "1803") CUT("bak", "1803"), "prune --dry-run --before 20250107000000 h/",
+         ENDS_EARLY "zq3hist: cannot prune the history: the history is damaged, h/\n"
+                    "zq3hist: hint: zq3hist verify h/  # names the damage and what mends it\n[3]",
          "1 1"},
         {CUT("asc", "1803") CUT("bak", "2582"), "repair --force h/",
          "Neither file is whole; a history of what can be read was made: 2 entries\n" KEPT("asc")
              KEPT("bak") "[0]",
          "2 2 1 2"},
         {SPOIL("asc", "10") SPOIL("bak", "10"), "repair h/",
-         "zq3hist: cannot repair the history: the file is no history, h/zq3rhist.asc\n"
-         "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "
-         "--force h/ goes on with what can be read\n[3]",
+         "zq3hist: cannot repair the history: the file is no history, h/zq3rhist.asc\n" NEITHER,
          "x x"},
         {SPOIL("asc", "10") SPOIL("bak", "10"), "backup h/ new",
-         "zq3hist: cannot back up the history: the file is no history, h/zq3rhist.asc\n"
-         "zq3hist: hint: zq3hist restore h/ FILE  # FILE: a backup; without one, zq3hist repair "
-         "--force h/ goes on with what can be read\n[3]",
+         "zq3hist: cannot back up the history: the file is no history, h/zq3rhist.asc\n" NEITHER,
          "x x"},
         {SPOIL("asc", "2000"), "repair --dry-run h/",
          "The history file would be made anew from the shadow: 3 entries\n[0]", "1 3"},
@@ -194,9 +201,7 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "\"entryCount\":3,\"keptFiles\":[\"h/zq3rhist.asc.STAMP\"]}\n[0]",
          "3 3 1"},
         {KILLED, "repair h/",
-         "zq3hist: cannot take the lock: a process died while it held the lock, h/\n"
-         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and settles "
-         "what is unfinished\n[4]",
+         "zq3hist: cannot take the lock: a process died while it held the lock, h/\n" UNLOCK "[4]",
          "4 3"},
         {BEGUN, "load --wait 0 h/ more", "zq3hist: the lock is held by process PID, h/\n[4]",
          "3 3"},
@@ -214,9 +219,7 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "shadow    zq3rhist.bak: 3361 bytes, status 'C' (consistent since the last commit), 3 "
          "entries, newest 20250107010000 at offset 2582, node 0\n"
          "lock      left by a process that died while it held it (key KEY, process PID)\n"
-         "          usable; the next open rebuilds the history from the shadow\n"
-         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and settles "
-         "what is unfinished\n[4]",
+         "          usable; the next open rebuilds the history from the shadow\n" UNLOCK "[4]",
          "4 3"},
         {BEGUN, "check h/", "ok: a process is changing the history; 3 entries" RESTORABLE "[0]",
          "3 3"},
@@ -441,9 +444,7 @@ TEST_F(ChangeTest, QuestionsAreAnsweredInEveryState)
          "zq3hist: warning: a batch is being written; the state before it was read, h/\n"},
         {KILLED, 0,
          "zq3hist: warning: a process died while it held the lock, which stops the next writer, "
-         "h/\n"
-         "zq3hist: hint: zq3hist unlock h/ && zq3hist repair h/  # removes the lock and "
-         "settles what is unfinished\n"
+         "h/\n" UNLOCK
          "zq3hist: warning: a batch is unfinished; the state before it was read, h/\n"},
         {SPOIL("asc", "10"), 0, SHADOW_READ},
         {"rm h/zq3rhist.asc; ", 0, SHADOW_READ},

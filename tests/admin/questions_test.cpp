@@ -195,22 +195,18 @@ TEST_F(QuestionTest, AnswersInFull)
          "20250108010000  delta        database              2       4  incomplete: B lacks the "
          "image 20241201010000\n"
          "20250109010000  full         database              1       1  complete\n"
-         "7 images, 8 shown, 1 incomplete; newest that can be restored: 20250109010000\n"
-         "[0]"},
+         "7 images, 8 shown, 1 incomplete; newest that can be restored: 20250109010000\n[0]"},
         {"images --since '2025-01-05T01:00:00' --incomplete h/",
          "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
          "20250108010000  delta        database              2       4  incomplete: B lacks the "
          "image 20241201010000\n"
-         "7 images, 1 shown, 1 incomplete; newest that can be restored: 20250109010000\n"
-         "[0]"},
+         "7 images, 1 shown, 1 incomplete; newest that can be restored: 20250109010000\n[0]"},
         {"images e/", "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
-                      "0 images, 0 incomplete\n"
-                      "[0]"},
+                      "0 images, 0 incomplete\n[0]"},
         {"images s/", "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
                       "20250101000000  delta        database              1       1  incomplete: A "
                       "lacks a full image\n"
-                      "1 image, 1 incomplete\n"
-                      "[0]"},
+                      "1 image, 1 incomplete\n[0]"},
         {"images --have have --last 3 h/",
          "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
          "20250105010000  delta        database              2       4  incomplete: all 2 lack the "
@@ -218,91 +214,72 @@ TEST_F(QuestionTest, AnswersInFull)
          "20250108010000  delta        database              2       4  incomplete: all 2 lack the "
          "image 20250108010000\n"
          "20250109010000  full         database              1       1  complete\n"
-         "7 images, 3 shown, 4 incomplete; newest that can be restored: 20250109010000\n"
-         "[0]"},
+         "7 images, 3 shown, 4 incomplete; newest that can be restored: 20250109010000\n[0]"},
         {"plan h/ '2025-01-05 01:00:00'",
          "1/4  full         20250101010000  A  for 20250103010000\n"
          "2/4  incremental  20250103010000  A  for 20250105010000\n"
          "3/4  full         20250104010000  B  for 20250105010000\n"
          "4/4  delta        20250105010000  all 2  target\n"
          "zq3hist: warning: a chain was found, but the history lacks entries 5 to 6, and an image "
-         "may have been there\n"
-         "[0]"},
+         "may have been there\n[0]"},
         {"plan h/ latest b",
          "zq3hist: tablespace B lacks the image 20241201010000 that was restored, 20250108010000\n"
-         "zq3hist: hint: zq3hist plan h/ 20250105010000  # the newest image that can be restored\n"
-         "[6]"},
+         "zq3hist: hint: zq3hist plan h/ 20250105010000  # the newest image that can be "
+         "restored\n[6]"},
         {"plan --before 20250107000000 -- h/ A",
          "1/3  full         20250101010000  A  for 20250103010000\n"
          "2/3  incremental  20250103010000  A  for 20250105010000\n"
          "3/3  delta        20250105010000  A  target\n"
          "zq3hist: warning: a chain was found, but the history lacks entries 5 to 6, and an image "
-         "may have been there\n"
-         "[0]"},
+         "may have been there\n[0]"},
         {"plan --before 20250104020000 h/",
          "1/1  full         20250104010000  B  target\n"
          "zq3hist: note: 20250104010000 is an image of single tablespaces; the newest one of the "
-         "whole database before it is 20250103010000\n"
-         "[0]"},
+         "whole database before it is 20250103010000\n[0]"},
         {"plan h/ --before 20241231000000", "zq3hist: no image is there up to 20241231000000, h/\n"
-                                            "zq3hist: hint: zq3hist images h/  # lists all\n"
-                                            "[5]"},
+                                            "zq3hist: hint: zq3hist images h/  # lists all\n[5]"},
         {"plan --have have h/ 20250105010000",
          "zq3hist: all 2 tablespaces lack the image 20250105010000, which is not on hand, "
          "20250105010000\n"
-         "zq3hist: hint: zq3hist plan h/ 20250109010000  # the newest image that can be restored\n"
-         "[6]"},
+         "zq3hist: hint: zq3hist plan h/ 20250109010000  # the newest image that can be "
+         "restored\n[6]"},
         {"plan h/ 20250109010000 A C",
-         "zq3hist: the image does not hold the tablespace C, 20250109010000\n"
-         "[5]"},
-        {"chart h/", "What the newest state needs\n"
-                     "\n"
+         "zq3hist: the image does not hold the tablespace C, 20250109010000\n[5]"},
+        {"chart h/", "What the newest state needs\n\n"
                      "   2025-01-01  01-05 01-09\n"
                      "   |           |     |\n"
                      "A  f  d  i  .  d  d  F\n"
-                     "B  x  x  x  x  x  d  .\n"
-                     "\n"
+                     "B  x  x  x  x  x  d  .\n\n"
                      "F I D  needed: full, incremental, delta\n"
                      "f i d  not needed\n"
                      "x      discarded by a restore\n"
-                     ".      not in the image\n"
-                     "[0]"},
-        {"chart h/ 20250105010000", "What 2025-01-05 01:00:00 needs\n"
-                                    "\n"
+                     ".      not in the image\n[0]"},
+        {"chart h/ 20250105010000", "What 2025-01-05 01:00:00 needs\n\n"
                                     "   2025-01-01  01-05\n"
                                     "   |           |\n"
                                     "A  F  d  I  .  D\n"
-                                    "B  f  d  i  F  D\n"
-                                    "\n"
+                                    "B  f  d  i  F  D\n\n"
                                     "F I D  needed: full, incremental, delta\n"
                                     "f i d  not needed\n"
-                                    ".      not in the image\n"
-                                    "[0]"},
+                                    ".      not in the image\n[0]"},
         {"unneeded --since 20250108000000 h/",
          "20250102010000  delta        database\n"
          "20250104010000  full         tablespace\n"
-         "2 of 7 images are not needed by restores from 20250108000000\n"
-         "[0]"},
-        {"unneeded --keep 2 h/", "20250102010000  delta        database\n"
-                                 "1 of 7 images are not needed by restores from 20250105010000\n"
-                                 "[0]"},
+         "2 of 7 images are not needed by restores from 20250108000000\n[0]"},
+        {"unneeded --keep 2 h/",
+         "20250102010000  delta        database\n"
+         "1 of 7 images are not needed by restores from 20250105010000\n[0]"},
         {"unneeded --since 20260101000000 h/",
-         "zq3hist: no image is there from then on: 20260101000000, h/\n"
-         "[5]"},
+         "zq3hist: no image is there from then on: 20260101000000, h/\n[5]"},
         {"needed-by h/ 20250103010000", "20250105010000  delta        database\n"
-                                        "1 of 7 images need 20250103010000\n"
-                                        "[0]"},
+                                        "1 of 7 images need 20250103010000\n[0]"},
         {"needed-by h/ 20250107010000", "zq3hist: no image has the timestamp 20250107010000, h/\n"
-                                        "zq3hist: hint: zq3hist images h/  # lists all\n"
-                                        "[5]"},
+                                        "zq3hist: hint: zq3hist images h/  # lists all\n[5]"},
         {"help needed-by",
-         "Usage: zq3hist needed-by [OPTION...] DIR TIMESTAMP\n"
-         "\n"
-         "List the restores that break without this image.\n"
-         "\n"
+         "Usage: zq3hist needed-by [OPTION...] DIR TIMESTAMP\n\n"
+         "List the restores that break without this image.\n\n"
          "  --json                   print JSON: see zq3hist-json(5)\n"
-         "  -d ALIAS                 in place of DIR: the database's directory in $ZQ3DBPATH\n"
-         "[0]"},
+         "  -d ALIAS                 in place of DIR: the database's directory in $ZQ3DBPATH\n[0]"},
     };
     run("load h/", tenDays());
     run("load e/", "", "mkdir e s; ");
@@ -333,60 +310,45 @@ TEST_F(QuestionTest, ChartsAreDrawnForTheirPlace)
          "20250101120000  full         database              0       1  complete\n"
          "20250102000000  full         database              2       2  complete\n"
          "20250103000000  full         tablespace            2       2  complete\n"
-         "4 images, 1 incomplete; newest that can be restored: 20250103000000\n"
-         "[0]"},
+         "4 images, 1 incomplete; newest that can be restored: 20250103000000\n[0]"},
         {"", "plan -d s 20250101010000",
          "zq3hist: tablespace <A>&\\x07 lacks the image 20241201000000 that was restored, "
          "20250101010000\n"
          "zq3hist: tablespace B and 1 more lack a full image, 20250101010000\n"
          "zq3hist: hint: zq3hist plan ./S/ 20250102000000  # the newest image that can be "
-         "restored\n"
-         "[6]"},
+         "restored\n[6]"},
         {"", "plan S latest",
          "1/2  full         20250101120000\n"
          "2/2  full         20250103000000  all 2  target\n"
          "zq3hist: note: 20250103000000 is an image of single tablespaces; the newest one of the "
-         "whole database before it is 20250102000000\n"
-         "[0]"},
+         "whole database before it is 20250102000000\n[0]"},
         {"", "chart --color S",
-         "What the newest state needs\n"
-         "\n"
+         "What the newest state needs\n\n"
          "          2025-01-01\n"
          "          |\n"
          "<A>&\\x07  \033[2md\033[0m  \033[2m.\033[0m  \033[2m.\033[0m  \033[2m.\033[0m\n"
-         "2 others  \033[2md\033[0m  \033[2m.\033[0m  \033[2mf\033[0m  \033[1;34mF\033[0m\n"
-         "\n"
+         "2 others  \033[2md\033[0m  \033[2m.\033[0m  \033[2mf\033[0m  \033[1;34mF\033[0m\n\n"
          "F I D  needed: full, incremental, delta\n"
          "f i d  not needed\n"
-         ".      not in the image\n"
-         "[0]"},
+         ".      not in the image\n[0]"},
         {"COLUMNS=12 ", "chart w",
-         "What the newest state needs\n"
-         "\n"
-         "A  :DDDDDDDD\n"
-         "\n"
+         "What the newest state needs\n\n"
+         "A  :DDDDDDDD\n\n"
          "F I D  needed: full, incremental, delta\n"
-         ":      5 images left out\n"
-         "[0]"},
+         ":      5 images left out\n[0]"},
         {"COLUMNS=30 ", "chart w 20250101020000",
-         "What 2025-01-01 02:00:00 needs\n"
-         "\n"
+         "What 2025-01-01 02:00:00 needs\n\n"
          "   2024-12-31\n"
          "   |\n"
-         "A  F  D  D  D\n"
-         "\n"
-         "F I D  needed: full, incremental, delta\n"
-         "[0]"},
+         "A  F  D  D  D\n\n"
+         "F I D  needed: full, incremental, delta\n[0]"},
         {"NO_COLOR=1 ", "chart --color=auto w",
-         "What the newest state needs\n"
-         "\n"
+         "What the newest state needs\n\n"
          "   2024-12-31  2025-01-01  07:00 09:00 11:00\n"
          "   |           |           |     |     |\n"
-         "A  F  d  d  d  I  D  D  D  D  D  D  D  D\n"
-         "\n"
+         "A  F  d  d  d  I  D  D  D  D  D  D  D  D\n\n"
          "F I D  needed: full, incremental, delta\n"
-         "f i d  not needed\n"
-         "[0]"},
+         "f i d  not needed\n[0]"},
     };
     setenv("ZQ3DBPATH", ".", 1);
     run("load S/",
