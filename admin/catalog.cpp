@@ -40,7 +40,7 @@ static void noteGap(catalogRead* read, const zq3HistoryData* record)
 {
     imageCatalog* catalog = read->catalog;
     uint32_t* last = &read->lastNumbers[record->entryNode];
-    if (*last != 0 && record->entryNumber > *last + 1)
+    if (record->entryNumber > *last + 1)
         catalog->gaps[catalog->numGaps++] = {*last + 1, record->entryNumber - 1};
     *last = record->entryNumber;
 }

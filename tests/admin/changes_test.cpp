@@ -40,6 +40,7 @@ class ChangeTest : public ProgramTest
         history = slurp(historyPath);
         shadow = slurp(shadowPath);
         spill(root + "more", more);
+        spill(root + "odd", "Operation: O\n");
     }
 
     // Half a batch of a process that ends with the lock in its hands.
@@ -140,6 +141,7 @@ class ChangeTest : public ProgramTest
 #define ENDS_EARLY                                                                                 \
     "zq3hist: warning: the history ends after 1 of 3 entries, h/\n"                                \
     "zq3hist: hint: zq3hist verify h/  # reads both files and tells what mends them\n"
+#define AGAIN "zq3hist: hint: zq3hist verify h/  # again, once the reason that is given is gone\n"
 #define FROM_SHADOW "zq3hist: hint: zq3hist repair h/  # takes the entries of the shadow\n[3]"
 
 TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
@@ -233,15 +235,25 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "damaged: the shadow is to be made anew; 3 entries" RESTORABLE "[3]", "3 3"},
         {"rm h/*; zq3hist load h /dev/null >new; ", "check h/",
          "no image: no image can be restored; 0 entries, 0 images, 0 incomplete\n[5]", "0 0"},
+        {"", "repair h/", "Nothing to repair: both files hold the same 3 entries\n[0]", "3 3"},
+        {"mkfifo new; ", "backup --force h/ new",
+         "zq3hist: the backup would replace something that is no regular file, new\n[1]", "3 3"},
+        {"head -c 4096 /dev/zero >h/zq3rhist.asc; ", "verify h/",
+         "zq3rhist.asc: damaged at offset 0: the header cannot be read\nzq3rhist.bak: sound, 3 "
+         "entries\nzq3hist: the history is not sound, h/\n" FROM_SHADOW,
+         "0 3"},
+        {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "backup h/ new",
+         "zq3hist: cannot back up the history: Is a directory, h/zq3rhist.bak\n" AGAIN "[1]",
+         "3 -"},
+        {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "repair h/",
+         "zq3hist: cannot repair the history: Is a directory, h/zq3rhist.bak\n" AGAIN "[1]", "3 -"},
         {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "verify h/",
          "zq3rhist.asc: sound, 3 entries\n"
          "zq3rhist.bak: cannot be read at offset 0: Is a directory\n"
-         "zq3hist: the history is not sound, h/\n"
-         "zq3hist: hint: zq3hist verify h/  # again, once the reason that is given is gone\n[3]",
+         "zq3hist: the history is not sound, h/\n" AGAIN "[3]",
          "3 -"},
         {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "load h/ more",
-         "zq3hist: cannot append to the history: Is a directory, h/zq3rhist.bak\n"
-         "zq3hist: hint: zq3hist verify h/  # again, once the reason that is given is gone\n[1]",
+         "zq3hist: cannot append to the history: Is a directory, h/zq3rhist.bak\n" AGAIN "[1]",
          "3 -"},
         {OTHER, "verify h/",
          "zq3rhist.asc: sound, 3 entries\nzq3rhist.bak: sound, 3 entries\n"
@@ -274,10 +286,10 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "zq3hist: cannot restore the history: the file ends after 1 of 3 entries, "
          "h/zq3rhist.bak\n[3]",
          "3 1"},
-        {"", "prune --before 20250107000000 h/",
-         "2 of 3 entries removed, those before 20250107010000; 1 stay\n" KEPT("asc")
+        {"zq3hist load h odd >new; ", "prune --before 20250107000000 h/",
+         "2 of 4 entries removed, those before 20250107010000; 2 stay\n" KEPT("asc")
              KEPT("bak") "[0]",
-         "1 1 3 3"},
+         "2 2 4 4"},
         {"", "prune --before '2025-01-06 01:00:00' h/",
          "0 of 3 entries removed, those before 20250105010000; 3 stay\n"
          "The entries from 20250105010000 on stay because 20250106010000 needs "

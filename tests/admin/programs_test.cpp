@@ -51,6 +51,10 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
          "zq3hist: cannot back up the history: No such file or directory, none/image\n[1]"},
         {"", "backup h/ h/zq3rhist.bak",
          "zq3hist: the backup would replace the history itself, h/zq3rhist.bak\n[1]"},
+        {"mkdir 'tab\t'; ", "status 'tab\t'",
+         "zq3hist: cannot show the history: the directory holds no history file, tab\\x09/\n"
+         "zq3hist: hint: zq3hist restore $'tab\\x09/' FILE  # FILE: a backup; without one, "
+         "zq3hist load $'tab\\x09/' FILE begins anew\n[3]"},
         {"", "status \"it's\"",
          "zq3hist: cannot show the history: the directory holds no history file, it's/\n"
          "zq3hist: hint: zq3hist restore $'it\\'s/' FILE  # FILE: a backup; without one, zq3hist "

@@ -322,6 +322,12 @@ TEST_F(QuestionTest, ChartsAreDrawnForTheirPlace)
          "2/2  full         20250103000000  all 2  target\n"
          "zq3hist: note: 20250103000000 is an image of single tablespaces; the newest one of the "
          "whole database before it is 20250102000000\n[0]"},
+        {"", "unneeded --keep 9 S",
+         "0 of 4 images are not needed by restores from 20250101010000\n[0]"},
+        {"", "needed-by S 20250101120000",
+         "20250102000000  full         database\n"
+         "20250103000000  full         tablespace\n"
+         "2 of 4 images need 20250101120000\n[0]"},
         {"", "chart --color S",
          "What the newest state needs\n\n"
          "          2025-01-01\n"
