@@ -281,6 +281,15 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "3 entries would be restored\nWhat is there would be kept: 4 entries\n[0]", "4 4"},
         {"zq3hist load h more >new; ", "restore h/ image",
          "3 entries restored\n" KEPT("asc") KEPT("bak") "[0]", "3 3 4 4"},
+        {"", "restore h/ image; zq3hist restore h image >new; zq3hist restore h image >new",
+         "3 entries restored\n" KEPT("asc") KEPT("bak") "[0]", "3 3 3 3 3 3 3 3"},
+        {SPOIL("asc", "10") SPOIL("bak", "10"), "status h/",
+         "history   zq3rhist.asc: 3361 bytes, header not readable: the history is damaged\n"
+         "shadow    zq3rhist.bak: 3361 bytes, header not readable: the history is damaged\n"
+         "lock      free (key KEY)\n"
+         "          not usable; the next open would move both files aside\n"
+         "zq3hist: hint: zq3hist verify h/  # reads both files and tells what mends them\n[3]",
+         "x x"},
         {"rm h/*; ", "restore h/ image", "3 entries restored\n[0]", "3 3"},
         {CUT("bak", "1803"), "restore h/ h/zq3rhist.bak",
          "zq3hist: cannot restore the history: the file ends after 1 of 3 entries, "
@@ -295,6 +304,11 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "The entries from 20250105010000 on stay because 20250106010000 needs "
          "them\n[0]",
          "3 3"},
+        {"", "prune --before 20990101000000 h/",
+         "2 of 3 entries removed, those before 20250107010000; 1 stay\n"
+         "The entries from 20250107010000 on stay because 20250107010000 needs them\n" KEPT("asc")
+             KEPT("bak") "[0]",
+         "1 1 3 3"},
         {"", "prune --dry-run --before 20250107000000 h/",
          "2 of 3 entries would be removed, those before 20250107010000; 1 would stay\n[0]", "3 3"},
         {SPOIL("bak", "2000"), "prune --before 20250107000000 h/",

@@ -213,7 +213,7 @@ TEST_F(ProgramTest, JsonIsValidForAnyBytes)
 {
     run("load h/", "Operation: rename tablespace\nTimestamp: 20250101000000\nNote: "
                    "\"\\\\\\n\nTablespace: \\x7F\\xFF\nTablespace: B\n"
-                   "SQLCA warnings: \\x01\n");
+                   "SQLCA warnings: \\x01\nCommand: abc\n");
     EXPECT_TRUE(run("dump --json h/").ends_with("}\n[0]"));
     const std::string text = slurp(root + "out");
     EXPECT_EQ(1, std::ranges::count(text, '\n'));
@@ -223,6 +223,10 @@ TEST_F(ProgramTest, JsonIsValidForAnyBytes)
     EXPECT_EQ("\u0001          ", entry["sqlca"]["warnings"]);
     EXPECT_EQ(std::string("-").append(69, ' '), entry["sqlca"]["tokens"]);
     EXPECT_EQ(0, entry["sqlca"]["diagnostics"][5]);
+    run("status --json h/");
+    const nlohmann::json header = nlohmann::json::parse(slurp(root + "out"))["history"];
+    EXPECT_EQ(2, header["maxTablespaceCount"]);
+    EXPECT_EQ(3, header["maxCommandLength"]);
 }
 
 TEST_F(ProgramTest, OnlyTheLocksOfTheDeadAreRemoved)
