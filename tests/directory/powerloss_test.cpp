@@ -43,39 +43,31 @@ struct choice {
     unsigned int share = 0; // chance in percent; 0: not at random
     std::mt19937* random = nullptr;
     size_t asked = 0;
-    std::string exception = {};
 
-    bool keeps(const std::string& file, size_t at)
+    bool keeps()
     {
-        if (asked++ == lone)
-            exception = ", but for sector " + std::to_string(at / sector) + " of " + file;
-        return share == 0 ? (asked - 1 == lone) != most : (*random)() % 100 < share;
+        const bool isLone = asked++ == lone;
+        return share == 0 ? isLone != most : (*random)() % 100 < share;
     }
     std::string told() const
     {
-        return share != 0 ? "sectors kept at random" : (most ? "all kept" : "all lost") + exception;
+        return share != 0 ? "sectors kept at random"
+               : lone == SIZE_MAX
+                   ? (most ? "all kept" : "all lost")
+                   : (most ? "all kept but the sector " : "all lost but the sector ") +
+                         std::to_string(lone);
     }
 };
 
-// Of the sectors that a write of the range touched, copies to the disk those that are kept.
-static void keepSectors(const std::string& name, const std::string& cache, size_t at, size_t end,
-                        choice* kept, std::string* content)
-{
-    for (at = at / sector * sector; at < end; at += sector)
-        if (kept->keeps(name, at) && at < content->size())
-            content->replace(at, sector, cache, at, std::min(sector, content->size() - at));
-}
-
-// The file with its first `lengths` pending length changes and the sectors that are kept. A mode is
-// kept or lost like a sector.
-static diskFile contentOf(const diskFile& onDisk, const std::string& name, size_t lengths,
-                          choice* kept)
+// The file with its first `lengths` pending length changes, and of the sectors that a pending write
+// touched those that are kept. A mode is kept or lost like a sector.
+static diskFile contentOf(const diskFile& onDisk, size_t lengths, choice* kept)
 {
     diskFile file = {onDisk.bytes, onDisk.marked};
     std::string cache = file.bytes, &content = file.bytes;
     for (const diskOp& op : onDisk.pending) {
         if (op.kind == diskMode) {
-            file.marked = kept->keeps(name + "'s mode", 0) ? op.at != 0 : file.marked;
+            file.marked = kept->keeps() ? op.at != 0 : file.marked;
             continue;
         }
         const size_t end = op.at + op.bytes.size();
@@ -87,7 +79,9 @@ static diskFile contentOf(const diskFile& onDisk, const std::string& name, size_
             lengths -= lengths > 0;
         }
         cache.replace(op.at, op.bytes.size(), op.bytes);
-        keepSectors(name, cache, op.at, end, kept, &content);
+        for (size_t at = op.at / sector * sector; at < end; at += sector)
+            if (kept->keeps() && at < content.size())
+                content.replace(at, sector, cache, at, std::min(sector, content.size() - at));
     }
     return file;
 }
@@ -125,7 +119,7 @@ class PowerLossTest : public DirectoryTest
     static void sync(diskFile* file, const diskOp& op)
     {
         choice all;
-        const diskFile synced = contentOf(*file, "", SIZE_MAX, &all);
+        const diskFile synced = contentOf(*file, SIZE_MAX, &all);
         file->bytes = synced.bytes;
         file->marked = op.at != 0 ? synced.marked : file->marked;
         std::erase_if(file->pending,
@@ -223,7 +217,7 @@ class PowerLossTest : public DirectoryTest
             Files state;
             for (const auto& [name, inode] : names) {
                 const size_t lengths = kept.most ? SIZE_MAX : way == 1 ? 0 : random() % 8;
-                const diskFile file = contentOf(model.files.at(inode), name, lengths, &kept);
+                const diskFile file = contentOf(model.files.at(inode), lengths, &kept);
                 state[name + (file.marked ? "*" : "")] = file.bytes;
             }
             sectors = way == 0 ? kept.asked : sectors;

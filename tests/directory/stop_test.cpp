@@ -66,11 +66,9 @@ class StopTest : public DirectoryTest
 
     static std::string stopInWords(const std::vector<diskOp>& log, const stopPoint& stop)
     {
-        const size_t call = static_cast<size_t>(stop.call);
-        return "stopped " + momentOf(log, call + (stop.cut == SIZE_MAX)) +
-               (stop.cut == 0 || stop.cut == SIZE_MAX
-                    ? ""
-                    : ", " + std::to_string(stop.cut) + " bytes on");
+        const bool all = stop.cut == SIZE_MAX;
+        return "stopped " + momentOf(log, static_cast<size_t>(stop.call) + all) +
+               (all ? "" : ", " + std::to_string(stop.cut) + " bytes on");
     }
 
     // Opens the state; opens it and stops the open, everywhere, and opens what that leaves.
@@ -120,46 +118,6 @@ class FailureTest : public DirectoryTest
     bool inCommit = false; // between begin and end of a batch
     unsigned int tried = 0;
 
-    // Once, or from the call on.
-    struct failure {
-        int at, error;
-        bool lasts;
-    };
-
-    // Counts a call; tells whether it fails.
-    bool isDue(const failure& f, int* calls, const std::string& call)
-    {
-        const int number = (*calls)++;
-        if (number == f.at) {
-            failed = call;
-            inCommit = inBatch;
-        }
-        return number == f.at || (number > f.at && f.lasts);
-    }
-
-    int runFailing(const scenario& s, const failure& f, bool system)
-    {
-        int calls = 0;
-        store(filesOf(s.before));
-        failed.clear();
-        if (system)
-            onSystemCall = [&](const std::string& call) {
-                return isDue(f, &calls, call) ? f.error : 0;
-            };
-        else
-            onCall = [&](const std::string& call, int) {
-                if (call.starts_with("sem") || !isDue(f, &calls, call))
-                    return 0;
-                const bool stores = call == "sqlowrite" || call == "sqlocopy" || call == "sqlosync";
-                code = stores && f.error == ENOSPC ? int{DISK_FULL} : sqloSystemError | f.error;
-                return code;
-            };
-        const int rc = run(s);
-        onCall = nullptr;
-        onSystemCall = nullptr;
-        return rc;
-    }
-
     // What may come back: the call's own code, the code for a repair that failed, no key where the
     // file for it could not be made, and success where the failure only takes a shortcut away or a
     // file out of the examination.
@@ -191,7 +149,7 @@ class FailureTest : public DirectoryTest
         return ids;
     }
 
-    // Fails each call in turn, until none is left.
+    // Fails each call in turn, once or from it on, until none is left.
     void failEach(const scenario& s, int error, bool lasts, bool system)
     {
         std::vector<unsigned int> allowed = committed(filesOf(s.before));
@@ -200,7 +158,30 @@ class FailureTest : public DirectoryTest
         const long descriptors = openDescriptors();
         for (int k = takesAll ? 0 : error % 4;;
              k += takesAll ? 1 : static_cast<int>(4 * slowdown)) {
-            const int rc = runFailing(s, {k, error, lasts}, system);
+            int calls = 0;
+            const auto isDue = [&](const std::string& call) {
+                const int number = calls++;
+                if (number == k) {
+                    failed = call;
+                    inCommit = inBatch;
+                }
+                return number == k || (number > k && lasts);
+            };
+            store(filesOf(s.before));
+            failed.clear();
+            onSystemCall = [&](const std::string& call) {
+                return system && isDue(call) ? error : 0;
+            };
+            onCall = [&](const std::string& call, int) {
+                if (system || call.starts_with("sem") || !isDue(call))
+                    return 0;
+                const bool stores = call == "sqlowrite" || call == "sqlocopy" || call == "sqlosync";
+                code = stores && error == ENOSPC ? int{DISK_FULL} : sqloSystemError | error;
+                return code;
+            };
+            const int rc = run(s);
+            onCall = nullptr;
+            onSystemCall = nullptr;
             if (failed.empty())
                 break;
             SCOPED_TRACE(testing::Message()
@@ -212,8 +193,8 @@ class FailureTest : public DirectoryTest
             EXPECT_TRUE(system || lasts || isDocumented(rc));
             EXPECT_TRUE(!hasCopy || !committed(load()).empty());
             const unsigned int last = s.outcomes.back();
-            EXPECT_EQ(
-                "", faultOf(rc == 0 && (inCommit || disk.replacing) ? std::vector{last} : allowed));
+            const bool done = rc == 0 && (inCommit || disk.replacing);
+            EXPECT_EQ("", faultOf(done ? std::vector{last} : allowed));
         }
         EXPECT_EQ(descriptors, openDescriptors());
     }
