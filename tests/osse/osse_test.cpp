@@ -162,56 +162,53 @@ TEST_F(osse, ResizedBlockKeepsItsBytesAndGainsZeros)
     sqlofmblkEx(block);
 }
 
-struct copyRow {
-    size_t size, left;
-    int failingCall, failure, rc;
-    std::string calls;
-};
 static const std::string empty = "sync; sync directory; reserve ",
                          end = "sync all; write and wait for 8; ";
-static const std::vector<copyRow> copyRows = {
-    {4000, 4000, -1, 0, 0, empty + "4000; truncate; write 3992 at 8; write 1992 at 2008; " + end},
-    {8, 8, -1, 0, 0, empty + "8; truncate; " + end},
-    {2000, 5000, 0, EIO, failed | EIO, "sync; "},
-    {2000, 5000, 1, EIO, failed | EIO, "sync; sync directory; "},
-    {2000, 5000, 2, ENOSPC, DISK_FULL, empty + "2000; "},
-    {2000, 2000, 2, EOPNOTSUPP, 0, empty + "2000; truncate; write 1992 at 8; " + end},
-    {2000, 5000, 3, EIO, failed | EIO, empty + "2000; truncate; "},
-    {2000, 2000, 4, EINTR, 0, empty + "2000; truncate; write 1992 at 8; write 1992 at 8; " + end},
-    {2000, 2000, 6, EINTR, 0,
-     empty +
-         "2000; truncate; write 1992 at 8; sync all; write and wait for 8; write and wait for 8; "},
-    {2000, 2000, 2, EINTR, 0, empty + "2000; reserve 2000; truncate; write 1992 at 8; " + end},
-    {2000, 0, 4, ENOSPC, DISK_FULL, empty + "2000; truncate; write 1992 at 8; truncate; "},
-    {2000, 0, 4, EDQUOT, DISK_FULL, empty + "2000; truncate; write 1992 at 8; truncate; "},
-    {2000, 0, 4, onlyShort, failed | EIO, empty + "2000; truncate; write 1992 at 8; truncate; "},
-    {2000, 0, 6, onlyShort, failed | EIO,
-     empty + "2000; truncate; write 1992 at 8; " + end + "truncate; "},
-    {2000, 0, 5, EIO, failed | EIO,
-     empty + "2000; truncate; write 1992 at 8; sync all; truncate; "},
-    {2000, 0, 6, EIO, failed | EIO,
-     empty + "2000; truncate; write 1992 at 8; " + end + "truncate; "},
-};
 
 TEST_F(osse, CopyWritesTheFirstBytesLastAndAFailedOneLeavesNone)
 {
-    const std::string link = directory + "link";
+    // And how each may fail: before the first write the target is kept, then nothing of it is left.
+    const std::pair<std::string, std::vector<int>> steps[] = {
+        {"sync; ", {EIO}},
+        {"sync directory; ", {EIO}},
+        {"reserve 2000; ", {ENOSPC, EOPNOTSUPP, EINTR}},
+        {"truncate; ", {EIO}},
+        {"write 1992 at 8; ", {EINTR, ENOSPC, EDQUOT, onlyShort}},
+        {"sync all; ", {EIO}},
+        {"write and wait for 8; ", {EINTR, onlyShort, EIO}}};
+    const std::map<int, int> codes = {{EIO, failed | EIO}, {onlyShort, failed | EIO},
+                                      {ENOSPC, DISK_FULL}, {EDQUOT, DISK_FULL},
+                                      {EINTR, 0},          {EOPNOTSUPP, 0}};
+    const std::string link = directory + "link", bytes = pattern(2000, 1);
     spill(file, "");
     std::filesystem::create_hard_link(file, link);
-    for (const copyRow& row : copyRows) {
-        SCOPED_TRACE(row.calls);
-        spill(source, pattern(row.size, 1));
-        spill(file, pattern(5000, 2));
+    for (size_t step = 0; step < std::size(steps); step++)
+        for (const int error : steps[step].second) {
+            const int rc = codes.at(error);
+            std::string expected;
+            for (size_t i = 0; i < std::size(steps) && (rc == 0 || i <= step); i++)
+                expected += steps[i].first + (i == step && error == EINTR ? steps[i].first : "");
+            expected += rc != 0 && step >= 4 ? "truncate; " : "";
+            SCOPED_TRACE(expected);
+            spill(source, bytes);
+            spill(file, pattern(5000, 2));
+            calls.clear();
+            untilFailure = static_cast<int>(step);
+            failure = error;
+            EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), rc);
+            EXPECT_EQ(calls, expected);
+            EXPECT_TRUE(slurp(file) == (rc == 0 ? bytes : step < 4 ? pattern(5000, 2) : ""));
+            EXPECT_TRUE(slurp(link) == slurp(file)) << "the target's inode has changed";
+            EXPECT_EQ(sqlocopy(link.c_str(), file.c_str(), 0), failed | EINVAL);
+            EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 1), failed | EINVAL);
+        }
+    for (const size_t size : {4000u, 8u}) {
+        const std::string writes = size == 8 ? "" : "write 3992 at 8; write 1992 at 2008; ";
+        spill(source, pattern(size, 1));
         calls.clear();
-        untilFailure = row.failingCall;
-        failure = row.failure;
-        EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), row.rc);
-        EXPECT_EQ(calls, row.calls);
-        EXPECT_EQ(slurp(file).size(), row.left);
-        EXPECT_EQ(slurp(file) == pattern(row.size, 1), row.rc == 0);
-        EXPECT_TRUE(slurp(link) == slurp(file)) << "the target's inode has changed";
-        EXPECT_EQ(sqlocopy(link.c_str(), file.c_str(), 0), failed | EINVAL);
-        EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 1), failed | EINVAL);
+        EXPECT_EQ(sqlocopy(source.c_str(), file.c_str(), 0), 0);
+        EXPECT_EQ(calls, empty + std::to_string(size) + "; truncate; " + writes + end);
+        EXPECT_TRUE(slurp(file) == slurp(source));
     }
     // Nor does a source that cannot be read to its end cost the target anything.
     spill(source, pattern(600000, 3));
