@@ -192,7 +192,7 @@ TEST_F(LockTest, WhoLooksIsToldWhatTheSystemSays)
     SQLO_NLCKSTATE state = {};
     EXPECT_EQ(sqloSystemError | EPERM, sqloNLCKNext(&index, &lock, &state));
     // The dead holder's set that goes by itself, or that this user may not remove.
-    ahead = 100;
+    ahead = 100000;
     state = lockState();
     for (const int error : {EPERM, EIDRM}) {
         failCall("semctl", IPC_RMID, error);
@@ -297,7 +297,7 @@ TEST_F(LockTest, AReusedProcessNumberIsNoHolder)
         if (keeps)
             sqloNLCKKeepFile(&lock, historyPath.c_str());
         EXPECT_EQ(sqloNLCKHeld, lockState().state);
-        ahead = 100; // so much later this process seems to have begun
+        ahead = 100000; // so much later this process seems to have begun
         const SQLO_NLCKSTATE state = lockState();
         EXPECT_EQ(keeps ? sqloNLCKFaked : sqloNLCKStale, state.state);
         EXPECT_EQ(keeps ? sqloNLCKBusy : 0, sqloNLCKRemoveDead(&lock, &state));
