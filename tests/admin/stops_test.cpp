@@ -1,69 +1,35 @@
 // What changes a history, stopped wherever it changes a file.
 #include <csignal>
-#include <dlfcn.h>
-#include <sys/wait.h>
 
 #include "admin/zq3hist.h"
-#include "tests/support.h"
+#include "tests/directory/fixture.h"
 
 enum stopKind { killed, signalled, failsOnce, failsOn };
-static stopKind kind;
-static int stepsLeft = -1; // it happens at the step that finds 0; -1: never
-static bool happened = false;
-
-static bool isDue()
-{
-    if (stepsLeft != 0) {
-        stepsLeft -= stepsLeft > 0;
-        return false;
-    }
-    happened = true;
-    stepsLeft = kind == failsOn ? 0 : -1;
-    return true;
-}
-
-// Returns the code with which the call fails, or 0 where it goes on.
-static int stop()
-{
-    if (kind == killed)
-        _exit(42);
-    if (kind == signalled)
-        raise(SIGTERM);
-    return kind == signalled ? 0 : static_cast<int>(DISK_FULL);
-}
-
-// A write is two steps, nothing and half of it done; so is a copy, the target untouched and empty.
-extern "C" int sqlowrite(SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* written)
-{
-    auto write = reinterpret_cast<decltype(&sqlowrite)>(dlsym(RTLD_NEXT, "sqlowrite"));
-    int rc = 0;
-    *written = 0;
-    if (isDue())
-        rc = stop();
-    if (rc == 0 && kind != signalled && isDue()) {
-        write(fh, buffer, count / 2, written);
-        rc = stop();
-    }
-    return rc != 0 ? rc : write(fh, buffer, count, written);
-}
-
-extern "C" int sqlocopy(const char* source, const char* target, unsigned int options)
-{
-    auto copy = reinterpret_cast<decltype(&sqlocopy)>(dlsym(RTLD_NEXT, "sqlocopy"));
-    int rc = 0;
-    if (isDue())
-        rc = stop();
-    if (rc == 0 && kind != signalled && isDue()) {
-        spill(target, "");
-        rc = stop();
-    }
-    return rc != 0 ? rc : copy(source, target, options);
-}
 
 class StopTest : public HistoryTest
 {
   protected:
     enum { untouched = 64 }; // added to the status: the step was not reached
+
+    // Prepares the process for a stop. Killed, it leaves the disk as it was before a call that
+    // changes a file, or after half of a header; else the step is a write, half of which is done,
+    // or a copy.
+    static void prepare(int stopAt, stopKind stops, bool* happened)
+    {
+        if (stops == killed) {
+            disk = {true, {stopAt / 2, stopAt % 2 * size_t{512}}, false, {}, false};
+            return;
+        }
+        onCall = [=, steps = 0](const std::string& call, int) mutable {
+            const int step = call == "sqlowrite" || call == "sqlocopy" ? steps++ : -1;
+            if (step != stopAt && !(step > stopAt && stops == failsOn))
+                return 0;
+            *happened = true;
+            if (stops == signalled)
+                raise(SIGTERM);
+            return stops == signalled ? 0 : int{DISK_FULL};
+        };
+    }
 
     // Runs a subcommand; words that begin with a slash follow the scratch directory's name.
     int run(std::vector<std::string> words, int stopAt = -1, stopKind stops = killed)
@@ -77,14 +43,15 @@ class StopTest : public HistoryTest
         fflush(stdout);
         pid_t child = fork();
         if (child == 0) {
+            bool happened = stopAt < 0;
             if (freopen((root + "said").c_str(), "w", stdout) == nullptr)
                 _exit(98);
             dup2(STDOUT_FILENO, STDERR_FILENO);
-            stepsLeft = stopAt;
-            kind = stops;
+            if (stopAt >= 0)
+                prepare(stopAt, stops, &happened);
             int rc = runProgram(static_cast<int>(argv.size()) - 1, argv.data());
             fflush(stdout);
-            _exit(happened || stopAt < 0 ? rc : untouched + rc);
+            _exit(disk.stopped ? 42 : happened ? rc : untouched + rc);
         }
         int status = 0;
         waitpid(child, &status, 0);
