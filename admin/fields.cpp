@@ -62,30 +62,11 @@ static bool isDigits(const char* text, size_t length)
     return length == timestampWidth && strspn(text, "0123456789") >= timestampWidth;
 }
 
-static int twoDigits(const char* text)
-{
-    return 10 * (text[0] - '0') + (text[1] - '0');
-}
-
-// 14 digits that are a date and a time.
-static bool isTimestamp(const char* text, size_t length)
-{
-    static constexpr int days[] = {31, 29, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
-    if (!isDigits(text, length))
-        return false;
-    int century = twoDigits(text), year = twoDigits(text + 2), month = twoDigits(text + 4);
-    int day = twoDigits(text + 6);
-    bool leap = year % 4 == 0 && (year != 0 || century % 4 == 0);
-    return month >= 1 && month <= 12 && day >= 1 && day <= days[month - 1] &&
-           (month != 2 || day < 29 || leap) && twoDigits(text + 8) < 24 &&
-           twoDigits(text + 10) < 60 && twoDigits(text + 12) < 60;
-}
-
 // Whether a value would be refused if it had no escape; with one any can be given, since a history
 // may hold it.
 static bool isOdd(const recordField* field, const char* text, size_t length)
 {
-    return (field->rule == oneTimestamp && !isTimestamp(text, length)) ||
+    return (field->rule == oneTimestamp && !(isDigits(text, length) && isTime(text))) ||
            (field->rule == shortName && length >= zq3TablespaceNameCapacity);
 }
 

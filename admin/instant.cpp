@@ -24,6 +24,22 @@ bool parseTimestamp(const char* text, char* timestamp)
     return true;
 }
 
+static int twoDigits(const char* text)
+{
+    return 10 * (text[0] - '0') + (text[1] - '0');
+}
+
+bool isTime(const char* timestamp)
+{
+    static constexpr int days[] = {31, 29, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
+    int century = twoDigits(timestamp), year = twoDigits(timestamp + 2);
+    int month = twoDigits(timestamp + 4), day = twoDigits(timestamp + 6);
+    bool leap = year % 4 == 0 && (year != 0 || century % 4 == 0);
+    return month >= 1 && month <= 12 && day >= 1 && day <= days[month - 1] &&
+           (month != 2 || day < 29 || leap) && twoDigits(timestamp + 8) < 24 &&
+           twoDigits(timestamp + 10) < 60 && twoDigits(timestamp + 12) < 60;
+}
+
 int takeInstant(const char* what, const char* text, char* timestamp)
 {
     if (parseTimestamp(text, timestamp))

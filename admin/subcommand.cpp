@@ -16,7 +16,7 @@ static constexpr subcommand subcommands[] = {
      "draw the images of each tablespace, and which ones are needed"},
     {"check", checkMain, 1, 0, 0, optionJson | optionMaxAge | optionHave, "DIR",
      "say in one line whether everything is well"},
-    {"unneeded", unneededMain, 1, 0, 0, optionJson | optionSince | optionKeep, "DIR",
+    {"unneeded", unneededMain, 1, 0, 0, optionJson | optionNeededSince | optionKeep, "DIR",
      "list the images that no restore needs from a time on; delete nothing"},
     {"needed-by", neededByMain, 1, 1, 1, optionJson, "DIR TIMESTAMP",
      "list the restores that break without this image"},
@@ -27,7 +27,7 @@ static constexpr subcommand subcommands[] = {
     {"status", statusMain, 1, 0, 0, optionJson, "DIR",
      "show both files and the lock; change nothing"},
     {"verify", verifyMain, 1, 0, 0, optionJson, "DIR", "read every entry of both files"},
-    {"repair", repairMain, 1, 0, 0, optionJson | optionWait | optionDryRun | optionForce, "DIR",
+    {"repair", repairMain, 1, 0, 0, optionJson | optionWait | optionDryRun | optionSalvage, "DIR",
      "bring both files into step and say what was done"},
     {"copy", copyMain, 2, 0, 0, optionWait | optionDryRun, "SRC DST",
      "replace the history in DST by that in SRC"},
@@ -35,7 +35,7 @@ static constexpr subcommand subcommands[] = {
      "write the history to FILE"},
     {"restore", restoreMain, 1, 1, 1, optionWait | optionDryRun, "DIR FILE",
      "replace the history by that in FILE"},
-    {"prune", pruneMain, 1, 0, 0, optionBefore | optionWait | optionDryRun, "DIR",
+    {"prune", pruneMain, 1, 0, 0, optionPruneBefore | optionWait | optionDryRun, "DIR",
      "remove the oldest entries that no image needs which stays"},
     {"unlock", unlockMain, 1, 0, 0, optionAllLocks, "DIR",
      "remove the lock that a dead process left"},
@@ -84,6 +84,12 @@ static constexpr option options[] = {
      "replace a file that is there"},
     {"--skip-existing", optionSkipExisting, takesNothing, offsetof(commandLine, skipExisting), "",
      "leave out entries that the history holds already"},
+    {"--since", optionNeededSince, takesTimestamp, offsetof(commandLine, since), " TIMESTAMP",
+     "what restores to images from this time on need stays"},
+    {"--before", optionPruneBefore, takesTimestamp, offsetof(commandLine, before), " TIMESTAMP",
+     "remove the entries before this time"},
+    {"--force", optionSalvage, takesNothing, offsetof(commandLine, force), "",
+     "where neither file is whole, go on with what can be read"},
     {"--all", optionAllLocks, takesNothing, offsetof(commandLine, all), "",
      "the locks of all dead processes, also where the directory is gone"},
 };
@@ -104,7 +110,10 @@ static int takeOptionValue(const option* taken, const char* value, commandLine* 
         *reinterpret_cast<const char**>(member) = value;
     else if (taken->kind == takesNumber && !parseNumber(value, reinterpret_cast<long*>(member)))
         return failUsage("%s takes a number, not %s", taken->name, value);
-    return taken->kind == takesTimestamp ? takeInstant(taken->name, value, member) : 0;
+    int rc = taken->kind == takesTimestamp ? takeInstant(taken->name, value, member) : 0;
+    return rc == 0 && taken->kind == takesTimestamp && !isTime(member)
+               ? failUsage("%s takes a date and a time that exist, not %s", taken->name, value)
+               : rc;
 }
 
 // Takes the option at argv[*at], and its value if that is the next argument.
@@ -259,7 +268,8 @@ int runProgram(int argc, char** argv)
         return failUsage("no subcommand given");
     const char* name = argv[1];
     bool help = strcmp(name, "help") == 0;
-    if ((help && argc == 2) || strcmp(name, "--help") == 0 || strcmp(name, "-h") == 0)
+    if ((help && (argc == 2 || argv[2][0] == '-')) || strcmp(name, "--help") == 0 ||
+        strcmp(name, "-h") == 0)
         return showHelp();
     if (strcmp(name, "--version") == 0) {
         puts("zq3hist " ZQ3HIST_VERSION);

@@ -57,7 +57,10 @@ enum : unsigned int {
     optionDryRun = 4096,
     optionForce = 8192,
     optionSkipExisting = 16384,
-    optionAllLocks = 32768, // in place of the directory
+    optionAllLocks = 32768,    // in place of the directory
+    optionNeededSince = 65536, // of unneeded
+    optionPruneBefore = 131072,
+    optionSalvage = 262144, // repair by force
 };
 
 // A call of a subcommand.
@@ -101,6 +104,9 @@ int runProgram(int argc, char** argv);
 // Takes a timestamp as histories hold it, 14 digits, or as people write it: 2025-01-11 01:00:00,
 // with a blank or T in the middle. timestamp: room for 15 characters. False: neither.
 bool parseTimestamp(const char* text, char* timestamp);
+
+// Whether 14 digits are a date and a time that exist.
+bool isTime(const char* timestamp);
 
 // Takes a timestamp from the command line: complains and returns exitUsage when it is none, else 0.
 int takeInstant(const char* what, const char* text, char* timestamp);

@@ -129,6 +129,8 @@ TEST_F(ProgramTest, WrongCallsAreToldAndMakeNothing)
         {"plan h/", "usage: zq3hist plan [OPTION...] DIR TIMESTAMP [NAME...]"},
         {"images h/ --last", "--last needs a value: N"},
         {"images h/ --last=x", "--last takes a number, not x"},
+        {"images h/ --since 20251301000000",
+         "--since takes a date and a time that exist, not 20251301000000"},
         {"images h/ --json=1", "--json takes no value"},
         {"images h/ --nosuch", "images: unknown option --nosuch"},
         {"copy -d a h/", "-d must stand for each directory or for none"},
