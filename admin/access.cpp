@@ -14,7 +14,8 @@ int takePlace(const char* argument, historyPlace* place)
     struct stat status;
     size_t length = strlen(argument);
     const char* separator = length != 0 && argument[length - 1] == '/' ? "" : "/";
-    if (length + strlen(separator) > maxDirectoryLength)
+    const char* here = argument[0] == '-' ? "./" : ""; // a hint would give it as an option
+    if (strlen(here) + length + strlen(separator) > maxDirectoryLength)
         return fail(argument, "the directory's name has more than %u bytes", maxDirectoryLength);
     if (stat(argument, &status) != 0)
         return failWithCode(sqloSystemError | errno, "open the directory", argument);
@@ -22,11 +23,11 @@ int takePlace(const char* argument, historyPlace* place)
         return fail(argument, "not a directory");
     if (access(argument, X_OK) != 0) // its files would seem to be missing
         return failWithCode(sqloSystemError | errno, "search the directory", argument);
-    snprintf(place->directory, sizeof place->directory, "%s%s", argument, separator);
-    snprintf(place->historyPath, sizeof place->historyPath, "%s%s" SQLUH_HISTORY_NAME, argument,
-             separator);
-    snprintf(place->shadowPath, sizeof place->shadowPath, "%s%s" SQLUH_SHADOW_NAME, argument,
-             separator);
+    snprintf(place->directory, sizeof place->directory, "%s%s%s", here, argument, separator);
+    snprintf(place->historyPath, sizeof place->historyPath, "%s%s%s" SQLUH_HISTORY_NAME, here,
+             argument, separator);
+    snprintf(place->shadowPath, sizeof place->shadowPath, "%s%s%s" SQLUH_SHADOW_NAME, here,
+             argument, separator);
     return 0;
 }
 
@@ -59,7 +60,7 @@ static void fatalSignals(sigset_t* set)
     }
 }
 
-static void holdSignals(void)
+void holdSignals(void)
 {
     sigset_t set;
     fatalSignals(&set);
@@ -79,6 +80,11 @@ bool isSignalHeld(void)
     fatalSignals(&fatal);
     return sigpending(&pending) == 0 && sigandset(&both, &fatal, &pending) == 0 &&
            sigisemptyset(&both) == 0;
+}
+
+int failInterrupted(const historyPlace* place)
+{
+    return isSignalHeld() ? fail(place->directory, "interrupted; nothing was changed") : 0;
 }
 
 // A file that may not be read counts as unusable for the library, which would move it aside where
@@ -108,6 +114,21 @@ void describeHolder(const SQLO_NLCKSTATE* state, char* text)
              state->pid);
 }
 
+int checkLock(const historyPlace* place, int rights)
+{
+    SQLO_NLCK lock = {};
+    SQLO_NLCKSTATE state = {};
+    if (!hasHistoryFile(place) && !ossPathExists(place->shadowPath))
+        return failInPlace(HISTORY_FILE_MISSING, "open the history", place);
+    int rc = checkRights(place, rights);
+    if (rc != 0 || !queryLock(place, &lock, &state))
+        return rc;
+    if (isLeftByDead(&state))
+        return failInPlace(sqloNLCKOwnerDied, "take the lock", place);
+    return state.state == sqloNLCKForeign ? failInPlace(sqloNLCKKeyConflict, "take the lock", place)
+                                          : 0;
+}
+
 int awaitLock(const historyPlace* place, int rights)
 {
     SQLO_NLCK lock = {};
@@ -115,18 +136,8 @@ int awaitLock(const historyPlace* place, int rights)
     char holder[holderCapacity];
     bool told = false;
     const long long start = milliseconds();
-    if (!hasHistoryFile(place) && !ossPathExists(place->shadowPath))
-        return failInPlace(HISTORY_FILE_MISSING, "open the history", place);
-    int rc = checkRights(place, rights);
-    if (rc != 0)
-        return rc;
-    while (queryLock(place, &lock, &state)) {
-        if (isLeftByDead(&state))
-            return failInPlace(sqloNLCKOwnerDied, "take the lock", place);
-        if (state.state == sqloNLCKForeign)
-            return failInPlace(sqloNLCKKeyConflict, "take the lock", place);
-        if (state.state == sqloNLCKAbsent)
-            break;
+    int rc = checkLock(place, rights);
+    while (rc == 0 && queryLock(place, &lock, &state) && state.state != sqloNLCKAbsent) {
         describeHolder(&state, holder);
         if (place->wait >= 0 && milliseconds() - start >= place->wait * 1000LL) {
             fail(place->directory, "%s", holder);
@@ -136,9 +147,13 @@ int awaitLock(const historyPlace* place, int rights)
             fprintf(stderr, "zq3hist: waiting: %s\n", holder);
         told = true;
         usleep(50 * 1000);
+        rc = failInterrupted(place);
+        if (rc == 0)
+            rc = checkLock(place, rights);
     }
-    holdSignals();
-    return 0;
+    if (rc == 0)
+        holdSignals();
+    return rc;
 }
 
 int failOpening(int code, const char* what, const historyPlace* place)
@@ -187,6 +202,5 @@ int createIfMissing(historyPlace* place)
         rc = rc != 0 ? rc : unlocked;
         sqluhHandleFree(&handle);
     }
-    releaseSignals();
     return rc == 0 ? 0 : failInPlace(rc, "create the history", place);
 }

@@ -267,10 +267,19 @@ int newestImage(const imageCatalog* catalog)
     return i;
 }
 
-int failNoImage(const historyPlace* place, const char* timestamp)
+int failNoImage(const historyPlace* place, const imageCatalog* catalog, const char* timestamp)
 {
-    fail(place->directory, "no image has the timestamp %s", timestamp);
-    hint(place, "zq3hist images DIR  # lists all");
+    const unusedImage* unused = nullptr;
+    for (int i = 0; i < catalog->numUnused; i++)
+        if (strcmp(catalog->unused[i].image.timestamp, timestamp) == 0)
+            unused = &catalog->unused[i];
+    if (unused == nullptr)
+        fail(place->directory, "no image has the timestamp %s", timestamp);
+    else
+        fail(place->directory, "the image %s %s", timestamp,
+             unused->sqlcode < 0 ? "failed" : "is not active");
+    hint(place, unused == nullptr ? "zq3hist images DIR  # lists all"
+                                  : "zq3hist images --all DIR  # also lists those that failed");
     return exitNoImage;
 }
 
@@ -289,6 +298,16 @@ void describeGap(const numberGap* gap, char* text)
         snprintf(text, gapCapacity, "entry %u", gap->first);
     else
         snprintf(text, gapCapacity, "entries %u to %u", gap->first, gap->last);
+}
+
+void describeLack(const char* image, char* text)
+{
+    if (image == nullptr)
+        snprintf(text, lackCapacity, "a full image");
+    else if (image[0] == '\0')
+        snprintf(text, lackCapacity, "the image that a restore used, which has no name");
+    else
+        snprintf(text, lackCapacity, "the image %s", image);
 }
 
 // --- Planning ------------------------------------------------------------------------------------

@@ -57,8 +57,8 @@ const char* scopeOfImage(const historyEntry* image); // database, tablespace
 int findImage(const imageCatalog* catalog, const char* timestamp);
 int newestImage(const imageCatalog* catalog);
 
-// Complains that there is none and returns exitNoImage.
-int failNoImage(const historyPlace* place, const char* timestamp);
+// Complains that there is none, or that it is one which no plan uses, and returns exitNoImage.
+int failNoImage(const historyPlace* place, const imageCatalog* catalog, const char* timestamp);
 
 // The first gap in the entry numbers after the oldest and before the newest position; null: none.
 const numberGap* gapBetween(const imageCatalog* catalog, int oldest, int newest);
@@ -66,6 +66,11 @@ const numberGap* gapBetween(const imageCatalog* catalog, int oldest, int newest)
 // Writes "entry 5" or "entries 5 to 6".
 enum : unsigned int { gapCapacity = 40 };
 void describeGap(const numberGap* gap, char* text);
+
+// Writes what is missing: "a full image" for null, else the image with the timestamp, or the one
+// that a restore used without naming it, for an empty one. Bytes are as they are in the history.
+enum : unsigned int { lackCapacity = 64 };
+void describeLack(const char* image, char* text);
 
 // Put the members of an image's object, one of a list of what tablespaces lack, and the gap
 // (images.cpp).

@@ -116,6 +116,8 @@ int chartMain(commandLine* line)
     int target = -1;
     int rc = line->json && line->svg != nullptr ? failUsage("chart takes --svg or --json, not both")
                                                 : takeColor(line->color, &colored);
+    if (rc == 0 && line->svg != nullptr && isHistoryFile(&line->place, line->svg))
+        rc = fail(line->svg, "the picture would replace the history itself");
     if (rc == 0 && line->numArguments > 0 && !isLatest)
         rc = takeInstant("chart", line->arguments[0], timestamp);
     if (rc == 0)
@@ -125,7 +127,7 @@ int chartMain(commandLine* line)
     else if (rc == 0 && line->numArguments > 0)
         target = findImage(&catalog, timestamp);
     if (rc == 0 && line->numArguments > 0 && target < 0)
-        rc = failNoImage(&line->place, timestamp);
+        rc = failNoImage(&line->place, &catalog, timestamp);
     if (rc == 0)
         rc = makeChart(&catalog, target, &chart);
     if (rc == 0)

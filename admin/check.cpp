@@ -166,14 +166,13 @@ static void checkChains(checkReport* report)
     }
     if (first == nullptr)
         return;
-    const char* image = lackingImage(walk, first);
+    char lack[lackCapacity];
     char more[48] = "";
+    describeLack(lackingImage(walk, first), lack);
     if (numLacking > 1)
         snprintf(more, sizeof more, " (%d tablespaces lack one)", numLacking);
-    addProblem(report, exitIncomplete, "tablespace %s lacks %s%s%s",
-               walk->tablespaces[first->tablespace].name,
-               image == nullptr ? "a full image" : "the image ", image == nullptr ? "" : image,
-               more);
+    addProblem(report, exitIncomplete, "tablespace %s lacks %s%s",
+               walk->tablespaces[first->tablespace].name, lack, more);
 }
 
 // The reader tells by itself of damage that leaves nothing to read.

@@ -3,7 +3,20 @@
 
 #include <cstring>
 #include <ctime>
+#include <sys/stat.h>
 #include <unistd.h>
+
+bool isSamePlace(const char* a, const char* b)
+{
+    struct stat first, second;
+    return stat(a, &first) == 0 && stat(b, &second) == 0 && first.st_dev == second.st_dev &&
+           first.st_ino == second.st_ino;
+}
+
+bool isHistoryFile(const historyPlace* place, const char* path)
+{
+    return isSamePlace(path, place->historyPath) || isSamePlace(path, place->shadowPath);
+}
 
 void lookAtFile(const char* path, fileReport* report)
 {
@@ -95,6 +108,7 @@ void addToReport(entriesReport* report, const SQLUH_ENTRY* entry)
     const zq3HistoryData* data = entry->data;
     const char* timestamp = data->objectPart.data;
     report->count++;
+    report->lastNumber = data->entryNumber;
     report->digest = (report->digest << 5 | report->digest >> 27) ^ entry->checksum;
     if (data->numTablespaces > report->maxTablespaces)
         report->maxTablespaces = data->numTablespaces;

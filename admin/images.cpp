@@ -14,11 +14,10 @@ static const char* nameOfLink(const chainWalk* walk, const chainLink* link)
 
 static void putLack(const chainWalk* walk, const chainLink* link, bool plural)
 {
-    const char* image = lackingImage(walk, link);
-    const char* verb = plural ? " lack" : " lacks";
-    printf(image == nullptr ? "%s a full image" : "%s the image ", verb);
-    if (image != nullptr)
-        putEscaped(stdout, image, strlen(image));
+    char lack[lackCapacity];
+    describeLack(lackingImage(walk, link), lack);
+    fputs(plural ? " lack " : " lacks ", stdout);
+    putEscaped(stdout, lack, strlen(lack));
 }
 
 static void putMissing(const chainWalk* walk, const imageChains* chains)

@@ -35,7 +35,6 @@ int lockPair(historyPlace* place, int rights, SQLUH_HANDLE** handle)
     if (code == 0)
         return 0;
     sqluhHandleFree(handle);
-    releaseSignals();
     return failInPlace(code, "take the lock", place);
 }
 
@@ -47,8 +46,6 @@ int unlockPair(const historyPlace* place, SQLUH_HANDLE** handle, int rc)
     sqluhHandleFree(handle);
     if (rc == 0 && code != 0)
         rc = failInPlace(code, "release the lock", place);
-    fflush(stdout); // what was done is told, whatever signal comes now
-    releaseSignals();
     return rc;
 }
 
@@ -129,15 +126,15 @@ int replacePair(const historyPlace* place, SQLUH_HANDLE* handle, char* temporary
     return rc;
 }
 
-int installHistory(historyPlace* place, char* temporary, keptFiles* kept)
+int installHistory(historyPlace* place, char* temporary, keptFiles* kept, SQLUH_HANDLE** handle)
 {
-    SQLUH_HANDLE* handle = nullptr;
-    int rc = createIfMissing(place);
+    *handle = nullptr;
+    int rc = failInterrupted(place);
     if (rc == 0)
-        rc = lockPair(place, R_OK | W_OK, &handle);
+        rc = createIfMissing(place);
     if (rc == 0)
-        rc = keepPair(handle, kept);
+        rc = lockPair(place, R_OK | W_OK, handle);
     if (rc == 0)
-        rc = replacePair(place, handle, temporary);
-    return unlockPair(place, &handle, rc);
+        rc = keepPair(*handle, kept);
+    return rc == 0 ? replacePair(place, *handle, temporary) : rc;
 }

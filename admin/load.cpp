@@ -171,6 +171,13 @@ static int skipKnown(const historyPlace* place, historyList* list, uint32_t* the
 
 enum : int { loadInterrupted = 1, loadOutdated = 2 }; // instead of a code
 
+// The number of an entry that is given none: its place, but after a prune the numbers go on.
+static uint32_t nextNumber(const entriesReport* totals)
+{
+    uint32_t last = totals->lastNumber < UINT32_MAX ? totals->lastNumber : 0;
+    return (last > totals->count ? last : totals->count) + 1;
+}
+
 // Writes the records after the entries that are there, and brings the header up to date. What the
 // header says of the old entries is counted anew: it may come from a writer that did not keep it.
 static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport* totals)
@@ -181,7 +188,7 @@ static int appendRecords(SQLUH_HANDLE* handle, historyList* list, entriesReport*
     for (size_t i = 0; rc == 0 && i < list->count; i++) {
         historyRecord* record = list->records[i];
         if (record->numberByPlace)
-            record->data.entryNumber = totals->count + 1;
+            record->data.entryNumber = nextNumber(totals);
         rc = sqluhWriteEntry(handle, &record->entry);
         addToReport(totals, &record->entry);
         header->entryCount = totals->count;
@@ -252,17 +259,18 @@ static int runBatch(historyPlace* place, historyList* list, const uint32_t* know
     return rc;
 }
 
-// A batch opens the history, which repairs it if it must, and not always from the better file: that
-// is left to whoever has looked.
+// Both files are read before anything is changed. A batch opens the history, which repairs it if it
+// must, and not always from the better file: that is left to whoever has looked. Nor is a batch
+// begun beside a shadow from which it could not be undone. Where writers leave no moment to look,
+// the batch reads the history again.
 static int checkPair(const historyPlace* place)
 {
     pairFinding pair;
+    bool atWork = false;
     sqluhRepair due = repairDueIn(place);
-    if (due == sqluhRepairNone)
-        return 0;
-    int rc = examinePair(place, true, &pair);
+    int rc = examineQuietPair(place, true, &pair, &atWork);
     bool isMended = pair.due == due && due != sqluhRepairAnew && !pair.refused;
-    return rc != 0 || isMended ? rc : failPair(place, &pair, "append to the history");
+    return rc != 0 || atWork || isMended ? rc : failPair(place, &pair, "append to the history");
 }
 
 static int appendList(commandLine* line, historyList* list)
@@ -288,7 +296,9 @@ static int rehearse(const commandLine* line, historyList* list)
     uint32_t known;
     if (!ossPathExists(place->historyPath) && !ossPathExists(place->shadowPath))
         return 0;
-    int rc = checkPair(place);
+    int rc = checkLock(place, R_OK | W_OK);
+    if (rc == 0)
+        rc = checkPair(place);
     return rc == 0 && line->skipExisting ? skipKnown(place, list, &known) : rc;
 }
 
@@ -319,8 +329,6 @@ int loadMain(commandLine* line)
         rc = line->dryRun ? rehearse(line, &list) : appendList(line, &list);
     if (rc == 0)
         tellLoaded(line, list.count, given);
-    fflush(stdout); // what was done is told, whatever signal comes now
-    releaseSignals();
     freeList(&list);
     return rc;
 }

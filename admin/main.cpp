@@ -33,8 +33,10 @@ int main(int argc, char** argv)
     // A report that did not reach its reader must not end like one that did.
     bool written = ferror(stdout) == 0 && fflush(stdout) == 0;
     if (!written || (close(STDOUT_FILENO) != 0 && errno != EBADF)) {
-        if (!isReaderGone())
-            fail("standard output", "cannot write: %s", strerror(errno));
+        const char* what =
+            hasChanged() ? "what was asked for is done, but cannot be told" : "cannot write";
+        if (hasChanged() || !isReaderGone())
+            fail("standard output", "%s: %s", what, strerror(errno));
         rc = rc != exitDone ? rc : exitFailed;
     }
     return rc;

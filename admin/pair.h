@@ -83,9 +83,9 @@ void putJsonKept(jsonWriter* json, const keptFiles* kept);
 // both files, under the lock. Complains and returns an exit status, else 0.
 int replacePair(const historyPlace* place, SQLUH_HANDLE* handle, char* temporary);
 
-// Does all of it: makes the pair if the directory has none, takes the lock, keeps the old files,
-// replaces them, and releases the lock.
-int installHistory(historyPlace* place, char* temporary, keptFiles* kept);
+// Does all of it: makes the pair if the directory has none, takes the lock, keeps the old files and
+// replaces them. *handle is null or the caller's to be given to unlockPair.
+int installHistory(historyPlace* place, char* temporary, keptFiles* kept, SQLUH_HANDLE** handle);
 
 // --- Writing a part of a history (part.cpp) ------------------------------------------------------
 

@@ -94,7 +94,7 @@ static int findTarget(planRequest* request)
                           : findImage(&request->catalog, request->timestamp);
     if (request->target < 0) {
         if (request->timestamp != nullptr)
-            return failNoImage(request->place, request->timestamp);
+            return failNoImage(request->place, &request->catalog, request->timestamp);
         fail(request->place->directory, "no image%s is there%s%s",
              request->numNames == 0 ? "" : " with these tablespaces",
              request->before[0] == '\0' ? "" : " up to ", request->before);
@@ -256,12 +256,13 @@ static void failColumn(const planRequest* request, int column)
     else
         snprintf(who, sizeof who, "tablespace %s and %d more lack", plan->stages.list[column].name,
                  count - 1);
-    if (lack == planLacksFullImage)
-        fail(timestamp, "%s a full image", who);
-    else if (lack == planLacksRestored)
-        fail(timestamp, "%s the image %s that was restored", who, image);
-    else if (lack == planLacksOnHand)
-        fail(timestamp, "%s the image %s, which is not on hand", who, image);
+    char what[lackCapacity];
+    describeLack(image, what);
+    if (lack != planLacksNothing)
+        fail(timestamp, "%s %s%s", who, what,
+             lack == planLacksOnHand                         ? ", which is not on hand"
+             : lack == planLacksRestored && image[0] != '\0' ? " that was restored"
+                                                             : "");
 }
 
 // Tells which chains are open, and where a restore is possible.
@@ -270,6 +271,8 @@ static int failIncomplete(const planRequest* request)
     for (int column = 0; column < request->plan.stages.numTablespaces; column++)
         failColumn(request, column);
     char advice[128] = "zq3hist images DIR  # no image of this scope can be restored";
+    if (request->catalog.onHand != nullptr)
+        snprintf(advice, sizeof advice, "zq3hist images DIR  # all, also those not on hand");
     if (request->restorable >= 0)
         snprintf(advice, sizeof advice,
                  "zq3hist plan DIR %s  # the newest image that can be restored",

@@ -166,6 +166,8 @@ int pruneMain(commandLine* line)
     stat(place->historyPath, &planned);
     int rc = formTemporary(place->historyPath, temporary);
     if (rc == 0)
+        rc = checkLock(place, R_OK | W_OK);
+    if (rc == 0)
         rc = findBeginning(place, line->before, &plan);
     if (rc == 0 && line->dryRun) {
         partReport part = {};

@@ -113,7 +113,7 @@ int repairMain(commandLine* line)
     historyPlace* place = &line->place;
     SQLUH_HANDLE* handle = nullptr;
     repairReport report = {};
-    int rc = line->dryRun ? 0 : lockPair(place, R_OK | W_OK, &handle);
+    int rc = line->dryRun ? checkLock(place, R_OK | W_OK) : lockPair(place, R_OK | W_OK, &handle);
     if (rc == 0)
         rc = repairPair(line, handle, &report);
     if (rc == 0 && line->json)

@@ -52,10 +52,29 @@ static bool isUnreadable(const fileReport* file)
     return file->present && isSystemCode(file->rc);
 }
 
+static bool isRefused(const directoryReport* report)
+{
+    return isUnreadable(&report->history) || isUnreadable(&report->shadow);
+}
+
+// Whether the file ends before the entry that its header calls the newest.
+static bool isCut(const fileReport* file)
+{
+    return file->rc == 0 && file->header.offset3 != 0 &&
+           file->header.offset3 + entryMinLength > file->size;
+}
+
+static bool isPairCut(const directoryReport* report)
+{
+    return report->due == sqluhRepairNone && (isCut(&report->history) || isCut(&report->shadow));
+}
+
 static const char* verdict(const directoryReport* report)
 {
     sqluhRepair due = report->due;
-    if (due == sqluhRepairAnew && (isUnreadable(&report->history) || isUnreadable(&report->shadow)))
+    if (isPairCut(report))
+        return "cut short: the newest entry is not there";
+    if (due == sqluhRepairAnew && isRefused(report))
         return "cannot be read";
     return due == sqluhRepairNone     ? "usable; both files are in step"
            : due == sqluhRepairShadow ? "usable; the next open rebuilds the shadow from the history"
@@ -149,7 +168,7 @@ static void hintAfter(const historyPlace* place, const directoryReport* report)
 {
     if (report->lockKnown && isLeftByDead(&report->lockState))
         hint(place, unlockAdvice);
-    else if (report->due != sqluhRepairNone &&
+    else if ((report->due != sqluhRepairNone || isPairCut(report)) &&
              !(report->lockKnown && report->lockState.state == sqloNLCKHeld))
         hint(place, "zq3hist verify DIR  # reads both files and tells what mends them");
 }
@@ -174,8 +193,8 @@ int statusMain(commandLine* line)
         printf("%-10s%s\n", "", verdict(&report));
     }
     hintAfter(place, &report);
-    if (report.due == sqluhRepairAnew)
-        return exitDamaged;
+    if (report.due == sqluhRepairAnew || isPairCut(&report))
+        return isRefused(&report) ? exitFailed : exitDamaged;
     bool isFree = report.lockState.state == sqloNLCKAbsent ||
                   report.lockState.state == sqloNLCKSettingUp ||
                   report.lockState.state == sqloNLCKHeld;

@@ -186,6 +186,7 @@ static int takeAlias(const char* alias, commandLine* line)
     if (alias == nullptr || alias[0] == '\0' || count >= line->command->numDirectories)
         return failUsage("-d takes an alias, once for each directory");
     char* path = line->aliasPaths[count];
+    line->aliasAfter[count] = line->numArguments;
     int length = snprintf(path, pathCapacity, "%s%s%s", here ? "" : folder, here ? "" : "/", alias);
     if (length >= static_cast<int>(pathCapacity))
         return fail(alias, "the directory's name has more than %u bytes", maxDirectoryLength);
@@ -216,7 +217,8 @@ static int takeOptions(int argc, char** argv, commandLine* line, bool* helpGiven
     return rc;
 }
 
-// Takes the directories, from the aliases or from the front of the arguments.
+// Takes the directories: the aliases, and the first arguments for those that are left, in the order
+// in which they were given.
 static int takeDirectories(commandLine* line)
 {
     const subcommand* command = line->command;
@@ -224,20 +226,32 @@ static int takeDirectories(commandLine* line)
     historyPlace* places[mostDirectories] = {&line->place, &line->target};
     bool noneTaken = (command->options & optionAllLocks) != 0 && line->all;
     int taken = noneTaken ? 0 : command->numDirectories;
-    if (line->numAliases != 0 && line->numAliases != taken)
-        return failUsage("-d must stand for each directory or for none");
-    int given = line->numAliases != 0 ? 0 : taken;
+    if (line->numAliases > taken)
+        return failUsage("-d takes an alias, once for each directory");
+    int given = taken - line->numAliases;
     line->arguments += given;
     line->numArguments -= given;
     if (line->numArguments < command->least ||
         (command->most >= 0 && line->numArguments > command->most))
         return failForm(line);
-    int rc = 0;
+    int rc = 0, alias = 0;
     for (int i = 0; rc == 0 && i < taken && i < mostDirectories; i++) {
-        rc = takePlace(given != 0 ? line->arguments[i - given] : line->aliasPaths[i], places[i]);
+        int argument = i - alias;
+        bool isAlias =
+            alias < line->numAliases && (argument == given || line->aliasAfter[alias] <= argument);
+        rc = takePlace(isAlias ? line->aliasPaths[alias] : line->arguments[argument - given],
+                       places[i]);
+        alias += isAlias;
         places[i]->wait = line->wait;
     }
     return rc;
+}
+
+static bool changed;
+
+bool hasChanged(void)
+{
+    return changed;
 }
 
 static int runSubcommand(const subcommand* command, int argc, char** argv)
@@ -251,7 +265,12 @@ static int runSubcommand(const subcommand* command, int argc, char** argv)
         return showHelpOf(command);
     if (rc == 0)
         rc = takeDirectories(&line);
-    return rc != 0 ? rc : command->run(&line);
+    if (rc == 0)
+        rc = command->run(&line);
+    fflush(stdout); // what was done is told, whatever signal comes now
+    releaseSignals();
+    changed = rc == exitDone && (command->options & optionDryRun) != 0 && !line.dryRun;
+    return rc;
 }
 
 static const subcommand* findSubcommand(const char* name)

@@ -8,14 +8,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-// Whether two paths lead to one file or directory.
-static bool isSamePlace(const char* a, const char* b)
-{
-    struct stat first, second;
-    return stat(a, &first) == 0 && stat(b, &second) == 0 && first.st_dev == second.st_dev &&
-           first.st_ino == second.st_ino;
-}
-
 // Verifies the file at path, called name, and tells the number of its entries.
 static int proveImage(const char* path, const char* name, const char* what, uint32_t* count)
 {
@@ -57,11 +49,20 @@ static int countCommitted(const historyPlace* place, const char* what, uint32_t*
     const fileFinding* finding = nullptr;
     pairFinding pair;
     bool atWork;
-    int rc = examineQuietPair(place, true, &pair, &atWork);
+    int rc = checkLock(place, R_OK);
+    if (rc == 0)
+        rc = examineQuietPair(place, true, &pair, &atWork);
     if (rc == 0 && sourceOf(place, &pair, &finding) == nullptr)
         rc = failPair(place, &pair, what);
     *count = finding != nullptr ? finding->entries.count : 0;
     return rc;
+}
+
+// What a dry run of copy and restore looks at: whether the history there can be replaced.
+static int checkTarget(const historyPlace* place)
+{
+    bool isThere = hasHistoryFile(place) || ossPathExists(place->shadowPath);
+    return isThere ? checkLock(place, R_OK | W_OK) : 0;
 }
 
 static void tellReplaced(const historyPlace* place, uint32_t count, const char* done, bool dryRun,
@@ -81,25 +82,29 @@ int restoreMain(commandLine* line)
     historyPlace* place = &line->place;
     const char* image = line->arguments[0];
     char temporary[pathCapacity];
+    SQLUH_HANDLE* handle = nullptr;
     keptFiles kept = {};
     uint32_t count = 0;
     int rc = formTemporary(place->historyPath, temporary);
     if (rc == 0)
         rc = proveImage(image, image, "restore the history", &count);
+    if (rc == 0 && line->dryRun)
+        rc = checkTarget(place);
     if (rc == 0 && !line->dryRun) {
         // The copy is what was verified, whatever happens to the image meanwhile: so it is verified
         // too.
+        holdSignals();
         int copied = sqlocopy(image, temporary, 0);
         rc = copied != 0
                  ? failWithCode(copied, "copy the backup to the directory", place->directory)
                  : proveImage(temporary, image, "restore the history", &count);
         if (rc == 0)
-            rc = installHistory(place, temporary, &kept);
+            rc = installHistory(place, temporary, &kept, &handle);
         unlink(temporary);
     }
     if (rc == 0)
         tellReplaced(place, count, "restored", line->dryRun, &kept);
-    return rc;
+    return unlockPair(place, &handle, rc);
 }
 
 int copyMain(commandLine* line)
@@ -107,6 +112,7 @@ int copyMain(commandLine* line)
     historyPlace* source = &line->place;
     historyPlace* target = &line->target;
     char temporary[pathCapacity];
+    SQLUH_HANDLE* handle = nullptr;
     keptFiles kept = {};
     uint32_t count = 0;
     int rc = formTemporary(target->historyPath, temporary);
@@ -116,18 +122,21 @@ int copyMain(commandLine* line)
         return fail(target->directory, "source and target are the same directory");
     if (line->dryRun) {
         rc = countCommitted(source, "copy the history", &count);
+        if (rc == 0)
+            rc = checkTarget(target);
     } else {
+        holdSignals();
         // One lock at a time: keys may clash, and the second lock would then wait for the first.
         rc = copyCommitted(source, temporary, "copy the history", target->directory);
         if (rc == 0)
             rc = proveImage(temporary, source->directory, "copy the history", &count);
         if (rc == 0)
-            rc = installHistory(target, temporary, &kept);
+            rc = installHistory(target, temporary, &kept, &handle);
         unlink(temporary);
     }
     if (rc == 0)
         tellReplaced(target, count, "copied", line->dryRun, &kept);
-    return rc;
+    return unlockPair(target, &handle, rc);
 }
 
 // --- Backup --------------------------------------------------------------------------------------
@@ -137,7 +146,7 @@ int copyMain(commandLine* line)
 static int checkBackupName(const historyPlace* place, const char* path, bool force)
 {
     struct stat there;
-    if (isSamePlace(path, place->historyPath) || isSamePlace(path, place->shadowPath))
+    if (isHistoryFile(place, path))
         return fail(path, "the backup would replace the history itself");
     if (lstat(path, &there) != 0)
         return 0;
@@ -185,7 +194,8 @@ static int writeOut(const char* path)
     FILE* in = fopen(path, "r");
     if (in == nullptr)
         return sqloSystemError | errno;
-    unlink(path); // it is gone, however this ends
+    unlink(path);
+    releaseSignals(); // nothing is left behind now, and the reader may be slow
     bool done = true;
     while (done && (got = fread(buffer, 1, sizeof buffer, in)) > 0)
         done = fwrite(buffer, 1, got, stdout) == got;
@@ -204,6 +214,8 @@ int backupMain(commandLine* line)
     char temporary[pathCapacity] = "";
     uint32_t count = 0;
     int rc = toOutput ? 0 : checkBackupName(place, path, line->force);
+    if (rc == 0 && !line->dryRun)
+        holdSignals();
     if (rc == 0 && toOutput && !line->dryRun)
         rc = formPrivate(temporary);
     else if (rc == 0)
@@ -217,13 +229,17 @@ int backupMain(commandLine* line)
         // A damaged history must not take the place of a good backup.
         if (rc == 0)
             rc = proveImage(temporary, place->directory, "back up the history", &count);
+        if (rc == 0)
+            rc = failInterrupted(place);
         int code = rc != 0 ? 0 : toOutput ? writeOut(temporary) : nameBackup(temporary, path);
         if (code != 0)
             rc = failWithCode(code, "write the backup", toOutput ? "standard output" : path);
         if (rc != 0)
             unlink(temporary);
     }
-    if (rc == 0 && ferror(stdout) == 0)
+    if (rc == 0 && ferror(stdout) != 0)
+        rc = exitFailed; // main says why
+    if (rc == 0)
         fprintf(toOutput ? stderr : stdout, "%u %s %sbacked up\n", count, entryWord(count),
                 line->dryRun ? "would be " : "");
     return rc;

@@ -71,6 +71,24 @@ static void showMarked(markedImages* marked, const commandLine* line, bool mark,
     }
 }
 
+static bool isSameTime(const markedImages* marked, int a, int b)
+{
+    const historyEntry* entries = marked->catalog.history.entries;
+    return strcmp(entries[a].timestamp, entries[b].timestamp) == 0;
+}
+
+// A history may list an image more than once: whoever needs one of the entries needs the image.
+static void shareMarks(markedImages* marked)
+{
+    int count = marked->catalog.history.numEntries;
+    for (int first = 0, end = 0; first < count; first = end) {
+        bool any = false;
+        for (end = first; end < count && isSameTime(marked, first, end); end++)
+            any = any || marked->marks[end];
+        memset(marked->marks + first, any, static_cast<size_t>(end - first));
+    }
+}
+
 // Marks what the restores to images from that time on need, and those images themselves. The next
 // image is one of them: what it will be taken on top of is needed, too. False: no image is there.
 static bool markNeeded(markedImages* marked, const char* since)
@@ -99,6 +117,7 @@ static bool markNeeded(markedImages* marked, const char* since)
                 marked->links[next] = true;
         }
     }
+    shareMarks(marked);
     return any;
 }
 
@@ -146,21 +165,24 @@ int unneededMain(commandLine* line)
     return rc;
 }
 
-// Marks the images that can be restored, and not without the one at the position.
+// Marks the images that can be restored, and not without the one whose first entry is at the
+// position.
 static void markNeeders(markedImages* marked, int position)
 {
     const chainWalk* walk = &marked->walk;
-    bool inAll = walk->images[position].numLinks == 0;
+    bool inAll = false;
     for (int i = position; i < marked->catalog.history.numEntries; i++) {
         const imageChains* chains = &walk->images[i];
+        bool isImageEntry = isImage(&marked->catalog.history.entries[i]);
+        bool isNeeded = isImageEntry && isSameTime(marked, i, position);
+        inAll = inAll || (isNeeded && chains->numLinks == 0);
         bool needs = inAll;
         for (int link = chains->firstLink; link < chains->firstLink + chains->numLinks; link++) {
             int next = nextNeeded(walk, link);
-            marked->links[link] = i == position || (next >= 0 && marked->links[next]);
+            marked->links[link] = isNeeded || (next >= 0 && marked->links[next]);
             needs = needs || marked->links[link];
         }
-        if (i != position && needs && isImage(&marked->catalog.history.entries[i]) &&
-            chains->numIncomplete == 0)
+        if (isImageEntry && !isNeeded && needs && chains->numIncomplete == 0)
             marked->marks[i] = true;
     }
 }
@@ -174,7 +196,7 @@ int neededByMain(commandLine* line)
         rc = readMarked(line, &marked);
     int position = rc == 0 ? findImage(&marked.catalog, timestamp) : -1;
     if (rc == 0 && position < 0)
-        rc = failNoImage(&line->place, timestamp);
+        rc = failNoImage(&line->place, &marked.catalog, timestamp);
     if (rc == 0) {
         markNeeders(&marked, position);
         showMarked(&marked, line, true, "image", timestamp, " need ");

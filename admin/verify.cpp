@@ -91,7 +91,7 @@ static int judge(const historyPlace* place, const pairFinding* pair, bool atWork
         return exitDone;
     fail(place->directory, "the history is not sound");
     hintAboutPair(place, pair);
-    return exitDamaged;
+    return pair->refused ? exitFailed : exitDamaged;
 }
 
 int verifyMain(commandLine* line)

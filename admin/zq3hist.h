@@ -76,6 +76,7 @@ struct commandLine {
     long last, keep, maxAge, wait;
     const char *have, *color, *svg;
     char aliasPaths[2][pathCapacity]; // of directories given as aliases
+    int aliasAfter[2];                // so many arguments
     int numAliases;
 };
 
@@ -96,8 +97,10 @@ int restoreMain(commandLine* line);
 int pruneMain(commandLine* line);
 int unlockMain(commandLine* line);
 
-// Runs the subcommand that argv[1] names and returns its exit status.
+// Runs the subcommand that argv[1] names and returns its exit status. hasChanged tells afterwards
+// whether it was one that changes a history, and did what it was asked for.
 int runProgram(int argc, char** argv);
+bool hasChanged(void);
 
 // --- Points in time (instant.cpp) ----------------------------------------------------------------
 
@@ -170,14 +173,26 @@ bool isLeftByDead(const SQLO_NLCKSTATE* state); // its process died
 enum : unsigned int { holderCapacity = 80 };
 void describeHolder(const SQLO_NLCKSTATE* state, char* text);
 
+// Looks whether the lock could be taken, sooner or later. Complains and returns an exit status when
+// there is no history, when a right is missing, or when the wait would never end; else 0.
+int checkLock(const historyPlace* place, int rights);
+
 // Waits, as long as the place allows, until no living process holds the lock, and says so when it
 // has to; from then on the signals that would end the process are held back until releaseSignals,
 // since dying with the lock leaves it to an administrator. rights: what access(2) must grant for
-// the two files. Complains and returns an exit status when there is no history, when a right is
-// missing, when the lock stays busy, or when the wait would never end; else 0.
+// the two files. Complains and returns an exit status as checkLock does, or when the lock stays
+// busy; else 0.
 int awaitLock(const historyPlace* place, int rights);
+
+// Holds those signals back, also where it is a file that would be left behind, and lets them
+// through again at the end of a command.
+void holdSignals(void);
 void releaseSignals(void);
-bool isSignalHeld(void); // one of them came meanwhile
+
+// Whether one of them came meanwhile. failInterrupted then complains and returns exitFailed, else
+// 0.
+bool isSignalHeld(void);
+int failInterrupted(const historyPlace* place);
 
 // Says why an open failed, telling a repair that failed from a history that is beyond one, and
 // returns the code's exit status.
@@ -199,6 +214,11 @@ int readCommitted(const historyPlace* place, SQLUH_COMMITTED** committed);
 int failDamaged(const historyPlace* place, const SQLUH_COMMITTED* committed, const char* what);
 
 // --- The two files (files.cpp) -------------------------------------------------------------------
+
+// Whether two paths lead to one file or directory, and whether a path leads to one of the two
+// files.
+bool isSamePlace(const char* a, const char* b);
+bool isHistoryFile(const historyPlace* place, const char* path);
 
 // What one of the two files shows from outside.
 struct fileReport {
@@ -231,6 +251,7 @@ struct entriesReport {
     uint32_t maxCommandLength;
     char newest[timestampWidth + 1]; // largest timestamp of 14 digits; empty: none
     long long newestAt;              // offset of its last entry
+    uint32_t lastNumber;             // of the last entry
     uint32_t digest;                 // equal for equal entries
 };
 

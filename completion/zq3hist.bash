@@ -19,7 +19,7 @@ _zq3hist() {
       *) given+=("${COMP_WORDS[i]}") ;;
     esac
   done
-  ((${#place[@]})) || place=("${given[0]}")
+  ((${#place[@]})) || place=("$(_zq3hist_expand "${given[0]}")")
   case $last in
     -d) mapfile -t COMPREPLY < <(cd "${ZQ3DBPATH:-.}" 2>/dev/null && compgen -d -- "${word^^}") ;;
     --have | --svg) mapfile -t COMPREPLY < <(compgen -f -- "$word") ;;
@@ -27,6 +27,16 @@ _zq3hist() {
     --last | --keep | --max-age | --wait) ;;
     *) _zq3hist_argument ;;
   esac
+}
+
+# A directory as it was typed: with a tilde or a variable in front, quoted or not.
+_zq3hist_expand() {
+  local typed=${1//[\"\'\\]/}
+  [[ $typed =~ ^\~(/.*)?$ ]] && typed=$HOME${typed:1}
+  if [[ $typed =~ ^\$\{?([A-Za-z_][A-Za-z0-9_]*)\}?(.*)$ ]]; then
+    typed=${!BASH_REMATCH[1]}${BASH_REMATCH[2]}
+  fi
+  printf '%s\n' "$typed"
 }
 
 _zq3hist_timestamps() {

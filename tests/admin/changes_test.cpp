@@ -159,9 +159,38 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
         {"zq3hist dump h >all; ", "load --skip-existing h/ all",
          "0 entries appended, 3 that were there left out\n[0]", "3 3"},
         {SPOIL("asc", "2000"), "load h/ more",
-         "zq3hist: cannot append to the history: the history is damaged, h/\n"
-         "zq3hist: hint: zq3hist verify h/  # names the damage and what mends it\n[3]",
+         "zq3hist: cannot append to the history: the entry at offset 1803 is damaged, "
+         "h/zq3rhist.asc\n" FROM_SHADOW,
          "1 3"},
+        {SPOIL("asc", "2000"), "load --dry-run h/ more",
+         "zq3hist: cannot append to the history: the entry at offset 1803 is damaged, "
+         "h/zq3rhist.asc\n" FROM_SHADOW,
+         "1 3"},
+        {CUT("asc", "1803") CUT("bak", "1803"), "status h/",
+         "history   zq3rhist.asc: 1803 bytes, status ' ' (consistent), 3 entries, newest "
+         "20250107010000 at offset 2582, node 0\n"
+         "shadow    zq3rhist.bak: 1803 bytes, status 'C' (consistent since the last commit), 3 "
+         "entries, newest 20250107010000 at offset 2582, node 0\n"
+         "lock      free (key KEY)\n          cut short: the newest entry is not there\n"
+         "zq3hist: hint: zq3hist verify h/  # reads both files and tells what mends them\n[3]",
+         "1 1"},
+        {"mkdir y; cp h/* y; ", "copy --dry-run -d sample y",
+         "3 entries would be copied\nWhat is there would be kept: 3 entries\n[0]", "3 3"},
+        {"rm y/*; ", "copy --dry-run y -d sample",
+         "zq3hist: cannot open the history: the directory holds no history file, y/\n"
+         "zq3hist: hint: zq3hist restore y/ FILE  # FILE: a backup; without one, zq3hist load y/ "
+         "FILE begins anew\n[3]",
+         "3 3"},
+        {"", "chart h/ --svg h/zq3rhist.bak",
+         "zq3hist: the picture would replace the history itself, h/zq3rhist.bak\n[1]", "3 3"},
+        {KILLED, "repair --dry-run h/",
+         "zq3hist: cannot take the lock: a process died while it held the lock, h/\n" UNLOCK "[4]",
+         "4 3"},
+        {SPOIL("bak", "2000"), "load h/ more",
+         "zq3hist: cannot append to the history: the entry at offset 1803 is damaged, "
+         "h/zq3rhist.bak\nzq3hist: hint: zq3hist repair h/  # makes the shadow anew from the "
+         "history file\n[3]",
+         "3 1"},
         {CUT("asc", "1803"), "load h/ more",
          "zq3hist: cannot append to the history: the file ends after 1 of 3 entries, "
          "h/zq3rhist.asc\n" FROM_SHADOW,
@@ -235,6 +264,10 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
          "damaged: the shadow is to be made anew; 3 entries" RESTORABLE "[3]", "3 3"},
         {"rm h/*; zq3hist load h /dev/null >new; ", "check h/",
          "no image: no image can be restored; 0 entries, 0 images, 0 incomplete\n[5]", "0 0"},
+        {"zq3hist prune h --before 20250107000000 >new; zq3hist load h more >new; ", "dump h/",
+         "Operation: backup\nTimestamp: 20250107010000\nNode: 0\nNumber: 3\nTablespace: A\n\n"
+         "Operation: backup\nTimestamp: 20250108010000\nNode: 0\nNumber: 4\nTablespace: A\n\n[0]",
+         "2 2 3 3"},
         {"", "repair h/", "Nothing to repair: both files hold the same 3 entries\n[0]", "3 3"},
         {"mkfifo new; ", "backup --force h/ new",
          "zq3hist: the backup would replace something that is no regular file, new\n[1]", "3 3"},
@@ -250,7 +283,7 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
         {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "verify h/",
          "zq3rhist.asc: sound, 3 entries\n"
          "zq3rhist.bak: cannot be read at offset 0: Is a directory\n"
-         "zq3hist: the history is not sound, h/\n" AGAIN "[3]",
+         "zq3hist: the history is not sound, h/\n" AGAIN "[1]",
          "3 -"},
         {"rm h/zq3rhist.bak; mkdir h/zq3rhist.bak; ", "load h/ more",
          "zq3hist: cannot append to the history: Is a directory, h/zq3rhist.bak\n" AGAIN "[1]",

@@ -51,6 +51,13 @@ TEST_F(ProgramTest, ATourOfTheSubcommands)
          "zq3hist: cannot back up the history: No such file or directory, none/image\n[1]"},
         {"", "backup h/ h/zq3rhist.bak",
          "zq3hist: the backup would replace the history itself, h/zq3rhist.bak\n[1]"},
+        {"mkdir ./-w; ", "status -- -w",
+         "zq3hist: cannot show the history: the directory holds no history file, ./-w/\n"
+         "zq3hist: hint: zq3hist restore ./-w/ FILE  # FILE: a backup; without one, zq3hist load "
+         "./-w/ FILE begins anew\n[3]"},
+        {"", "load h/ >/dev/full",
+         "zq3hist: what was asked for is done, but cannot be told: No space left on device, "
+         "standard output\n[1]"},
         {"mkdir 'tab\t'; ", "status 'tab\t'",
          "zq3hist: cannot show the history: the directory holds no history file, tab\\x09/\n"
          "zq3hist: hint: zq3hist restore $'tab\\x09/' FILE  # FILE: a backup; without one, "
@@ -133,7 +140,7 @@ TEST_F(ProgramTest, WrongCallsAreToldAndMakeNothing)
          "--since takes a date and a time that exist, not 20251301000000"},
         {"images h/ --json=1", "--json takes no value"},
         {"images h/ --nosuch", "images: unknown option --nosuch"},
-        {"copy -d a h/", "-d must stand for each directory or for none"},
+        {"copy -d a -d b -d c", "-d takes an alias, once for each directory"},
         {"images -d a -d b", "-d takes an alias, once for each directory"},
         {"images h/ -d", "-d takes an alias, once for each directory"},
         {"chart h/ --json --svg -", "chart takes --svg or --json, not both"},

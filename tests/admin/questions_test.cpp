@@ -273,6 +273,20 @@ TEST_F(QuestionTest, AnswersInFull)
          "zq3hist: no image is there from then on: 20260101000000, h/\n[5]"},
         {"needed-by h/ 20250103010000", "20250105010000  delta        database\n"
                                         "1 of 7 images need 20250103010000\n[0]"},
+        {"unneeded --keep 1 d/",
+         "20250101010000  delta        database\n"
+         "1 of 5 images are not needed by restores from 20250103000000\n[0]"},
+        {"needed-by d/ 20250102000000",
+         "20250103000000  delta        database\n20250103000000  delta        database\n"
+         "2 of 5 images need 20250102000000\n[0]"},
+        {"plan d/ 20250101010000",
+         "zq3hist: tablespace B lacks the image that a restore used, which has no name, "
+         "20250101010000\n"
+         "zq3hist: hint: zq3hist plan d/ 20250103000000  # the newest image that can be "
+         "restored\n[6]"},
+        {"plan h/ 20250106010000",
+         "zq3hist: the image 20250106010000 failed, h/\n"
+         "zq3hist: hint: zq3hist images --all h/  # also lists those that failed\n[5]"},
         {"needed-by h/ 20250107010000", "zq3hist: no image has the timestamp 20250107010000, h/\n"
                                         "zq3hist: hint: zq3hist images h/  # lists all\n[5]"},
         {"help needed-by",
@@ -282,7 +296,11 @@ TEST_F(QuestionTest, AnswersInFull)
          "  -d ALIAS                 in place of DIR: the database's directory in $ZQ3DBPATH\n[0]"},
     };
     run("load h/", tenDays());
-    run("load e/", "", "mkdir e s; ");
+    run("load e/", "", "mkdir e s d; ");
+    const std::string twice = stanza("backup", 20250102000000, "", {"A"}) +
+                              stanza("backup", 20250103000000, "Type: delta\n", {"A"});
+    run("load d/", stanza("restore", 20250101000000, "", {"B"}) +
+                       stanza("backup", 20250101010000, "Type: delta\n", {"B"}) + twice + twice);
     run("load s/", stanza("backup", 20250101000000, "Type: delta\n", {"A"}));
     spill(root + "have", "# on hand\n 20250101010000\n\n2025-01-02 01:00:00\r\n20250109010000\n");
     for (const auto& row : rows) {

@@ -150,28 +150,46 @@ TEST_F(StopTest, WhatIsLeftIsTheOldHistoryOrTheNewOne)
     }
 }
 
-// A signal does not leave the lock, and a load that it ends is undone, or it is told that it is
-// done.
-TEST_F(StopTest, AnInterruptedLoadIsUndoneOrTold)
+// A signal leaves neither the lock nor a temporary file, and what it ends is undone, or it is told
+// that it is done.
+TEST_F(StopTest, WhatIsInterruptedIsUndoneOrTold)
 {
+    const struct {
+        std::vector<std::string> words;
+        const char *undone, *told;
+        size_t entries;
+    } rows[] = {
+        {{"load", "/SAMPLE", "/old"}, "appended", "2 entries appended\n", 6},
+        {{"restore", "/SAMPLE", "/image"},
+         "changed",
+         "2 entries restored\nThe old file is kept",
+         2},
+    };
     spill(root + "old", stanzas({"20250101000000", "20250102000000"}));
     ASSERT_EQ(0, run({"load", "/SAMPLE", "/old"}));
+    ASSERT_EQ(0, run({"backup", "/SAMPLE", "/image"}));
+    ASSERT_EQ(0, run({"load", "/SAMPLE", "/old"}));
     const std::string history = slurp(historyPath), shadow = slurp(shadowPath);
-    int undone = 0, done = 0, status = 0;
-    for (int step = 0; status < untouched || status > 128; step++) {
-        putPair(history, shadow);
-        status = run({"load", "/SAMPLE", "/old"}, step, signalled);
-        std::string said = slurp(root + "said");
-        EXPECT_TRUE(lockKeyIsFree(historyPath)) << step;
-        if (slurp(historyPath) == history && slurp(shadowPath) == shadow) {
-            EXPECT_EQ("zq3hist: interrupted; nothing was appended, " + directory + "\n", said);
-            undone++;
-        } else {
-            EXPECT_EQ("2 entries appended\n", said) << step;
-            EXPECT_EQ(history.size() + 2 * size_t{entryMinLength}, slurp(historyPath).size());
-            done += status > 128;
+    for (const auto& row : rows) {
+        int undone = 0, done = 0, status = 0;
+        for (int step = 0; status < untouched || status > 128; step++) {
+            SCOPED_TRACE(row.words[0] + " at " + std::to_string(step));
+            putPair(history, shadow);
+            status = run(row.words, step, signalled);
+            const std::string said = slurp(root + "said");
+            EXPECT_TRUE(lockKeyIsFree(historyPath));
+            for (const auto& file : std::filesystem::directory_iterator(directory))
+                EXPECT_NE(".tmp", file.path().extension());
+            const bool isOld = slurp(historyPath) == history && slurp(shadowPath) == shadow;
+            undone += isOld;
+            done += !isOld && status > 128;
+            EXPECT_TRUE(said.starts_with(
+                isOld ? std::string("zq3hist: interrupted; nothing was ") + row.undone : row.told))
+                << said;
+            EXPECT_EQ(headerLength + (isOld ? 4 : row.entries) * entryMinLength,
+                      slurp(historyPath).size());
         }
+        EXPECT_GT(undone, 0);
+        EXPECT_GT(done, 1);
     }
-    EXPECT_GT(undone, 1);
-    EXPECT_GT(done, 1);
 }
