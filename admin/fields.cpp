@@ -66,7 +66,9 @@ static bool isDigits(const char* text, size_t length)
 // may hold it.
 static bool isOdd(const recordField* field, const char* text, size_t length)
 {
-    return (field->rule == oneTimestamp && !(isDigits(text, length) && isTime(text))) ||
+    bool isTimestamp = isDigits(text, length) && isTime(text);
+    return (field->rule == oneTimestamp && !isTimestamp) ||
+           (field->rule == oneImage && isDigits(text, length) && !isTimestamp) ||
            (field->rule == shortName && length >= zq3TablespaceNameCapacity);
 }
 
@@ -79,7 +81,9 @@ static int checkText(const recordField* field, fieldValue* value)
     for (size_t i = 0; field->rule != anyBytes && i < value->length; i++) {
         if (value->text[i] == '\0')
             return refuse(value, "a text without zero bytes");
-        if ((field->rule == oneWord || field->rule == oneTimestamp) && isWhite(value->text[i]))
+        bool isWord =
+            field->rule == oneWord || field->rule == oneTimestamp || field->rule == oneImage;
+        if (isWord && isWhite(value->text[i]))
             return refuse(value, "one word without white space");
     }
     bool isLeftEmpty = field->form == formBuffer && value->length == 0;
@@ -434,7 +438,7 @@ const recordField recordFields[numRecordFields] = {
          nullptr),
     TEXT("First text", "firstText", oneWord, firstText, WIDTH(fieldFirstText), nullptr),
     TEXT("Last text", "lastText", oneWord, lastText, WIDTH(fieldLastText), nullptr),
-    TEXT("Id", "id", oneWord, idText, WIDTH(fieldIdText), nullptr),
+    TEXT("Id", "id", oneImage, idText, WIDTH(fieldIdText), nullptr),
     TEXT("Qualifier", "qualifier", anyText, qualifierText, INT32_MAX,
          &SQLUH_ENTRY::qualifierLength),
     TEXT("Name", "name", anyText, nameText, INT32_MAX, &SQLUH_ENTRY::nameLength),

@@ -27,7 +27,8 @@ enum fieldForm : uint8_t {
 };
 
 // What a text must be beyond one without zero bytes.
-enum textRule : uint8_t { anyText, oneWord, oneTimestamp, shortName, anyBytes };
+// A word that is an image's timestamp if it has 14 digits: oneImage.
+enum textRule : uint8_t { anyText, oneWord, oneTimestamp, oneImage, shortName, anyBytes };
 
 struct letterWord {
     const char* word;

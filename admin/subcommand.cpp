@@ -37,7 +37,7 @@ static constexpr subcommand subcommands[] = {
      "replace the history by that in FILE"},
     {"prune", pruneMain, 1, 0, 0, optionPruneBefore | optionWait | optionDryRun, "DIR",
      "remove the oldest entries that no image needs which stays"},
-    {"unlock", unlockMain, 1, 0, 0, optionAllLocks, "DIR",
+    {"unlock", unlockMain, 1, 0, 0, optionAllLocks, "DIR | --all",
      "remove the lock that a dead process left"},
 };
 

@@ -90,6 +90,8 @@ TEST_F(ProgramTest, AMistakeNamesItsLineAndChangesNothing)
          "\"20251301000000\" but expected a date and a time that exist", 5},
         {"Operation: backup\nSecond timestamp: 20250229000000",
          "\"20250229000000\" but expected a date and a time that exist", 5},
+        {"Operation: restore\nId: 20251301000000",
+         "\"20251301000000\" but expected a date and a time that exist", 5},
         {"Operation: backup\nTablespace: ABCDEFGHIJKLMNOPQRS",
          "\"ABCDEFGHIJKLMNOPQRS\" but expected a name of at most 18 characters", 5},
         {"Operation: backuq",
