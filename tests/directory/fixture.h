@@ -18,9 +18,11 @@
 #include "support.h"
 
 // Asked before each OS-services call (with 0) and each semaphore call (with its flags, its step or
-// its command): the code that it shall fail with instead, a semaphore call's an errno; or 0. A
-// write that fails has written half; with onlyShort that is all that is wrong.
+// its command): the code that it shall fail with instead, a semaphore call's an errno; or 0. An
+// open that returns a warning is made. A transfer that fails has moved some bytes, a write else
+// half of them; with onlyShort that is all that is wrong.
 inline std::function<int(const std::string& call, int command)> onCall;
+inline int64_t movedByFailure = -1; // bytes; -1: as it comes
 constexpr int onlyShort = INT_MIN;
 
 // The same for each system call under the files, asked with its name and sizes: an errno, or 0.

@@ -15,6 +15,11 @@ static int enter(const char* name, int command)
     return onCall ? onCall(name, command) : 0;
 }
 
+static uint32_t movedOf(uint32_t usual)
+{
+    return movedByFailure < 0 ? usual : static_cast<uint32_t>(movedByFailure);
+}
+
 #define HOOK(name, parameters, arguments, command, failed)                                         \
     extern "C" int name parameters                                                                 \
     {                                                                                              \
@@ -23,13 +28,15 @@ static int enter(const char* name, int command)
         return code == 0 ? real arguments : failed;                                                \
     }
 HOOK(sqloopenp, (const char* path, unsigned word, unsigned bits, SQLO_FHANDLE* fh),
-     (path, word, bits, fh), 0, (*fh = sqloNoFile, code))
+     (path, word, bits, fh), 0,
+     (code > 0 ? real(path, word, bits, fh) : (*fh = sqloNoFile).descriptor, code))
 HOOK(sqloclose, (SQLO_FHANDLE fh), (fh), 0, (real(fh), code))
 HOOK(sqloread, (SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* done),
-     (fh, buffer, count, done), 0, (*done = 0, code))
+     (fh, buffer, count, done), 0,
+     (real(fh, buffer, movedOf(0), done), code == onlyShort ? 0 : code))
 HOOK(sqlowrite, (SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* done),
      (fh, buffer, count, done), 0,
-     (real(fh, buffer, count / 2, done), code == onlyShort ? 0 : code))
+     (real(fh, buffer, movedOf(count / 2), done), code == onlyShort ? 0 : code))
 HOOK(sqloseek, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* at),
      (fh, offset, origin, at), 0, code)
 HOOK(sqlochgfileptr, (SQLO_FHANDLE fh, long long offset, unsigned origin, long long* at),

@@ -1,11 +1,6 @@
-// What each function does when a call of the OS-services layer fails. The program's own definitions
-// of these calls stand before those of the shared library and forward to them.
+// What each function does when a call of the OS-services layer fails.
 
-#include <functional>
-#include <sstream>
-
-#include <dlfcn.h>
-
+#include "directory/fixture.h"
 #include "records.h"
 
 namespace
@@ -31,51 +26,28 @@ int lastMapped; // given to sqlzGetZRCInfo, which returns mappedCode while a fau
 
 void arm(const faultPlan& plan)
 {
+    static const char* const names[osCallCount] = {
+        "",         "sqloopenp",   "sqloclose",
+        "sqloread", "sqlowrite",   "sqloseek",
+        "sqlocopy", "sqlogmblkEx", "sqloMemBlockReallocate"};
     fault = plan;
     memset(calls, 0, sizeof calls);
     lastMapped = 0;
+    movedByFailure = plan.transferred;
+    onCall = [](const std::string& call, int) {
+        const int which = static_cast<int>(std::ranges::find(names, call) - names);
+        const bool isDue =
+            which != osCallCount && ++calls[which] == fault.at && fault.call == which;
+        return !isDue ? 0 : fault.code == 0 ? onlyShort : fault.code;
+    };
 }
 } // namespace
 
-// Whether a call that fails is made all the same: a positive code of an open is a warning.
-#define CALL(function, which, isMade, parameters, arguments)                                       \
-    int function parameters                                                                        \
-    {                                                                                              \
-        const bool failing = ++calls[which] == fault.at && fault.call == which;                    \
-        void* real = dlsym(RTLD_NEXT, #function);                                                  \
-        int rc = !failing || (isMade) ? reinterpret_cast<decltype(&function)>(real) arguments : 0; \
-        return failing ? fault.code : rc;                                                          \
-    }
-
-extern "C" {
-CALL(sqloopenp, osOpen, fault.code > 0,
-     (const char* path, unsigned int options, unsigned int permissions, SQLO_FHANDLE* fh),
-     (path, options, permissions, fh))
-CALL(sqloclose, osClose, true, (SQLO_FHANDLE fh), (fh))
-CALL(sqloread, osRead, true, (SQLO_FHANDLE fh, void* buffer, uint32_t count, uint32_t* moved),
-     (fh, buffer, failing ? fault.transferred : count, moved))
-CALL(sqlowrite, osWrite, true,
-     (SQLO_FHANDLE fh, const void* buffer, uint32_t count, uint32_t* moved),
-     (fh, buffer, failing ? fault.transferred : count, moved))
-CALL(sqloseek, osSeek, false,
-     (SQLO_FHANDLE fh, long long offset, unsigned int origin, long long* to),
-     (fh, offset, origin, to))
-CALL(sqlocopy, osCopy, false, (const char* source, const char* target, unsigned int options),
-     (source, target, options))
-CALL(sqlogmblkEx, osAllocate, false,
-     (SMemPool * pool, size_t size, unsigned int options, void** block, const char* file,
-      unsigned int line, unsigned int reserved),
-     (pool, size, options, block, file, line, reserved))
-CALL(sqloMemBlockReallocate, osReallocate, false,
-     (void** block, size_t size, unsigned int options, const char* file, unsigned int line),
-     (block, size, options, file, line))
-
-int sqlzGetZRCInfo(int code)
+extern "C" int sqlzGetZRCInfo(int code)
 {
     lastMapped = code;
-    void* real = dlsym(RTLD_NEXT, "sqlzGetZRCInfo");
-    return fault.call != osNone ? mappedCode : reinterpret_cast<int (*)(int)>(real)(code);
-}
+    static const auto real = realOf(&sqlzGetZRCInfo, "sqlzGetZRCInfo");
+    return fault.call != osNone ? mappedCode : real(code);
 }
 
 struct failure {
