@@ -114,3 +114,23 @@ TEST_F(ReaderTest, WhatCannotBeProvenIsReadAgainOrUnderTheLock)
         EXPECT_EQ(0, removeSetsLeft()) << row.what;
     }
 }
+
+// An entry that is damaged in the history file is another matter in each state of the pair.
+TEST_F(ReaderTest, TheShadowHelpsWithADamagedEntryOnlyWhereItHoldsTheSame)
+{
+    const struct {
+        const char* files;
+        int result;
+    } rows[] = {{" 10/ 10", 10},
+                {" 10/C10", 10},
+                {" 10/P10", 10},
+                {" 10/Q10", HISTORY_FILE_DAMAGED},
+                {"C10/ 10", HISTORY_FILE_DAMAGED},
+                {"P10/ 10", 10}};
+    for (const auto& row : rows) {
+        Files files = filesOf(row.files);
+        files[SQLUH_HISTORY_NAME][2000] ^= 1;
+        store(files);
+        EXPECT_EQ(row.result, readCommitted()) << row.files;
+    }
+}
