@@ -27,7 +27,8 @@ struct stanzaReader {
     // The entry being read.
     historyRecord* record; // null between entries
     unsigned int firstLine;
-    uint32_t seen; // a bit for each field
+    unsigned int noteLine; // of its note, which is refused by its length at the end
+    uint32_t seen;         // a bit for each field
 };
 static_assert(numRecordFields <= 32);
 
@@ -114,8 +115,8 @@ static int endEntry(stanzaReader* reader)
             rc = field->settle(field, reader->record, &reader->value);
     }
     if (rc == valueRefused)
-        return mistakeAt(reader, reader->firstLine, reader->value.text, reader->value.length, "%s",
-                         reader->value.expected);
+        return mistakeAt(reader, reader->value.length != 0 ? reader->noteLine : reader->firstLine,
+                         reader->value.text, reader->value.length, "%s", reader->value.expected);
     if (rc == 0 && (!joinObjectPart(reader->record) || !addRecord(reader->list, reader->record)))
         rc = noMemory;
     if (rc == 0)
@@ -146,6 +147,8 @@ static int takeField(stanzaReader* reader, unsigned int number)
 {
     const recordField* field = &recordFields[number];
     reader->seen |= uint32_t{1} << number;
+    if (field->at == offsetof(historyRecord, data.noteText))
+        reader->noteLine = reader->line;
     if (isInSqlca(field))
         reader->record->entry.sqlcaLength = sqlcaLineLength;
     int rc = field->take(field, reader->record, &reader->value);

@@ -107,7 +107,7 @@ TEST_F(ProgramTest, AMistakeNamesItsLineAndChangesNothing)
         {"Operation: B\nFirst text: 1234567890123",
          "\"1234567890123\" but expected at most 12 characters", 5},
         {"Operation: B\nNote: 1234567890123456789012345678901",
-         "\"1234567890123456789012345678901\" but expected a note of at most 30 characters", 4},
+         "\"1234567890123456789012345678901\" but expected a note of at most 30 characters", 5},
         {"Operation: B\nCommand: a\\x00", "\"a\\x00\" but expected a text without zero bytes", 5},
         {"Operation: B\nCommand: \\q",
          "\"\\\\q\" but expected one of the escapes \\n, \\t, \\\\ and \\xHH", 5},
