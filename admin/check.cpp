@@ -99,7 +99,7 @@ static void checkFiles(checkReport* report)
         addProblem(report, exitDamaged, "the shadow is to be made anew");
 }
 
-static void checkLock(checkReport* report)
+static void judgeLock(checkReport* report)
 {
     if (!report->lockKnown)
         return;
@@ -297,7 +297,7 @@ int checkMain(commandLine* line)
         return rc;
     report.lockKnown = queryLock(&line->place, &lock, &report.lock);
     checkFiles(&report);
-    checkLock(&report);
+    judgeLock(&report);
     rc = checkImages(&report);
     if (rc == 0 && line->json)
         showCheckJson(&report);

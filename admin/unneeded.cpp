@@ -71,7 +71,7 @@ static void showMarked(markedImages* marked, const commandLine* line, bool mark,
     }
 }
 
-static bool isSameTime(const markedImages* marked, int a, int b)
+static bool isSameImage(const markedImages* marked, int a, int b)
 {
     const historyEntry* entries = marked->catalog.history.entries;
     return strcmp(entries[a].timestamp, entries[b].timestamp) == 0;
@@ -83,7 +83,7 @@ static void shareMarks(markedImages* marked)
     int count = marked->catalog.history.numEntries;
     for (int first = 0, end = 0; first < count; first = end) {
         bool any = false;
-        for (end = first; end < count && isSameTime(marked, first, end); end++)
+        for (end = first; end < count && isSameImage(marked, first, end); end++)
             any = any || marked->marks[end];
         memset(marked->marks + first, any, static_cast<size_t>(end - first));
     }
@@ -174,7 +174,7 @@ static void markNeeders(markedImages* marked, int position)
     for (int i = position; i < marked->catalog.history.numEntries; i++) {
         const imageChains* chains = &walk->images[i];
         bool isImageEntry = isImage(&marked->catalog.history.entries[i]);
-        bool isNeeded = isImageEntry && isSameTime(marked, i, position);
+        bool isNeeded = isImageEntry && isSameImage(marked, i, position);
         inAll = inAll || (isNeeded && chains->numLinks == 0);
         bool needs = inAll;
         for (int link = chains->firstLink; link < chains->firstLink + chains->numLinks; link++) {
