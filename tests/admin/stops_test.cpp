@@ -17,7 +17,7 @@ class StopTest : public HistoryTest
     static void prepare(int stopAt, stopKind stops, bool* happened)
     {
         if (stops == killed) {
-            disk = {true, {stopAt / 2, stopAt % 2 * size_t{512}}, false, {}, false};
+            disk = {true, {stopAt / 2, size_t{stopAt % 2 == 0 ? 0u : 512u}}, false, {}, false};
             return;
         }
         onCall = [=, steps = 0](const std::string& call, int) mutable {
