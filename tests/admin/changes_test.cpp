@@ -186,6 +186,9 @@ TEST_F(ChangeTest, WhatIsSaidAndWhatIsThereAfterwards)
         {KILLED, "repair --dry-run h/",
          "zq3hist: cannot take the lock: a process died while it held the lock, h/\n" UNLOCK "[4]",
          "4 3"},
+        {KILLED, "restore --dry-run h/ image",
+         "zq3hist: cannot take the lock: a process died while it held the lock, h/\n" UNLOCK "[4]",
+         "4 3"},
         {SPOIL("bak", "2000"), "load h/ more",
          "zq3hist: cannot append to the history: the entry at offset 1803 is damaged, "
          "h/zq3rhist.bak\nzq3hist: hint: zq3hist repair h/  # makes the shadow anew from the "
