@@ -40,7 +40,8 @@ static void noteGap(catalogRead* read, const zq3HistoryData* record)
 {
     imageCatalog* catalog = read->catalog;
     uint32_t* last = &read->lastNumbers[record->entryNode];
-    if (record->entryNumber > *last + 1)
+    // A node's first entry in the history follows nothing.
+    if (*last != 0 && record->entryNumber > *last && record->entryNumber - *last > 1)
         catalog->gaps[catalog->numGaps++] = {*last + 1, record->entryNumber - 1};
     *last = record->entryNumber;
 }

@@ -273,16 +273,21 @@ TEST_F(QuestionTest, AnswersInFull)
          "zq3hist: no image is there from then on: 20260101000000, h/\n[5]"},
         {"needed-by h/ 20250103010000", "20250105010000  delta        database\n"
                                         "1 of 7 images need 20250103010000\n[0]"},
+        {"images --last 1 d/",
+         "TIMESTAMP       KIND         SCOPE       TABLESPACES  IMAGES  RESTORE\n"
+         "20250104000000  delta        database              1       4  complete\n"
+         "6 images, 1 shown, 1 incomplete; newest that can be restored: 20250104000000\n[0]"},
         {"unneeded --keep 1 d/",
          "20250101010000  delta        database\n"
-         "1 of 5 images are not needed by restores from 20250103000000\n[0]"},
+         "1 of 6 images are not needed by restores from 20250104000000\n[0]"},
         {"needed-by d/ 20250102000000",
          "20250103000000  delta        database\n20250103000000  delta        database\n"
-         "2 of 5 images need 20250102000000\n[0]"},
+         "20250104000000  delta        database\n"
+         "3 of 6 images need 20250102000000\n[0]"},
         {"plan d/ 20250101010000",
          "zq3hist: tablespace B lacks the image that a restore used, which has no name, "
          "20250101010000\n"
-         "zq3hist: hint: zq3hist plan d/ 20250103000000  # the newest image that can be "
+         "zq3hist: hint: zq3hist plan d/ 20250104000000  # the newest image that can be "
          "restored\n[6]"},
         {"plan h/ 20250106010000",
          "zq3hist: the image 20250106010000 failed, h/\n"
@@ -299,8 +304,10 @@ TEST_F(QuestionTest, AnswersInFull)
     run("load e/", "", "mkdir e s d; ");
     const std::string twice = stanza("backup", 20250102000000, "", {"A"}) +
                               stanza("backup", 20250103000000, "Type: delta\n", {"A"});
-    run("load d/", stanza("restore", 20250101000000, "", {"B"}) +
-                       stanza("backup", 20250101010000, "Type: delta\n", {"B"}) + twice + twice);
+    run("load d/",
+        stanza("restore", 20250101000000, "", {"B"}) +
+            stanza("backup", 20250101010000, "Type: delta\n", {"B"}) + twice + twice +
+            stanza("backup", 20250104000000, "Type: delta\nNode: 2\nNumber: 50\n", {"A"}));
     run("load s/", stanza("backup", 20250101000000, "Type: delta\n", {"A"}));
     spill(root + "have", "# on hand\n 20250101010000\n\n2025-01-02 01:00:00\r\n20250109010000\n");
     for (const auto& row : rows) {
