@@ -66,9 +66,10 @@ static bool isDigits(const char* text, size_t length)
 // may hold it.
 static bool isOdd(const recordField* field, const char* text, size_t length)
 {
-    bool isTimestamp = isDigits(text, length) && isTime(text);
+    bool areDigits = isDigits(text, length);
+    bool isTimestamp = areDigits && isTime(text);
     return (field->rule == oneTimestamp && !isTimestamp) ||
-           (field->rule == oneImage && isDigits(text, length) && !isTimestamp) ||
+           (field->rule == oneImage && areDigits && !isTimestamp) ||
            (field->rule == shortName && length >= zq3TablespaceNameCapacity);
 }
 

@@ -98,7 +98,7 @@ int pruneMain(commandLine* line);
 int unlockMain(commandLine* line);
 
 // Runs the subcommand that argv[1] names and returns its exit status. hasChanged tells afterwards
-// whether it was one that changes a history, and did what it was asked for.
+// whether it was one that could have been rehearsed, and did what it was asked for.
 int runProgram(int argc, char** argv);
 bool hasChanged(void);
 
